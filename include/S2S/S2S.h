@@ -1,0 +1,10 @@
+// Umbrella header: every exported header of libs2s.
+#ifndef S2S_S2S_H_
+#define S2S_S2S_H_
+
+#include "S2S/export.h"
+#include "S2S/logger.h"
+#include "S2S/pobject.h"
+#include "S2S/result_codes.h"
+
+#endif  // S2S_S2S_H_

@@ -1,0 +1,15 @@
+// Uses the installed headers and library the way a host program would.
+#include <S2S/S2S.h>
+
+#include <cstdio>
+
+int main() {
+  S2S::PObject msg;
+  msg["name"] = "task";
+  msg["id"] = 7u;
+  if (msg.toString() != "{\"id\": 7, \"name\": \"task\"}") return 1;
+  if (std::string(S2S::ResultMessage(-5)) != "Protocal error") return 1;
+  if (S2S::Logger::Initialize(S2S::Logger::Stdout, 3, "", 0) != 0) return 1;
+  std::puts("consumer ok");
+  return 0;
+}

@@ -1,0 +1,277 @@
+#include "S2S/logger.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <map>
+#include <regex>
+#include <sstream>
+#include <thread>
+#include <vector>
+
+#include "testutil.h"
+
+#define S2S_LOG_AREA "logtest"
+#include "S2S/log.h"
+
+namespace {
+
+using S2S::Logger;
+using s2s_test::CaptureFd;
+using s2s_test::ReadFile;
+using s2s_test::SyslogCapture;
+using s2s_test::TempDir;
+
+bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
+
+std::vector<std::string> Lines(const std::string& text) {
+  std::vector<std::string> out;
+  std::istringstream in(text);
+  std::string line;
+  while (std::getline(in, line)) out.push_back(line);
+  return out;
+}
+
+// Every test leaves the logger as a program finds it: system log, errors.
+class LoggerTest : public ::testing::Test {
+ protected:
+  void TearDown() override {
+    Logger::Destroy();
+    Logger::Initialize(Logger::Syslog, Logger::Error, "", 50);
+  }
+  TempDir dir_;
+};
+
+TEST_F(LoggerTest, StartsOnSystemLogWithErrorsOnly) {
+  EXPECT_EQ(Logger::GetType(), Logger::Syslog);
+  EXPECT_EQ(Logger::GetLevel(), 3);
+  SyslogCapture sys;
+  Logger::LogMsg(Logger::Error, "first %d\n", 1);
+  Logger::LogMsg(Logger::Warning, "dropped\n");
+  ASSERT_EQ(sys.Messages().size(), 1u);
+  EXPECT_EQ(sys.Messages()[0], "first 1\n");
+}
+
+TEST_F(LoggerTest, SystemLogUsesErrorPriorityForEveryLevel) {
+  ASSERT_EQ(Logger::Initialize(Logger::Syslog, Logger::Debug, "", 0), 0);
+  SyslogCapture sys;
+  Logger::LogMsg(Logger::Debug, "debug line\n");
+  Logger::LogMsg(Logger::Info, "info line\n");
+  ASSERT_EQ(sys.Priorities().size(), 2u);
+  EXPECT_EQ(sys.Priorities()[0], 3);
+  EXPECT_EQ(sys.Priorities()[1], 3);
+}
+
+TEST_F(LoggerTest, StandardStreamsAreTimestampedAndFiltered) {
+  const std::regex stamped(
+      "[A-Z][a-z]{2} [ 0-9][0-9] [0-9]{2}:[0-9]{2}:[0-9]{2} hello 42");
+  {
+    CaptureFd out(1);
+    ASSERT_EQ(Logger::Initialize(Logger::Stdout, Logger::Note, "", 0), 0);
+    Logger::LogMsg(Logger::Note, "hello %d\n", 42);
+    Logger::LogMsg(Logger::Info, "too verbose\n");
+    std::vector<std::string> lines = Lines(out.Text());
+    ASSERT_EQ(lines.size(), 1u);
+    EXPECT_TRUE(std::regex_match(lines[0], stamped)) << lines[0];
+  }
+  {
+    CaptureFd err(2);
+    ASSERT_EQ(Logger::Initialize(Logger::Stderr, Logger::Debug, "", 0), 0);
+    Logger::LogMsg(Logger::Debug, "hello %d\n", 42);
+    std::vector<std::string> lines = Lines(err.Text());
+    ASSERT_EQ(lines.size(), 1u);
+    EXPECT_TRUE(std::regex_match(lines[0], stamped)) << lines[0];
+  }
+  EXPECT_EQ(Logger::GetSize(), -1);
+}
+
+TEST_F(LoggerTest, PrefixNamesTagAreaAndLine) {
+  CaptureFd out(1);
+  ASSERT_EQ(Logger::Initialize(Logger::Stdout, Logger::Debug, "", 0), 0);
+  const int line = __LINE__ + 1;
+  LOG_WARNING("value %s", "v");
+  LOG_NOTE_NONL("no newline");
+  LOG_DEBUG("after");
+  std::string text = out.Text();
+  EXPECT_NE(text.find("[WARNING] S2S/logtest(" + std::to_string(line) +
+                      "): value v\n"),
+            std::string::npos)
+      << text;
+  // The message after one without a newline continues on its line.
+  std::vector<std::string> lines = Lines(text);
+  ASSERT_EQ(lines.size(), 2u);
+  EXPECT_NE(lines[1].find("): no newline"), std::string::npos);
+  EXPECT_NE(lines[1].find("[DEBUG] S2S/logtest("), std::string::npos);
+}
+
+TEST_F(LoggerTest, InitializeFailuresKeepThePreviousStream) {
+  EXPECT_EQ(Logger::Initialize(Logger::File, Logger::Info, "", 5), -1);
+  EXPECT_EQ(Logger::GetType(), Logger::File);  // stored before failing
+  EXPECT_EQ(Logger::GetLevel(), Logger::Info);
+  EXPECT_EQ(Logger::GetStream(), nullptr);
+  EXPECT_EQ(Logger::GetRotateCount(), 50);
+  SyslogCapture sys;
+  Logger::LogMsg(Logger::Error, "nowhere\n");
+  EXPECT_TRUE(sys.Messages().empty());
+
+  ASSERT_EQ(Logger::Initialize(Logger::Stdout, Logger::Error, "", 0), 0);
+  EXPECT_EQ(Logger::Initialize(Logger::File, Logger::Debug,
+                               dir_.Sub("missing/dir/log"), 5),
+            -1);
+  EXPECT_EQ(Logger::GetStream(), stdout);
+  EXPECT_TRUE(Logger::GetPath().empty());
+
+  // Out-of-range types select a file as well.
+  std::string path = dir_.Sub("any.log");
+  ASSERT_EQ(
+      Logger::Initialize(static_cast<Logger::Type>(9), Logger::Error, path, 7),
+      0);
+  EXPECT_EQ(Logger::GetType(), Logger::File);
+  EXPECT_EQ(Logger::GetRotateCount(), 7);
+  EXPECT_EQ(Logger::GetSize(), 0);
+}
+
+TEST_F(LoggerTest, DestroyOfFileLogSwitchesToStandardOutput) {
+  std::string path = dir_.Sub("d.log");
+  ASSERT_EQ(Logger::Initialize(Logger::File, Logger::Debug, path, 3), 0);
+  Logger::LogMsg(Logger::Error, "into the file\n");
+  Logger::Destroy();
+  EXPECT_EQ(Logger::GetType(), Logger::Stderr);
+  EXPECT_EQ(Logger::GetStream(), stdout);
+  EXPECT_EQ(Logger::GetLevel(), Logger::Error);
+  EXPECT_EQ(Logger::GetSize(), -1);
+  EXPECT_EQ(Logger::GetRotateCount(), 50);
+  EXPECT_TRUE(Logger::GetPath().empty());
+  CaptureFd out(1);
+  Logger::LogMsg(Logger::Error, "after destroy\n");
+  Logger::LogMsg(Logger::Warning, "filtered\n");
+  EXPECT_NE(out.Text().find("after destroy"), std::string::npos);
+  EXPECT_EQ(out.Text().find("filtered"), std::string::npos);
+  EXPECT_NE(ReadFile(path).find("into the file"), std::string::npos);
+}
+
+TEST_F(LoggerTest, DestroyOfOtherDestinationsChangesNothing) {
+  ASSERT_EQ(Logger::Initialize(Logger::Syslog, Logger::Info, "", 0), 0);
+  Logger::Destroy();
+  EXPECT_EQ(Logger::GetType(), Logger::Syslog);
+  EXPECT_EQ(Logger::GetLevel(), Logger::Info);
+  EXPECT_EQ(Logger::GetStream(), nullptr);
+}
+
+// Writes messages of `len` bytes of text (plus the 16-byte timestamp) until
+// `rotations` rotations happened; returns the number written.
+int WriteUntilRotated(int len, int rotations) {
+  std::string text(len - 1, 'x');
+  int written = 0;
+  int seen = 0;
+  int before = Logger::GetSize();
+  while (seen < rotations) {
+    Logger::LogMsg(Logger::Error, "%s\n", text.c_str());
+    ++written;
+    int now = Logger::GetSize();
+    if (now < before) ++seen;
+    before = now;
+  }
+  return written;
+}
+
+TEST_F(LoggerTest, RotatesOnTheMessageThatCrossesOneMebibyte) {
+  std::string path = dir_.Sub("r.log");
+  ASSERT_EQ(Logger::Initialize(Logger::File, Logger::Error, path, 50), 0);
+  const int kText = 1000;
+  const int kPerMessage = kText + 16;
+  int messages = WriteUntilRotated(kText, 1);
+  EXPECT_EQ(messages, Logger::kRotateSize / kPerMessage + 1);
+  EXPECT_EQ(Logger::GetSize(), 0);
+  // The crossing message is the last line of the rotated file.
+  EXPECT_EQ(Lines(ReadFile(path + "_0")).size(), static_cast<size_t>(messages));
+  EXPECT_EQ(ReadFile(path), "");
+  Logger::LogMsg(Logger::Error, "next\n");
+  EXPECT_NE(ReadFile(path).find("next"), std::string::npos);
+}
+
+TEST_F(LoggerTest, RotationDepthKeepsCountMinusOneFiles) {
+  struct Case {
+    int depth;
+    int rotations;
+    std::vector<int> kept;
+  };
+  const std::vector<Case> cases = {
+      {0, 3, {0}},
+      {1, 3, {0}},
+      {3, 5, {0, 1}},
+      {50, 60, {}},  // filled below: 0..48
+  };
+  for (Case c : cases) {
+    if (c.depth == 50) {
+      for (int i = 0; i < 49; ++i) c.kept.push_back(i);
+    }
+    TempDir dir;
+    std::string path = dir.Sub("depth.log");
+    ASSERT_EQ(Logger::Initialize(Logger::File, Logger::Error, path, c.depth),
+              0);
+    WriteUntilRotated(256 * 1024, c.rotations);
+    for (int k = -1; k <= c.depth + 1; ++k) {
+      bool want = std::find(c.kept.begin(), c.kept.end(), k) != c.kept.end();
+      EXPECT_EQ(Exists(path + "_" + std::to_string(k)), want)
+          << "depth " << c.depth << " file _" << k;
+    }
+    Logger::Destroy();
+  }
+}
+
+TEST_F(LoggerTest, FailedRotationSilencesUntilNextInitialize) {
+  std::string path = dir_.Sub("s.log");
+  ASSERT_EQ(Logger::Initialize(Logger::File, Logger::Error, path, 5), 0);
+  unlink(path.c_str());  // the rename of the live file will fail
+  WriteUntilRotated(512 * 1024, 1);
+  EXPECT_EQ(Logger::GetStream(), nullptr);
+  Logger::LogMsg(Logger::Error, "lost\n");
+  EXPECT_FALSE(Exists(path));
+  ASSERT_EQ(Logger::Initialize(Logger::File, Logger::Error, path, 5), 0);
+  Logger::LogMsg(Logger::Error, "back\n");
+  EXPECT_NE(ReadFile(path).find("back"), std::string::npos);
+}
+
+TEST_F(LoggerTest, ConcurrentWritersLoseAndInterleaveNothing) {
+  std::string path = dir_.Sub("c.log");
+  ASSERT_EQ(Logger::Initialize(Logger::File, Logger::Error, path, 50), 0);
+  const int kThreads = 8;
+  const int kLines = 4000;
+  const std::string pad(90, 'p');
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([t, &pad] {
+      for (int i = 0; i < kLines; ++i) {
+        Logger::LogMsg(Logger::Error, "writer %d line %d %s\n", t, i,
+                       pad.c_str());
+      }
+    });
+  }
+  for (std::thread& th : threads) th.join();
+
+  std::string all;
+  for (int k = 48; k >= 0; --k) all += ReadFile(path + "_" + std::to_string(k));
+  all += ReadFile(path);
+  const std::regex line_re(
+      "[A-Z][a-z]{2} [ 0-9][0-9] [0-9:]{8} writer ([0-9]+) line ([0-9]+) "
+      "p{90}");
+  std::map<int, std::vector<int>> seen;
+  int total = 0;
+  for (const std::string& line : Lines(all)) {
+    std::smatch m;
+    ASSERT_TRUE(std::regex_match(line, m, line_re)) << line;
+    seen[std::stoi(m[1])].push_back(std::stoi(m[2]));
+    ++total;
+  }
+  EXPECT_EQ(total, kThreads * kLines);
+  for (int t = 0; t < kThreads; ++t) {
+    const std::vector<int>& order = seen[t];
+    ASSERT_EQ(order.size(), static_cast<size_t>(kLines));
+    for (int i = 0; i < kLines; ++i) ASSERT_EQ(order[i], i);
+  }
+  EXPECT_TRUE(Exists(path + "_0"));  // the run crossed at least one rotation
+}
+
+}  // namespace
