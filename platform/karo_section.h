@@ -2,15 +2,20 @@
  * semaphores of the host platform layer.
  *
  * A section file is text: "[Section]" lines, each followed by its pairs, one
- * per line, written as "\tkey=\"value\"\n". Reading tolerates blank lines
- * and spaces around names, keys and values. Every write replaces the file
- * atomically (temporary file in the same directory, fsync, rename), so a
- * reader never sees a half-written file and a writer killed at any moment
- * leaves either the old or the new file. Keys and values that the format
- * cannot hold (a line break, a NUL; in keys also '=', '[' , ']' and quotes;
- * leading or trailing blanks) are refused with KERR_VALUE_UNHOLDABLE and
- * nothing is written. A value may hold double quotes: everything between the
- * first quote after '=' and the last quote of the line is the value.
+ * per line, written as "\tkey=\"value\"\n". Reading tolerates blank lines,
+ * lines starting with '#', spaces around names, keys and values, and
+ * unquoted values. Every write replaces the file atomically (temporary file
+ * in the same directory, fsync, rename), so a reader never sees a
+ * half-written file and a writer killed at any moment leaves either the old
+ * or the new file (and perhaps a stray ".name.XXXXXX" temporary file). A
+ * rewrite keeps the content, not comments or spacing.
+ *
+ * What the format cannot hold is refused with KERR_VALUE_UNHOLDABLE and
+ * nothing is written: a section name or key that is empty, starts with '#',
+ * has leading or trailing blanks, or holds a line break or '[' or ']' (keys
+ * also '=' and '"'); a value holding a line break. A value may hold double
+ * quotes and blanks: everything between the first quote after '=' and the
+ * last quote of the line is the value.
  *
  * File paths given to these functions are used as they are: callers resolve
  * fixed system paths under the root first (karo_root.h). None of the file
@@ -70,7 +75,8 @@ const char* KLIBCSzListGet(const KSZLIST* list, int i);
 /* ---- Formatted strings. ---- */
 /* Returns a newly allocated string formatted like printf, or NULL
  * (KERR_NO_MEMORY, KERR_INVALID_ARG). Release it with KLIBCStrPut. */
-char* KLIBCStrGet(const char* format, ...) __attribute__((format(printf, 1, 2)));
+char* KLIBCStrGet(const char* format, ...)
+    __attribute__((format(printf, 1, 2)));
 /* Releases a string from KLIBCStrGet; NULL is ignored. */
 void KLIBCStrPut(char* s);
 
@@ -125,13 +131,14 @@ int KLIBCFileAddSection(const char* file, const char* section,
 int KLIBCFileEnumSection(const char* file, KSZLIST* out);
 
 /* ---- System V semaphores (binary, with SEM_UNDO). ---- */
-/* Opens the semaphore set of `key`, creating it with value 1 when it does not
- * exist yet. Returns a handle >= 0, or -1 (KERR_LOCK). */
+/* Opens the semaphore set of `key` (not IPC_PRIVATE), creating it with value
+ * 1 when it does not exist yet; a set another process is still creating is
+ * waited for. Returns a handle >= 0, or -1 (KERR_LOCK). */
 int KLIBCSemOpen(int key);
 /* Takes the semaphore, waiting as long as needed; the kernel gives it back if
  * the process dies holding it. 0, or -1 (KERR_LOCK). */
 int KLIBCSemLock(int handle);
-/* Gives it back; 0, or -1 (KERR_LOCK). */
+/* Gives it back; only the holder may call it. 0, or -1 (KERR_LOCK). */
 int KLIBCSemUnlock(int handle);
 /* Forgets the handle (the semaphore itself stays for other processes);
  * 0, or -1 for an invalid handle. */

@@ -1,0 +1,224 @@
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <memory>
+#include <random>
+#include <string>
+
+#include "karo_err.h"
+#include "karo_section.h"
+#include "testutil.h"
+
+namespace {
+
+using s2s_test::ReadFile;
+using s2s_test::TempDir;
+using s2s_test::WriteFile;
+
+struct HashDeleter {
+  void operator()(KSZHASH* h) const { KLIBCSzHashFree(h); }
+};
+using Hash = std::unique_ptr<KSZHASH, HashDeleter>;
+
+Hash MakeHash(std::initializer_list<std::pair<const char*, const char*>> kv) {
+  Hash h(KLIBCSzHashAlloc(64));
+  for (const auto& p : kv) KLIBCSzHashSetValue(h.get(), p.first, p.second);
+  return h;
+}
+
+std::string Value(const std::string& file, const char* section,
+                  const char* key) {
+  char buf[256];
+  if (KLIBCFileGetSectionValue(file.c_str(), section, key, buf, sizeof buf) <
+      0) {
+    return "<error " + std::to_string(KLIBCErrGet()) + ">";
+  }
+  return buf;
+}
+
+class SectionFileTest : public ::testing::Test {
+ protected:
+  TempDir dir_;
+  std::string file_ = dir_.Sub("reg.info");
+};
+
+TEST_F(SectionFileTest, WritesTheDocumentedFormatAndReadsItBack) {
+  auto a = MakeHash({{"RunningID", "c1"}, {"quote", "say \"hi\" \""}});
+  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "SHARE_a", a.get(), nullptr), 1);
+  auto b = MakeHash({{"status", "idle"}});
+  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "TASK_1", b.get(),
+                                KLIBC_SECTION_PAIR_FORMAT),
+            1);
+  EXPECT_EQ(ReadFile(file_),
+            "[SHARE_a]\n\tRunningID=\"c1\"\n\tquote=\"say \"hi\" \"\"\n"
+            "[TASK_1]\n\tstatus=\"idle\"\n");
+  struct stat st;
+  ASSERT_EQ(stat(file_.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0644u);
+
+  EXPECT_EQ(Value(file_, "SHARE_a", "quote"), "say \"hi\" \"");
+  Hash got(KLIBCSzHashAlloc(8));
+  EXPECT_EQ(KLIBCFileGetSection(file_.c_str(), "SHARE_a", got.get()), 1);
+  EXPECT_EQ(KLIBCSzHashCount(got.get()), 2);
+  EXPECT_EQ(KLIBCFileGetSection(file_.c_str(), "SHARE_b", got.get()), 0);
+
+  KSZLIST* names = KLIBCSzListAlloc();
+  EXPECT_EQ(KLIBCFileEnumSection(file_.c_str(), names), 2);
+  EXPECT_STREQ(KLIBCSzListGet(names, 1), "TASK_1");
+  KLIBCSzListFree(names);
+}
+
+TEST_F(SectionFileTest, ModifySetAndAddKeepOtherSectionsAndKeys) {
+  auto a = MakeHash({{"k1", "1"}, {"k2", "2"}});
+  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "A", a.get(), nullptr), 1);
+  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "B", a.get(), nullptr), 1);
+
+  auto mod = MakeHash({{"k2", "two"}, {"k3", ""}});
+  EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "A", 0, mod.get(), 0, 0), 1);
+  EXPECT_EQ(Value(file_, "A", "k1"), "1");
+  EXPECT_EQ(Value(file_, "A", "k2"), "two");
+  EXPECT_EQ(Value(file_, "A", "k3"), "");
+  EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "C", 0, mod.get(), 0, 0), 0);
+
+  EXPECT_EQ(KLIBCFileSetSection(file_.c_str(), "B", 0, mod.get(), nullptr), 2);
+  EXPECT_EQ(Value(file_, "B", "k1"),
+            "<error " + std::to_string(KERR_NOT_FOUND) + ">");
+  EXPECT_EQ(KLIBCFileSetSection(file_.c_str(), "C", 0, mod.get(), nullptr), -1);
+  EXPECT_EQ(KLIBCErrGet(), KERR_NOT_FOUND);
+
+  // Adding an existing section replaces it instead of duplicating it.
+  EXPECT_EQ(KLIBCFileAddSection(file_.c_str(), "A", a.get(), nullptr), 1);
+  EXPECT_EQ(Value(file_, "A", "k2"), "2");
+  KSZLIST* names = KLIBCSzListAlloc();
+  EXPECT_EQ(KLIBCFileEnumSection(file_.c_str(), names), 2);
+  KLIBCSzListFree(names);
+}
+
+TEST_F(SectionFileTest, MissingFileAndSmallBuffer) {
+  char buf[4];
+  EXPECT_EQ(KLIBCFileExist(file_.c_str()), 0);
+  EXPECT_EQ(KLIBCFileGetSectionValue(file_.c_str(), "A", "k", buf, 4), -1);
+  EXPECT_EQ(KLIBCErrGet(), KERR_FILE_NOT_FOUND);
+  auto mod = MakeHash({{"k", "long"}});
+  EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "A", 0, mod.get(), 0, 0),
+            -1);
+  EXPECT_EQ(KLIBCErrGet(), KERR_FILE_NOT_FOUND);
+  EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "A", 0, mod.get(), 1, 0), 0);
+  EXPECT_EQ(KLIBCFileExist(file_.c_str()), 1);
+
+  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "A", mod.get(), nullptr), 1);
+  EXPECT_EQ(KLIBCFileGetSectionValue(file_.c_str(), "A", "k", buf, 4), -1);
+  EXPECT_EQ(KLIBCErrGet(), KERR_BUFFER_TOO_SMALL);
+  char big[5];
+  EXPECT_EQ(KLIBCFileGetSectionValue(file_.c_str(), "A", "k", big, 5), 4);
+}
+
+TEST_F(SectionFileTest, ReadsWhatAPersonTypes) {
+  ASSERT_TRUE(WriteFile(file_,
+                        "# registry\n\n  [ A ]  \r\n"
+                        "k1 = \"v 1\"   \n\n\tk2=plain\n[B]\n[A]\nk3=\"\"\n"));
+  EXPECT_EQ(Value(file_, "A", "k1"), "v 1");
+  EXPECT_EQ(Value(file_, "A", "k2"), "plain");
+  EXPECT_EQ(Value(file_, "A", "k3"), "");
+  KSZLIST* names = KLIBCSzListAlloc();
+  EXPECT_EQ(KLIBCFileEnumSection(file_.c_str(), names), 2);
+  KLIBCSzListFree(names);
+
+  for (const char* bad : {"k=\"v\"\n", "[A]\nno equals\n", "[A]\n=v\n", "[A\n",
+                          "[]\n", "[A]\nk=\"open\n"}) {
+    ASSERT_TRUE(WriteFile(file_, bad));
+    KSZLIST* list = KLIBCSzListAlloc();
+    EXPECT_EQ(KLIBCFileEnumSection(file_.c_str(), list), -1) << bad;
+    EXPECT_EQ(KLIBCErrGet(), KERR_FILE_FORMAT) << bad;
+    KLIBCSzListFree(list);
+  }
+}
+
+TEST_F(SectionFileTest, RefusesWhatTheFormatCannotHold) {
+  auto good = MakeHash({{"k", "v"}});
+  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "A", good.get(), nullptr), 1);
+  const std::string before = ReadFile(file_);
+
+  for (const char* section : {"", "a]b", "[x", "line\nbreak", " lead", "#c"}) {
+    EXPECT_EQ(KLIBCFileAddSection(file_.c_str(), section, good.get(), nullptr),
+              -1)
+        << section;
+    EXPECT_EQ(KLIBCErrGet(), KERR_VALUE_UNHOLDABLE);
+  }
+  for (const char* key : {"a=b", "q\"", "[k", "trail ", "cr\r", ""}) {
+    Hash h = MakeHash({{key, "v"}});
+    EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "A", 0, h.get(), 0, 0), -1)
+        << key;
+    EXPECT_EQ(KLIBCErrGet(), KERR_VALUE_UNHOLDABLE);
+  }
+  for (const char* value : {"two\nlines", "cr\r"}) {
+    Hash h = MakeHash({{"k", value}});
+    EXPECT_EQ(KLIBCFileSetSection(file_.c_str(), "A", 0, h.get(), nullptr), -1);
+    EXPECT_EQ(KLIBCErrGet(), KERR_VALUE_UNHOLDABLE);
+  }
+  EXPECT_EQ(KLIBCFileAddSection(file_.c_str(), "A", good.get(), "%s=%s\n"), -1);
+  EXPECT_EQ(KLIBCErrGet(), KERR_INVALID_ARG);
+  EXPECT_EQ(ReadFile(file_), before);
+}
+
+// The writer rewrites a large file over and over; wherever SIGKILL lands, the
+// file on disk is a whole old or new version.
+TEST_F(SectionFileTest, WriterKilledAtRandomLeavesAParsableFile) {
+  std::mt19937 rng(12345);
+  for (int round = 0; round < 20; ++round) {
+    int ready[2];
+    ASSERT_EQ(pipe(ready), 0);
+    pid_t pid = fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+      close(ready[0]);
+      Hash h(KLIBCSzHashAlloc(64));
+      for (int i = 0;; ++i) {
+        std::string v(200, static_cast<char>('a' + i % 26));
+        for (int k = 0; k < 20; ++k) {
+          KLIBCSzHashSetValue(h.get(), ("key" + std::to_string(k)).c_str(),
+                              v.c_str());
+        }
+        std::string s = "S" + std::to_string(i % 40);
+        if (KLIBCFileAddSection(file_.c_str(), s.c_str(), h.get(), nullptr) !=
+            1) {
+          _exit(1);
+        }
+        if (write(ready[1], "x", 1) != 1) _exit(1);
+      }
+    }
+    close(ready[1]);
+    char c;
+    int writes = 1 + static_cast<int>(rng() % 4);
+    for (int i = 0; i < writes; ++i) ASSERT_EQ(read(ready[0], &c, 1), 1);
+    struct timespec pause = {0, static_cast<long>(rng() % 2000) * 1000};
+    nanosleep(&pause, nullptr);
+    kill(pid, SIGKILL);
+    int status;
+    waitpid(pid, &status, 0);
+    close(ready[0]);
+    ASSERT_TRUE(WIFSIGNALED(status));
+
+    KSZLIST* names = KLIBCSzListAlloc();
+    int n = KLIBCFileEnumSection(file_.c_str(), names);
+    ASSERT_GT(n, 0) << "round " << round;
+    for (int i = 0; i < n; ++i) {
+      Hash h(KLIBCSzHashAlloc(64));
+      ASSERT_EQ(
+          KLIBCFileGetSection(file_.c_str(), KLIBCSzListGet(names, i), h.get()),
+          1);
+      ASSERT_EQ(KLIBCSzHashCount(h.get()), 20);
+      for (int k = 1; k < 20; ++k) {
+        ASSERT_STREQ(KLIBCSzHashValueAt(h.get(), k),
+                     KLIBCSzHashValueAt(h.get(), 0));
+      }
+    }
+    KLIBCSzListFree(names);
+  }
+}
+
+}  // namespace
