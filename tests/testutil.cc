@@ -3,9 +3,13 @@
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <netinet/in.h>
+#include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -27,6 +31,18 @@ std::string TempBase() {
 std::mutex syslog_mutex;
 std::vector<std::string> syslog_messages;
 std::vector<int> syslog_priorities;
+
+bool Accepts(int port) {
+  int fd = socket(AF_INET, SOCK_STREAM, 0);
+  if (fd < 0) return false;
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  addr.sin_port = htons(static_cast<uint16_t>(port));
+  bool ok = connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
+  close(fd);
+  return ok;
+}
 
 void RecordSyslog(int priority, const char* format, va_list ap) {
   char buf[8192];
@@ -134,6 +150,184 @@ int FreeLoopbackPort() {
   }
   close(fd);
   return port;
+}
+
+RsyncDaemon::RsyncDaemon(const std::string& dir) : dir_(dir) {}
+
+RsyncDaemon::~RsyncDaemon() { Stop(); }
+
+bool RsyncDaemon::Start(const std::vector<RsyncModule>& modules,
+                        const std::string& user, const std::string& password) {
+  std::string secrets = dir_ + "/rsyncd.secrets";
+  if (!WriteFile(secrets, user + ":" + password + "\n") ||
+      chmod(secrets.c_str(), 0600) != 0) {
+    return false;
+  }
+  std::string conf = "use chroot = no\nsocket options = TCP_NODELAY\n";
+  conf += "uid = " + std::to_string(geteuid()) + "\n";
+  conf += "gid = " + std::to_string(getegid()) + "\n";
+  for (const RsyncModule& m : modules) {
+    conf += "[" + m.name + "]\n\tpath = " + m.path + "\n";
+    conf += "\tauth users = " + user + "\n\tsecrets file = " + secrets + "\n";
+    for (const std::string& line : m.extra) conf += "\t" + line + "\n";
+  }
+  std::string conf_path = dir_ + "/rsyncd.conf";
+  return WriteFile(conf_path, conf) && StartWithConfig(conf_path);
+}
+
+bool RsyncDaemon::StartWithConfig(const std::string& conf) {
+  Stop();
+  std::string log = dir_ + "/rsyncd.log";
+  // The free port may be taken between the probe and the daemon's bind.
+  for (int attempt = 0; attempt < 5; ++attempt) {
+    int port = FreeLoopbackPort();
+    std::string port_arg = "--port=" + std::to_string(port);
+    std::string conf_arg = "--config=" + conf;
+    std::string log_arg = "--log-file=" + log;
+    pid_t pid = fork();
+    if (pid < 0) return false;
+    if (pid == 0) {
+      int fd = open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0600);
+      if (fd >= 0) {
+        dup2(fd, 1);
+        dup2(fd, 2);
+      }
+      execlp("rsync", "rsync", "--daemon", "--no-detach", "--address=127.0.0.1",
+             port_arg.c_str(), conf_arg.c_str(), log_arg.c_str(),
+             static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    for (int waited = 0; waited < 5000; waited += 5) {
+      if (Accepts(port)) {
+        pid_ = pid;
+        port_ = port;
+        return true;
+      }
+      if (waitpid(pid, nullptr, WNOHANG) == pid) break;
+      timespec ts = {0, 5 * 1000 * 1000};
+      nanosleep(&ts, nullptr);
+    }
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+  }
+  return false;
+}
+
+void RsyncDaemon::Stop() {
+  if (pid_ <= 0) return;
+  kill(pid_, SIGTERM);
+  waitpid(pid_, nullptr, 0);
+  pid_ = -1;
+  port_ = -1;
+}
+
+std::string RsyncDaemon::Log() const { return ReadFile(dir_ + "/rsyncd.log"); }
+
+ScopedEnv::ScopedEnv(const std::string& name, const std::string& value)
+    : name_(name) {
+  const char* old = getenv(name.c_str());
+  had_ = old != nullptr;
+  if (had_) old_ = old;
+  setenv(name.c_str(), value.c_str(), 1);
+}
+
+ScopedEnv::~ScopedEnv() {
+  if (had_) {
+    setenv(name_.c_str(), old_.c_str(), 1);
+  } else {
+    unsetenv(name_.c_str());
+  }
+}
+
+namespace {
+
+// Runs a program to completion with its output discarded; true on exit 0.
+bool RunQuiet(const std::vector<std::string>& args) {
+  pid_t pid = fork();
+  if (pid < 0) return false;
+  if (pid == 0) {
+    int fd = open("/dev/null", O_RDWR);
+    dup2(fd, 0);
+    dup2(fd, 1);
+    dup2(fd, 2);
+    std::vector<char*> argv;
+    for (const std::string& a : args)
+      argv.push_back(const_cast<char*>(a.c_str()));
+    argv.push_back(nullptr);
+    execvp(argv[0], argv.data());
+    _exit(127);
+  }
+  int status = 0;
+  waitpid(pid, &status, 0);
+  return WIFEXITED(status) && WEXITSTATUS(status) == 0;
+}
+
+}  // namespace
+
+SshServer::SshServer(const std::string& dir) : dir_(dir) {}
+
+SshServer::~SshServer() { Stop(); }
+
+bool SshServer::Start(const std::string& forced_command,
+                      const std::string& client_key,
+                      const std::string& known_hosts) {
+  std::string host_key = dir_ + "/ssh_host_key";
+  std::filesystem::create_directories(
+      std::filesystem::path(client_key).parent_path());
+  if (!RunQuiet(
+          {"ssh-keygen", "-q", "-t", "ed25519", "-N", "", "-f", host_key}) ||
+      !RunQuiet(
+          {"ssh-keygen", "-q", "-t", "ed25519", "-N", "", "-f", client_key})) {
+    return false;
+  }
+  std::string authorized = dir_ + "/authorized_keys";
+  if (!WriteFile(authorized, "command=\"" + forced_command +
+                                 "\",no-pty,no-port-forwarding " +
+                                 ReadFile(client_key + ".pub"))) {
+    return false;
+  }
+  // sshd insists on its privilege separation directory.
+  mkdir("/run/sshd", 0755);
+  for (int attempt = 0; attempt < 5; ++attempt) {
+    int port = FreeLoopbackPort();
+    std::string conf = dir_ + "/sshd_config";
+    WriteFile(conf, "Port " + std::to_string(port) +
+                        "\nListenAddress 127.0.0.1\nHostKey " + host_key +
+                        "\nAuthorizedKeysFile " + authorized +
+                        "\nStrictModes no\nUsePAM no\nPasswordAuthentication no"
+                        "\nKbdInteractiveAuthentication no"
+                        "\nPermitRootLogin prohibit-password\nPidFile none\n");
+    std::string log = dir_ + "/sshd.log";
+    pid_t pid = fork();
+    if (pid < 0) return false;
+    if (pid == 0) {
+      execl("/usr/sbin/sshd", "/usr/sbin/sshd", "-D", "-f", conf.c_str(), "-E",
+            log.c_str(), static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    for (int waited = 0; waited < 5000; waited += 5) {
+      if (Accepts(port)) {
+        pid_ = pid;
+        port_ = port;
+        std::string pub = ReadFile(host_key + ".pub");
+        return WriteFile(known_hosts,
+                         "[127.0.0.1]:" + std::to_string(port) + " " + pub);
+      }
+      if (waitpid(pid, nullptr, WNOHANG) == pid) break;
+      timespec ts = {0, 5 * 1000 * 1000};
+      nanosleep(&ts, nullptr);
+    }
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+  }
+  return false;
+}
+
+void SshServer::Stop() {
+  if (pid_ <= 0) return;
+  kill(pid_, SIGTERM);
+  waitpid(pid_, nullptr, 0);
+  pid_ = -1;
 }
 
 }  // namespace s2s_test

@@ -4,6 +4,8 @@
 #ifndef S2S_TESTS_TESTUTIL_H_
 #define S2S_TESTS_TESTUTIL_H_
 
+#include <sys/types.h>
+
 #include <string>
 #include <vector>
 
@@ -66,6 +68,83 @@ std::string ReadFile(const std::string& path);
 bool WriteFile(const std::string& path, const std::string& data);
 // A TCP port on 127.0.0.1 that was free a moment ago.
 int FreeLoopbackPort();
+
+// One module of a test daemon: name, directory, and further rsyncd.conf
+// lines ("key = value") for it.
+struct RsyncModule {
+  std::string name;
+  std::string path;
+  std::vector<std::string> extra;
+};
+
+// A real rsync daemon on 127.0.0.1 at a free port, in the foreground
+// (--no-detach), started by this object and stopped by its own pid. Its
+// configuration, secrets file (mode 0600) and log live in `dir`.
+class RsyncDaemon {
+ public:
+  explicit RsyncDaemon(const std::string& dir);
+  ~RsyncDaemon();
+  RsyncDaemon(const RsyncDaemon&) = delete;
+  RsyncDaemon& operator=(const RsyncDaemon&) = delete;
+
+  // Writes a configuration with `modules`, each open to `user` with
+  // `password`, and starts the daemon on it. False when it does not answer.
+  bool Start(const std::vector<RsyncModule>& modules, const std::string& user,
+             const std::string& password);
+  // Starts the daemon on a configuration written elsewhere.
+  bool StartWithConfig(const std::string& conf);
+  // SIGTERM to the daemon, then waits for it. Idempotent.
+  void Stop();
+
+  int port() const { return port_; }
+  pid_t pid() const { return pid_; }
+  // The daemon's log file so far.
+  std::string Log() const;
+
+ private:
+  std::string dir_;
+  int port_ = -1;
+  pid_t pid_ = -1;
+};
+
+// A real sshd on 127.0.0.1 at a free port with a generated host key, which
+// lets one generated client key in and runs `forced_command` for it. Files
+// live in `dir`; the daemon is stopped by its own pid.
+class SshServer {
+ public:
+  explicit SshServer(const std::string& dir);
+  ~SshServer();
+  SshServer(const SshServer&) = delete;
+  SshServer& operator=(const SshServer&) = delete;
+
+  // Generates the keys, writes the client's private key to `client_key`
+  // (mode 0600) and a known_hosts line for the server to `known_hosts`, and
+  // starts sshd. False on any failure.
+  bool Start(const std::string& forced_command, const std::string& client_key,
+             const std::string& known_hosts);
+  void Stop();
+  int port() const { return port_; }
+
+ private:
+  std::string dir_;
+  int port_ = -1;
+  pid_t pid_ = -1;
+};
+
+// Sets an environment variable for the lifetime of the object and restores
+// the previous value afterwards.
+class ScopedEnv {
+ public:
+  ScopedEnv(const std::string& name, const std::string& value);
+  ~ScopedEnv();
+  ScopedEnv(const ScopedEnv&) = delete;
+  ScopedEnv& operator=(const ScopedEnv&) = delete;
+
+ private:
+  std::string name_;
+  bool had_ = false;
+  std::string old_;
+};
 
 }  // namespace s2s_test
 
