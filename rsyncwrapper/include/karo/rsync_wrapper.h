@@ -1,0 +1,127 @@
+// RsyncWrapper: one configured invocation of the stock rsync client.
+//
+// The owner sets the switches, the source and the destination, then calls
+// execute() once; the wrapper builds rsync's argument vector, runs rsync in
+// its own process group without a terminal, honours the cancel checker while
+// it runs and returns rsync's exit status. With a custom command rule set,
+// execute() instead sends the command lines to the server's rsync daemon over
+// the command channel (rsyncwrapper/README.md) and returns the server's
+// status.
+//
+// Switches and the rsync options they become (a data transfer always runs
+// with -a, --timeout, and --contimeout/--sockopts=TCP_NODELAY on a daemon
+// socket):
+//   setDelete(true)          --delete
+//   setNumericIds(true)      --numeric-ids
+//   setKaroAuth(use, req)    use: log in to the daemon as the user with the
+//                            password (RSYNC_PASSWORD in rsync's environment
+//                            only); req: refuse to run without user and
+//                            password instead of trying anonymously
+//   setKaroPseudoRoot(v)     true: owners, groups, devices and specials are
+//                            sent (the server's modules keep them with
+//                            `fake super`); false: --no-o --no-g --no-D
+//   setSsh(true)             -e "ssh -p PORT -o BatchMode=yes ...", the
+//                            destination becomes USER@HOST::MODULE/PATH
+//   setPort(p)               the SSH port when SSH is on; ignored otherwise
+//   setCompress(true)        -z
+//   setDeltaCopy(v)          true: --no-whole-file; false: --whole-file
+//   setListOnly(true)        --list-only (data transfers only)
+//   setRelativePath(true)    -R
+//   setKaroAcl(true)         -A -X
+//   setDebugLog(true)        -v, and every line rsync prints goes to the log
+//   setTimeout(s)            --timeout=s; the connect time-out is the
+//                            smaller of s and 15 seconds
+//   setExcludeRule(list)     one --exclude=RULE per entry, in order
+//
+// The rsync daemon's port is 873 unless the environment variable
+// S2S_RSYNC_PORT names another. A module that is an absolute path (the
+// key-file directory "/usr/karo/etc/.encrypt") maps onto the daemon's
+// key-file module "s2skeys".
+//
+// Thread-safety: an object belongs to one thread. The cancel checker is
+// called on that thread. setLogHandler() is meant to be called once at
+// start-up.
+#ifndef KARO_RSYNC_WRAPPER_H_
+#define KARO_RSYNC_WRAPPER_H_
+
+#include <boost/function.hpp>
+#include <list>
+#include <memory>
+#include <string>
+
+#if defined(KARO_RSYNC_BUILDING_LIBRARY)
+#define KARO_RSYNC_EXPORT __attribute__((visibility("default")))
+#else
+#define KARO_RSYNC_EXPORT
+#endif
+
+namespace KARO {
+namespace Backup {
+
+namespace detail {
+struct RsyncSettings;
+}
+
+class KARO_RSYNC_EXPORT RsyncWrapper {
+ public:
+  // Statuses of the wrapper's own making; every other non-zero status is
+  // rsync's exit code (1-35) or, for a command, the server's status.
+  enum Status : int {
+    kOk = 0,
+    kCancelled = 20,     // the cancel checker stopped the run
+    kStartFailed = 250,  // temporary files or the child could not be made
+    kBadReply = 251,     // a command ran but its reply was missing/garbled
+    kBadSettings = 252,  // destination, command lines or auth incomplete
+  };
+
+  // Where the wrapper's log lines go; `priority` is a syslog priority. The
+  // default handler writes to syslog(3). nullptr restores the default.
+  using LogHandler = void (*)(int priority, const char* message);
+  static void setLogHandler(LogHandler handler);
+
+  // Defaults: every switch off, time-out 600 s, debug log off.
+  RsyncWrapper();
+  virtual ~RsyncWrapper();
+  RsyncWrapper(const RsyncWrapper&) = delete;
+  RsyncWrapper& operator=(const RsyncWrapper&) = delete;
+
+  void setDelete(bool on);
+  void setNumericIds(bool on);
+  void setKaroAuth(bool useAuth, bool requireAuth);
+  void setKaroPseudoRoot(bool on);
+  void setSsh(bool on);
+  void setPort(unsigned int port);
+  void setCompress(bool on);
+  void setDeltaCopy(bool on);
+  void setListOnly(bool on);
+  void setRelativePath(bool on);
+  void setKaroAcl(bool on);
+  void setDebugLog(bool on);
+  void setTimeout(unsigned int seconds);
+
+  // The command lines (key="value", no line breaks). A non-empty rule makes
+  // execute() a command; an `outfile="PATH"` line names the local file that
+  // receives the server's answer.
+  void setKaroCustCmdRule(const std::list<std::string>& lines);
+  // Where to: the daemon at `host` as `user`. `module` "" addresses the
+  // command channel; `path` is the path inside the module.
+  void setDestPath(const std::string& user, const std::string& host,
+                   const std::string& password, const std::string& module,
+                   const std::string& path);
+  void setExcludeRule(const std::list<std::string>& rules);
+  void setSrcPath(const std::string& path);
+
+  // Runs the invocation. `cancel` (may be empty) is polled about every 50 ms;
+  // once it returns true rsync gets SIGTERM, SIGKILL half a second later.
+  // Returns 0 on success; rsync's exit code when rsync failed; for a command
+  // the server's status; or one of the statuses above.
+  int execute(boost::function<bool()> cancel);
+
+ private:
+  std::unique_ptr<detail::RsyncSettings> settings_;
+};
+
+}  // namespace Backup
+}  // namespace KARO
+
+#endif  // KARO_RSYNC_WRAPPER_H_

@@ -1,0 +1,199 @@
+#include "rsync_child.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <string.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <time.h>
+#include <unistd.h>
+
+#include "karo/rsync_wrapper.h"
+#include "rsync_log.h"
+
+extern char** environ;
+
+namespace KARO {
+namespace Backup {
+namespace detail {
+
+const int kKillGraceMs = 500;
+
+namespace {
+
+const int kPollMs = 50;
+const size_t kMaxOutput = 64 * 1024;
+
+long long NowMs() {
+  timespec ts;
+  clock_gettime(CLOCK_MONOTONIC, &ts);
+  return ts.tv_sec * 1000LL + ts.tv_nsec / 1000000;
+}
+
+// The parent's environment without any password of its own, plus ours.
+std::vector<std::string> ChildEnvironment(const std::string& password) {
+  std::vector<std::string> env;
+  for (char** e = environ; e != nullptr && *e != nullptr; ++e) {
+    if (strncmp(*e, "RSYNC_PASSWORD=", 15) != 0) env.push_back(*e);
+  }
+  if (!password.empty()) env.push_back("RSYNC_PASSWORD=" + password);
+  return env;
+}
+
+std::vector<char*> Pointers(std::vector<std::string>& strings) {
+  std::vector<char*> out;
+  for (std::string& s : strings) out.push_back(&s[0]);
+  out.push_back(nullptr);
+  return out;
+}
+
+// Only async-signal-safe calls between fork and exec.
+[[noreturn]] void ExecChild(int out_fd, char* const* argv, char* const* envp) {
+  setsid();
+  int null_fd = open("/dev/null", O_RDONLY);
+  if (null_fd >= 0) dup2(null_fd, 0);
+  dup2(out_fd, 1);
+  dup2(out_fd, 2);
+  execvpe(argv[0], argv, envp);
+  _exit(127);
+}
+
+int PidFd(pid_t pid) {
+#ifdef SYS_pidfd_open
+  return static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+#else
+  (void)pid;
+  return -1;
+#endif
+}
+
+// Reads what is available; false once the pipe is at its end.
+bool Drain(int fd, std::string* output) {
+  char buf[4096];
+  for (;;) {
+    ssize_t n = read(fd, buf, sizeof buf);
+    if (n > 0) {
+      size_t room = kMaxOutput - std::min(kMaxOutput, output->size());
+      output->append(buf, std::min(room, static_cast<size_t>(n)));
+      continue;
+    }
+    if (n < 0 && errno == EINTR) continue;
+    return n < 0 && errno == EAGAIN;
+  }
+}
+
+bool Exited(pid_t pid) {
+  siginfo_t info;
+  info.si_pid = 0;
+  int rc = waitid(P_PID, pid, &info, WEXITED | WNOHANG | WNOWAIT);
+  return rc == 0 && info.si_pid == pid;
+}
+
+}  // namespace
+
+ChildOutcome RunRsync(const std::vector<std::string>& args,
+                      const std::string& password,
+                      const boost::function<bool()>& cancel) {
+  ChildOutcome outcome;
+  std::vector<std::string> arg_strings = args;
+  std::vector<std::string> env_strings = ChildEnvironment(password);
+  std::vector<char*> argv = Pointers(arg_strings);
+  std::vector<char*> envp = Pointers(env_strings);
+
+  int pipe_fds[2];
+  if (pipe2(pipe_fds, O_CLOEXEC) != 0) {
+    Log(LOG_ERR, "cannot make a pipe for rsync: %s", strerror(errno));
+    outcome.status = RsyncWrapper::kStartFailed;
+    return outcome;
+  }
+  pid_t pid = fork();
+  if (pid == 0) ExecChild(pipe_fds[1], argv.data(), envp.data());
+  close(pipe_fds[1]);
+  if (pid < 0) {
+    Log(LOG_ERR, "cannot start rsync: %s", strerror(errno));
+    close(pipe_fds[0]);
+    outcome.status = RsyncWrapper::kStartFailed;
+    return outcome;
+  }
+  // The child may not have called setsid() yet; doing it here too closes
+  // the race with an early SIGTERM to the group.
+  setpgid(pid, pid);
+  int out_fd = pipe_fds[0];
+  fcntl(out_fd, F_SETFL, fcntl(out_fd, F_GETFL) | O_NONBLOCK);
+  int pid_fd = PidFd(pid);
+
+  long long term_at = 0;
+  bool killed = false;
+  while (!Exited(pid)) {
+    pollfd fds[2];
+    int nfds = 0;
+    if (out_fd >= 0) fds[nfds++] = {out_fd, POLLIN, 0};
+    if (pid_fd >= 0) fds[nfds++] = {pid_fd, POLLIN, 0};
+    poll(fds, nfds, kPollMs);
+    if (out_fd >= 0 && !Drain(out_fd, &outcome.output)) {
+      close(out_fd);
+      out_fd = -1;
+    }
+    if (!outcome.cancelled && cancel && cancel()) {
+      outcome.cancelled = true;
+      term_at = NowMs();
+      kill(-pid, SIGTERM);
+    }
+    if (outcome.cancelled && !killed && NowMs() - term_at >= kKillGraceMs) {
+      killed = true;
+      kill(-pid, SIGKILL);
+    }
+  }
+  // Helpers rsync started (ssh) must not outlive a cancelled run.
+  if (outcome.cancelled) kill(-pid, SIGKILL);
+  int wstatus = 0;
+  while (waitpid(pid, &wstatus, 0) < 0 && errno == EINTR) {
+  }
+  if (out_fd >= 0) {
+    Drain(out_fd, &outcome.output);
+    close(out_fd);
+  }
+  if (pid_fd >= 0) close(pid_fd);
+
+  if (outcome.cancelled) {
+    outcome.status = RsyncWrapper::kCancelled;
+  } else if (WIFEXITED(wstatus) && WEXITSTATUS(wstatus) == 127) {
+    Log(LOG_ERR, "cannot run %s", args[0].c_str());
+    outcome.status = RsyncWrapper::kStartFailed;
+  } else if (WIFEXITED(wstatus)) {
+    outcome.status = WEXITSTATUS(wstatus);
+  } else {
+    Log(LOG_ERR, "rsync died of signal %d", WTERMSIG(wstatus));
+    outcome.status = RsyncWrapper::kCancelled;
+  }
+  return outcome;
+}
+
+int RunAndLog(const std::vector<std::string>& args, const RsyncSettings& s,
+              const boost::function<bool()>& cancel, const char* what) {
+  ChildOutcome outcome = RunRsync(args, s.password, cancel);
+  std::string last;
+  size_t start = 0;
+  while (start < outcome.output.size()) {
+    size_t end = outcome.output.find('\n', start);
+    if (end == std::string::npos) end = outcome.output.size();
+    std::string line = outcome.output.substr(start, end - start);
+    if (s.debug_log) Log(LOG_DEBUG, "rsync: %s", line.c_str());
+    if (!line.empty()) last = line;
+    start = end + 1;
+  }
+  if (outcome.cancelled) {
+    Log(LOG_WARNING, "%s to %s cancelled", what, s.host.c_str());
+  } else if (outcome.status != 0 &&
+             outcome.status != RsyncWrapper::kStartFailed) {
+    Log(LOG_ERR, "%s to %s failed with status %d: %s", what, s.host.c_str(),
+        outcome.status, last.c_str());
+  }
+  return outcome.status;
+}
+
+}  // namespace detail
+}  // namespace Backup
+}  // namespace KARO

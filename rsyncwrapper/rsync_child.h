@@ -1,0 +1,46 @@
+// Internal: runs one rsync process and waits for it, honouring a cancel
+// checker.
+//
+// rsync runs in a session of its own (no controlling terminal, so neither
+// rsync nor ssh can prompt), with standard input on /dev/null and its output
+// collected through a pipe. The password reaches it only as RSYNC_PASSWORD in
+// its environment.
+#ifndef KARO_RSYNC_CHILD_H_
+#define KARO_RSYNC_CHILD_H_
+
+#include <boost/function.hpp>
+#include <string>
+#include <vector>
+
+#include "rsync_args.h"
+
+namespace KARO {
+namespace Backup {
+namespace detail {
+
+struct ChildOutcome {
+  int status = 0;          // rsync's exit code, or an RsyncWrapper::Status
+  bool cancelled = false;  // the checker asked to stop
+  std::string output;      // what rsync printed (the first 64 KiB)
+};
+
+// Runs `args` (args[0] is looked up in PATH). `cancel` may be empty. Returns
+// the outcome; a child that cannot be started gives kStartFailed.
+ChildOutcome RunRsync(const std::vector<std::string>& args,
+                      const std::string& password,
+                      const boost::function<bool()>& cancel);
+
+// RunRsync with the settings' password, logging rsync's output line by line
+// at debug level when the debug log is on, and a failure once at error level
+// naming `what`. Returns the outcome's status.
+int RunAndLog(const std::vector<std::string>& args, const RsyncSettings& s,
+              const boost::function<bool()>& cancel, const char* what);
+
+// How long a cancelled rsync gets between SIGTERM and SIGKILL.
+extern const int kKillGraceMs;
+
+}  // namespace detail
+}  // namespace Backup
+}  // namespace KARO
+
+#endif  // KARO_RSYNC_CHILD_H_

@@ -1,0 +1,35 @@
+// Internal: the command channel. A command is sent to the daemon's command
+// module and its reply pulled back, in one rsync connection when the command
+// fits in --early-input and in two (push to the spool module, then pull)
+// when it does not. The reply file is "status=<N>\n" followed by the answer.
+#ifndef KARO_RSYNC_COMMAND_H_
+#define KARO_RSYNC_COMMAND_H_
+
+#include <boost/function.hpp>
+#include <string>
+
+#include "rsync_args.h"
+
+namespace KARO {
+namespace Backup {
+namespace detail {
+
+// The most --early-input carries.
+const size_t kMaxEarlyInput = 5120;
+
+// Runs the command in `s.command_lines`. Returns the server's status, rsync's
+// exit code when a connection failed, or kStartFailed/kBadReply. The answer
+// goes to the `outfile="..."` line's path when there is one.
+int RunCommand(const RsyncSettings& s, const boost::function<bool()>& cancel);
+
+// Splits a reply into its status and answer; false when it is not a reply.
+bool ParseReply(const std::string& reply, int* status, std::string* answer);
+
+// A fresh request id: 32 lower-case hex digits.
+std::string NewRequestId();
+
+}  // namespace detail
+}  // namespace Backup
+}  // namespace KARO
+
+#endif  // KARO_RSYNC_COMMAND_H_

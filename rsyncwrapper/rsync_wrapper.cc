@@ -1,0 +1,74 @@
+#include "karo/rsync_wrapper.h"
+
+#include "rsync_args.h"
+#include "rsync_child.h"
+#include "rsync_command.h"
+#include "rsync_log.h"
+
+namespace KARO {
+namespace Backup {
+
+RsyncWrapper::RsyncWrapper() : settings_(new detail::RsyncSettings) {}
+
+RsyncWrapper::~RsyncWrapper() {
+  // The password should not linger in freed memory.
+  std::string& pw = settings_->password;
+  for (char& c : pw) *static_cast<volatile char*>(&c) = 0;
+}
+
+void RsyncWrapper::setDelete(bool on) { settings_->del = on; }
+void RsyncWrapper::setNumericIds(bool on) { settings_->numeric_ids = on; }
+void RsyncWrapper::setKaroAuth(bool useAuth, bool requireAuth) {
+  settings_->use_auth = useAuth;
+  settings_->require_auth = requireAuth;
+}
+void RsyncWrapper::setKaroPseudoRoot(bool on) { settings_->pseudo_root = on; }
+void RsyncWrapper::setSsh(bool on) { settings_->ssh = on; }
+void RsyncWrapper::setPort(unsigned int port) { settings_->ssh_port = port; }
+void RsyncWrapper::setCompress(bool on) { settings_->compress = on; }
+void RsyncWrapper::setDeltaCopy(bool on) { settings_->delta_copy = on; }
+void RsyncWrapper::setListOnly(bool on) { settings_->list_only = on; }
+void RsyncWrapper::setRelativePath(bool on) { settings_->relative = on; }
+void RsyncWrapper::setKaroAcl(bool on) { settings_->acl = on; }
+void RsyncWrapper::setDebugLog(bool on) { settings_->debug_log = on; }
+void RsyncWrapper::setTimeout(unsigned int seconds) {
+  settings_->timeout = seconds;
+}
+
+void RsyncWrapper::setKaroCustCmdRule(const std::list<std::string>& lines) {
+  settings_->command_lines = lines;
+}
+
+void RsyncWrapper::setDestPath(const std::string& user, const std::string& host,
+                               const std::string& password,
+                               const std::string& module,
+                               const std::string& path) {
+  settings_->user = user;
+  settings_->host = host;
+  settings_->password = password;
+  settings_->module = module;
+  settings_->path = path;
+}
+
+void RsyncWrapper::setExcludeRule(const std::list<std::string>& rules) {
+  settings_->excludes = rules;
+}
+
+void RsyncWrapper::setSrcPath(const std::string& path) {
+  settings_->source = path;
+}
+
+int RsyncWrapper::execute(boost::function<bool()> cancel) {
+  const detail::RsyncSettings& s = *settings_;
+  bool command = !s.command_lines.empty();
+  std::string problem = detail::CheckSettings(s, command);
+  if (!problem.empty()) {
+    detail::Log(LOG_ERR, "cannot run rsync: %s", problem.c_str());
+    return kBadSettings;
+  }
+  if (command) return detail::RunCommand(s, cancel);
+  return detail::RunAndLog(detail::DataTransferArgs(s), s, cancel, "transfer");
+}
+
+}  // namespace Backup
+}  // namespace KARO
