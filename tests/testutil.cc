@@ -70,6 +70,27 @@ std::string TempDir::Sub(const std::string& name) const {
   return path_ + "/" + name;
 }
 
+TempRoot::TempRoot() : env_("S2S_ROOT", path()) {}
+
+std::string TempRoot::Path(const std::string& abs) const {
+  return path() + abs;
+}
+
+bool TempRoot::MakeDir(const std::string& abs) const {
+  std::error_code ec;
+  std::filesystem::create_directories(Path(abs), ec);
+  return !ec;
+}
+
+bool TempRoot::Write(const std::string& abs, const std::string& data) const {
+  return MakeDir(abs.substr(0, abs.rfind('/'))) && WriteFile(Path(abs), data);
+}
+
+bool WriteScript(const std::string& path, const std::string& body) {
+  return WriteFile(path, "#!/bin/sh\n" + body) &&
+         chmod(path.c_str(), 0755) == 0;
+}
+
 CaptureFd::CaptureFd(int fd) : fd_(fd) {
   fflush(nullptr);
   file_ = TempBase() + "/s2s-capture.XXXXXX";

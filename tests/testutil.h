@@ -146,6 +146,29 @@ class ScopedEnv {
   std::string old_;
 };
 
+// A temporary appliance root: a TempDir that S2S_ROOT points at while the
+// object lives, so that every fixed system path of the platform layer lands
+// inside it.
+class TempRoot : public TempDir {
+ public:
+  TempRoot();
+
+  // path() + `abs` (an absolute path inside the root).
+  std::string Path(const std::string& abs) const;
+  // Writes `data` to Path(abs), creating the directories above it; true on
+  // success.
+  bool Write(const std::string& abs, const std::string& data) const;
+  // Creates Path(abs) and the directories above it.
+  bool MakeDir(const std::string& abs) const;
+
+ private:
+  ScopedEnv env_;
+};
+
+// Writes an executable shell script `body` (without the "#!/bin/sh" line)
+// at `path`; true on success.
+bool WriteScript(const std::string& path, const std::string& body);
+
 }  // namespace s2s_test
 
 #endif  // S2S_TESTS_TESTUTIL_H_

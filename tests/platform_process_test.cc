@@ -1,0 +1,89 @@
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <string>
+
+#include "karo_err.h"
+#include "karo_process.h"
+#include "testutil.h"
+
+namespace {
+
+using s2s_test::ReadFile;
+using s2s_test::TempDir;
+using s2s_test::WriteFile;
+
+std::string ReadAll(FILE* f) {
+  std::string out;
+  char buf[256];
+  size_t n;
+  while ((n = fread(buf, 1, sizeof buf, f)) > 0) out.append(buf, n);
+  return out;
+}
+
+TEST(PopenTest, ArgumentsReachTheProgramUninterpreted) {
+  FILE* f = KLIBCPopen("printf", "r", "%s|%s", "$HOME; echo x", "*",
+                       static_cast<const char*>(nullptr));
+  ASSERT_NE(f, nullptr);
+  EXPECT_EQ(ReadAll(f), "$HOME; echo x|*");
+  EXPECT_EQ(KLIBCPclose(f), 0);
+}
+
+TEST(PopenTest, ExitStatusAndWriting) {
+  FILE* f =
+      KLIBCPopen("sh", "r", "-c", "exit 3", static_cast<const char*>(nullptr));
+  ASSERT_NE(f, nullptr);
+  EXPECT_EQ(KLIBCPclose(f), 3);
+
+  TempDir dir;
+  const std::string out = dir.Sub("out");
+  f = KLIBCPopen("sh", "w", "-c", "cat > \"$0\"", out.c_str(),
+                 static_cast<const char*>(nullptr));
+  ASSERT_NE(f, nullptr);
+  fputs("to the child", f);
+  EXPECT_EQ(KLIBCPclose(f), 0);
+  EXPECT_EQ(ReadFile(out), "to the child");
+}
+
+TEST(PopenTest, RefusesWhatItCannotRun) {
+  EXPECT_EQ(
+      KLIBCPopen("s2s-no-such-program", "r", static_cast<const char*>(nullptr)),
+      nullptr);
+  EXPECT_EQ(KLIBCErrGet(), KERR_NOT_FOUND);
+  EXPECT_EQ(KLIBCPopen("true", "rw", static_cast<const char*>(nullptr)),
+            nullptr);
+  EXPECT_EQ(KLIBCErrGet(), KERR_INVALID_ARG);
+  EXPECT_EQ(KLIBCPclose(stdin), -1);
+}
+
+TEST(PidFileTest, OnlyALiveProcessCounts) {
+  TempDir dir;
+  const std::string file = dir.Sub("pid");
+  EXPECT_EQ(KLIBCProcAliveByPidFile(file.c_str()), 0);
+  EXPECT_EQ(KLIBCErrGet(), KERR_FILE_NOT_FOUND);
+
+  ASSERT_TRUE(WriteFile(file, std::to_string(getpid()) + "\n"));
+  EXPECT_EQ(KLIBCProcAliveByPidFile(file.c_str()), 1);
+
+  for (const char* bad : {"", "12x\n", "-5\n", "0"}) {
+    ASSERT_TRUE(WriteFile(file, bad));
+    EXPECT_EQ(KLIBCProcAliveByPidFile(file.c_str()), 0) << bad;
+    EXPECT_EQ(KLIBCErrGet(), KERR_FILE_FORMAT);
+  }
+
+  // A child that has exited but is not reaped yet is a zombie: not alive.
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) _exit(0);
+  siginfo_t info;
+  ASSERT_EQ(waitid(P_PID, child, &info, WEXITED | WNOWAIT), 0);
+  ASSERT_TRUE(WriteFile(file, std::to_string(child)));
+  EXPECT_EQ(KLIBCProcAliveByPidFile(file.c_str()), 0);
+  ASSERT_EQ(waitpid(child, nullptr, 0), child);
+  EXPECT_EQ(KLIBCProcAliveByPidFile(file.c_str()), 0);
+  EXPECT_EQ(KLIBCErrGet(), KERR_NOT_FOUND);
+}
+
+}  // namespace
