@@ -6,5 +6,9 @@
 #include "S2S/logger.h"
 #include "S2S/pobject.h"
 #include "S2S/result_codes.h"
+#include "S2S/s2s_address.h"
+#include "S2S/s2s_host.h"
+#include "S2S/s2s_lock.h"
+#include "S2S/s2s_share.h"
 
 #endif  // S2S_S2S_H_

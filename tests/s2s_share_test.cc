@@ -1,0 +1,229 @@
+#include "S2S/s2s_share.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/file.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "S2S/s2s_lock.h"
+#include "karo_err.h"
+#include "karo_share.h"
+#include "testutil.h"
+
+namespace {
+
+using s2s_test::SyslogCapture;
+using s2s_test::TempRoot;
+
+const char kShares[] =
+    "[docs]\n"
+    "\tpath=\"/volume1/docs\"\n"
+    "\tencrypted=\"yes\"\n"
+    "\tauto_mount=\"yes\"\n"
+    "\tkey_length=\"32\"\n"
+    "\tenc_path=\"/volume1/@docs@\"\n"
+    "\tvolume=\"/volume1\"\n"
+    "\tvolume_type=\"1\"\n"
+    "[public]\n"
+    "\tpath=\"/volume1/public/\"\n"
+    "\twin_share=\"yes\"\n"
+    "\tcluster=\"yes\"\n"
+    "\tvolume=\"/volume1\"\n"
+    "[secret]\n"
+    "\tpath=\"/volume2/secret\"\n"
+    "\tencrypted=\"yes\"\n"
+    "\tkey_file=\"/keys/secret.key\"\n"
+    "[usb]\n"
+    "\tpath=\"/media/usb/photos\"\n"
+    "\tvolume=\"/media/usb\"\n"
+    "\tvolume_type=\"3\"\n"
+    "\tsharebin=\"yes\"\n"
+    "[nopath]\n"
+    "\tacl=\"yes\"\n";
+
+class ShareTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_TRUE(root_.Write("/etc/s2s/shares.conf", kShares));
+  }
+  TempRoot root_;
+};
+
+TEST_F(ShareTest, PlainShareIsServedFromItsPath) {
+  S2S::ShareInfo info;
+  ASSERT_EQ(S2S::GetShareInfo("public", info), 0);
+  EXPECT_EQ(info.GetPath(), "/volume1/public/");
+  EXPECT_EQ(info.GetModulePath(), "/volume1/public/");
+  EXPECT_EQ(info.GetModuleName(), "public");
+  EXPECT_FALSE(info.IsEncrypted());
+  EXPECT_TRUE(info.IsWinShare());
+  EXPECT_TRUE(info.IsACL());  // a Windows share always carries ACLs
+  EXPECT_TRUE(info.IsCluster());
+  EXPECT_EQ(info.GetStatus(), 0x800u | 0x8000u);
+}
+
+TEST_F(ShareTest, EncryptedShareIsServedFromItsLowerPath) {
+  S2S::ShareInfo info;
+  ASSERT_EQ(S2S::GetShareInfo("docs", info), 0);
+  EXPECT_EQ(info.GetName(), "docs");
+  EXPECT_EQ(info.GetPath(), "/volume1/docs");
+  EXPECT_EQ(info.GetModulePath(), "/volume1/@docs@");
+  EXPECT_EQ(info.GetModuleName(), "@docs@");
+  EXPECT_TRUE(info.IsEncrypted() && info.IsAutoMount());
+  EXPECT_FALSE(info.IsACL());
+  EXPECT_EQ(info.GetEncryptKeyLen(), 32u);
+
+  // Without a configured lower path it lies beside the share.
+  ASSERT_EQ(S2S::GetShareInfo("secret", info), 0);
+  EXPECT_EQ(info.GetModulePath(), "/volume2/@secret@");
+}
+
+TEST_F(ShareTest, FailuresAreLoggedOnceExceptForAnEmptyName) {
+  SyslogCapture log;
+  S2S::ShareInfo info;
+  EXPECT_EQ(S2S::GetShareInfo("", info), -1);
+  EXPECT_EQ(log.Text(), "");
+  EXPECT_EQ(S2S::GetShareInfo("missing", info), -1);
+  EXPECT_EQ(S2S::GetShareInfo("nopath", info), -1);
+  EXPECT_EQ(S2S::GetShareInfo("../etc", info), -1);
+  ASSERT_EQ(log.Messages().size(), 3u);
+  EXPECT_NE(log.Messages()[0].find("S2S/s2s("), std::string::npos);
+  EXPECT_NE(log.Messages()[0].find("Fail to get share 'missing'\n"),
+            std::string::npos);
+  EXPECT_NE(log.Messages()[1].find("Fail to get the path of share 'nopath'"),
+            std::string::npos);
+  EXPECT_EQ(info.GetName(), "");  // untouched by the failures
+}
+
+TEST_F(ShareTest, VolumesAndValidity) {
+  S2S::VolumeInfo vol;
+  ASSERT_EQ(S2S::GetVolumeInfo("docs", vol), 0);
+  EXPECT_EQ(vol.GetPath(), "/volume1");
+  EXPECT_EQ(vol.GetName(), "volume1");
+  EXPECT_TRUE(vol.IsInternal());
+  ASSERT_EQ(S2S::GetVolumeInfo("public", vol), 0);  // type defaults to 1
+  EXPECT_TRUE(vol.IsInternal());
+
+  bool valid = true;
+  EXPECT_EQ(S2S::IsValidShare("usb", valid), 0);
+  EXPECT_FALSE(valid);
+  EXPECT_EQ(S2S::IsValidShare("docs", valid), 0);
+  EXPECT_TRUE(valid);
+
+  SyslogCapture log;
+  EXPECT_EQ(S2S::IsValidShare("missing", valid), -1);
+  EXPECT_NE(log.Text().find("Fail to get share info\n"), std::string::npos);
+  EXPECT_NE(log.Text().find("Fail to get volume info\n"), std::string::npos);
+}
+
+TEST_F(ShareTest, VolumeFallsBackToTheRootsMountTable) {
+  ASSERT_TRUE(root_.Write("/etc/mtab",
+                          "/dev/md0 / ext4 rw 0 0\n"
+                          "/dev/md1 /volume2 ext4 rw 0 0\n"
+                          "/dev/md2 /volume20 ext4 rw 0 0\n"
+                          "tmpfs /volume2/sec\\040ret tmpfs rw 0 0\n"));
+  KARO_VOLUME vol;
+  ASSERT_EQ(VolumePathParseEx("/volume2/secret", &vol), 0);
+  EXPECT_STREQ(vol.path, "/volume2");
+  EXPECT_EQ(vol.type, KARO_VOLUME_INTERNAL);
+  ASSERT_EQ(VolumePathParseEx("/volume2/sec ret/x", &vol), 0);
+  EXPECT_STREQ(vol.path, "/volume2/sec ret");
+  EXPECT_EQ(vol.type, KARO_VOLUME_OTHER);
+  EXPECT_EQ(VolumePathParseEx("volume2", &vol), -1);
+  EXPECT_EQ(KLIBCErrGet(), KERR_INVALID_ARG);
+}
+
+TEST_F(ShareTest, PlugUnitAcceptsOnlyShareBinShares) {
+  ASSERT_TRUE(root_.Write("/etc/s2s/platform.conf",
+                          "[Platform]\n\tplug_unit=\"yes\"\n"));
+  bool valid = false;
+  EXPECT_EQ(S2S::IsValidShare("usb", valid), 0);
+  EXPECT_TRUE(valid);
+  EXPECT_EQ(S2S::IsValidShare("docs", valid), 0);
+  EXPECT_FALSE(valid);
+}
+
+TEST_F(ShareTest, KeyFilesAndShareNames) {
+  KARO_SHARE* share = nullptr;
+  char buf[4096];
+  ASSERT_EQ(KAROShareGet("docs", &share), 0);
+  int flag = 0;
+  ASSERT_EQ(KLIBShareIsAutoDecryptGet(share, &flag), 0);
+  EXPECT_EQ(flag, 1);
+  ASSERT_GT(KAROShareEncKeyFileGet(share, buf, sizeof buf), 0);
+  EXPECT_EQ(std::string(buf), root_.Path("/usr/karo/etc/.encrypt/docs.key"));
+  ASSERT_GT(KAROShareEncAutoKeyFileGet(share, buf, sizeof buf), 0);
+  EXPECT_EQ(std::string(buf),
+            root_.Path("/usr/karo/etc/.encrypt/docs.auto.key"));
+  KAROShareFree(share);
+
+  ASSERT_EQ(KAROShareGet("secret", &share), 0);
+  ASSERT_GT(KAROShareEncKeyFileGet(share, buf, sizeof buf), 0);
+  EXPECT_STREQ(buf, "/keys/secret.key");
+  KAROShareFree(share);
+
+  ASSERT_EQ(KAROShareGet("public", &share), 0);
+  EXPECT_EQ(KAROShareEncKeyFileGet(share, buf, sizeof buf), -1);
+  EXPECT_EQ(KLIBCErrGet(), KERR_NOT_FOUND);
+  KAROShareFree(share);
+
+  for (const char* bad : {"", ".", "..", "a/b", "a]b", "@x@", " x", "a\nb"}) {
+    EXPECT_EQ(KaroShareNameValid(bad), 0) << bad;
+  }
+  EXPECT_EQ(KaroShareNameValid("My Share.2"), 1);
+
+  KSZLIST* names = KLIBCSzListAlloc();
+  ASSERT_EQ(KAROShareEnum(names), 5);
+  EXPECT_STREQ(KLIBCSzListGet(names, 4), "nopath");
+  KLIBCSzListFree(names);
+}
+
+TEST(SimpleFileLockTest, ExcludesASecondProcessUntilReleased) {
+  s2s_test::TempDir dir;
+  const std::string path = dir.Sub("lock");
+  S2S::LockFactory factory(path);
+  S2S::SimpleFileLock lock = factory.GetLock();
+  ASSERT_EQ(lock.UnLock(), 0);  // not held yet
+  ASSERT_EQ(lock.ExLock(), 0);
+  ASSERT_EQ(lock.ExLock(), 0);  // held already
+
+  int pipefd[2];
+  ASSERT_EQ(pipe(pipefd), 0);
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    // 'B': a non-blocking attempt was refused; 'L': ExLock came through.
+    int probe = open(path.c_str(), O_RDWR);
+    bool refused = flock(probe, LOCK_EX | LOCK_NB) != 0;
+    if (write(pipefd[1], refused ? "B" : "!", 1) != 1) _exit(2);
+    S2S::SimpleFileLock waiter(path);
+    bool got = waiter.ExLock() == 0;
+    if (write(pipefd[1], got ? "L" : "!", 1) != 1) _exit(2);
+    _exit(0);
+  }
+  close(pipefd[1]);
+  char c = 0;
+  ASSERT_EQ(read(pipefd[0], &c, 1), 1);
+  EXPECT_EQ(c, 'B');
+  ASSERT_EQ(lock.UnLock(), 0);
+  ASSERT_EQ(read(pipefd[0], &c, 1), 1);
+  EXPECT_EQ(c, 'L');
+  close(pipefd[0]);
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(access(path.c_str(), F_OK), 0);  // the file stays
+}
+
+TEST(SimpleFileLockTest, UnopenableFileFailsEveryCall) {
+  SyslogCapture log;
+  S2S::SimpleFileLock lock("/nonexistent-dir/s2s/lock");
+  EXPECT_EQ(lock.ExLock(), -1);
+  EXPECT_EQ(lock.UnLock(), -1);
+  EXPECT_NE(log.Text().find("Fail to open lock file at "
+                            "'/nonexistent-dir/s2s/lock', error:'No such file"),
+            std::string::npos);
+}
+
+}  // namespace
