@@ -38,7 +38,7 @@ void WriteAll(int fd, const void* buf, size_t size) {
 
 // Runs in the child after fork: only async-signal-safe calls. Never returns.
 [[noreturn]] void ExecChild(const char* const argv[], int in_fd, int out_fd,
-                            int err_fd, int report_fd) {
+                            int err_fd, int report_fd, bool detach) {
   int fds[3] = {in_fd, out_fd, err_fd};
   for (int target = 0; target < 3; ++target) {
     int fd = fds[target];
@@ -50,6 +50,10 @@ void WriteAll(int fd, const void* buf, size_t size) {
       _exit(127);
     }
   }
+  // A service outlives its caller: it must not keep the caller's files,
+  // sockets or locks open. Best effort; an old kernel leaves them as they
+  // are.
+  if (detach) close_range(3, ~0U, CLOSE_RANGE_CLOEXEC);
   signal(SIGPIPE, SIG_DFL);
   execvp(argv[0], const_cast<char* const*>(argv));
   int err = errno;
@@ -78,11 +82,13 @@ pid_t Spawn(const char* const argv[], int in_fd, int out_fd, int err_fd,
   }
   if (child == 0) {
     close(report[0]);
-    if (!detach) ExecChild(argv, in_fd, out_fd, err_fd, report[1]);
+    if (!detach) ExecChild(argv, in_fd, out_fd, err_fd, report[1], false);
     if (setsid() < 0) _exit(127);
     pid_t grandchild = fork();
     if (grandchild < 0) _exit(127);
-    if (grandchild == 0) ExecChild(argv, in_fd, out_fd, err_fd, report[1]);
+    if (grandchild == 0) {
+      ExecChild(argv, in_fd, out_fd, err_fd, report[1], true);
+    }
     WriteAll(report[1], &grandchild, sizeof grandchild);
     _exit(0);
   }

@@ -1,5 +1,6 @@
 #include "S2S/s2s_host.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -102,10 +103,16 @@ TEST_F(DaemonTest, StartsAndStopsTheConfiguredProgram) {
   ASSERT_TRUE(s2s_test::WriteScript(prog, "exec sleep 60\n"));
   ASSERT_TRUE(Platform("\tdaemon_program=\"" + prog + "\"\n"));
   EXPECT_FALSE(S2S::IsDaemonRunning());
+  int inheritable = open("/dev/null", O_RDONLY);  // no O_CLOEXEC
   ASSERT_EQ(S2S::StartDaemon(), 0);
   EXPECT_TRUE(S2S::IsDaemonRunning());
   pid_t pid = KaroReadPidFile(root_.Path("/var/run/s2s_daemon.pid").c_str());
   ASSERT_GT(pid, 0);
+  // The service keeps none of its starter's descriptors.
+  std::string fd_link =
+      "/proc/" + std::to_string(pid) + "/fd/" + std::to_string(inheritable);
+  EXPECT_NE(access(fd_link.c_str(), F_OK), 0);
+  close(inheritable);
 
   // A second start meets the running service: 0xEB00, which is success.
   EXPECT_EQ(KLIBServiceStart("s2s_daemon", 0), -1);
