@@ -5,6 +5,7 @@
 #include <string.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <string>
 
 #include "karo_err.h"
@@ -25,6 +26,9 @@ const char kTempTemplate[] = "/tmp/S2S/temp.XXXXXX";
 
 std::string GetHostName(unsigned int maxlen) {
   char buffer[64] = {0};
+  // The platform may fill all `maxlen` bytes without a NUL; never let it
+  // reach past the buffer whatever the caller asks.
+  maxlen = std::min(maxlen, static_cast<unsigned int>(sizeof buffer - 1));
   if (KAROLnxGetHostname(buffer, static_cast<int>(maxlen)) < 0) {
     LOG_ERROR("Fail to call KAROLnxGetHostname");
     return std::string();
