@@ -14,9 +14,16 @@
 #error "define S2S_LOG_AREA before including S2S/log.h"
 #endif
 
-#define S2S_LOG_RAW(level, tag, fmt, nl, ...)                            \
-  ::S2S::Logger::LogMsg(level, tag " S2S/" S2S_LOG_AREA "(%d): " fmt nl, \
-                        __LINE__, ##__VA_ARGS__)
+// The level test up front keeps filtered messages (the per-call DEBUG lines
+// of the transport) off the logger's mutex. The level only changes in
+// Logger::Initialize, which runs while no other thread logs.
+#define S2S_LOG_RAW(level, tag, fmt, nl, ...)                                \
+  do {                                                                       \
+    if (static_cast<int>(level) <= ::S2S::Logger::GetLevel()) {              \
+      ::S2S::Logger::LogMsg(level, tag " S2S/" S2S_LOG_AREA "(%d): " fmt nl, \
+                            __LINE__, ##__VA_ARGS__);                        \
+    }                                                                        \
+  } while (0)
 
 #define LOG_ERROR(fmt, ...) \
   S2S_LOG_RAW(::S2S::Logger::Error, "[ERROR]", fmt, "\n", ##__VA_ARGS__)
