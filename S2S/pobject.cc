@@ -70,6 +70,13 @@ PObject& PObject::operator=(const std::string& s) {
   copy(s);
   return *this;
 }
+PObject& PObject::operator=(std::string&& s) {
+  std::string* holder = new std::string(std::move(s));
+  clear();
+  value_ = holder;
+  type_ = kString;
+  return *this;
+}
 PObject& PObject::operator=(unsigned long long v) {
   copy(v);
   return *this;
@@ -126,6 +133,11 @@ unsigned long long PObject::asUInt64() const {
 bool PObject::asBool() const {
   if (!isNull() && isInteger()) return *as<unsigned long long>() != 0;
   return !isEmpty();
+}
+
+const std::string& PObject::asStringRef() const {
+  static const std::string* const empty = new std::string();
+  return !isNull() && isString() ? *as<std::string>() : *empty;
 }
 
 std::string PObject::asString() const {

@@ -227,6 +227,19 @@ TEST(PObjectCopy, SwapExchangesWithoutCopying) {
   EXPECT_EQ(b.asString(), "left");
 }
 
+TEST(PObjectCopy, StringsMoveInAndAreReadInPlace) {
+  std::string big(1000, 'm');
+  const char* bytes = big.data();
+  PObject p;
+  p["x"] = 1ull;
+  p = std::move(big);
+  ASSERT_TRUE(p.isString());
+  EXPECT_EQ(p.asStringRef().data(), bytes);  // taken over, not copied
+  EXPECT_EQ(p.asStringRef(), std::string(1000, 'm'));
+  EXPECT_EQ(PObject(7ull).asStringRef(), "");
+  EXPECT_EQ(PObject().asStringRef(), "");
+}
+
 TEST(PObjectRender, NestedValuesAndRawStrings) {
   PObject m;
   m["a"] = 1u;

@@ -50,6 +50,8 @@ class S2S_EXPORT PObject {
   // Every assignment replaces the whole value, whatever kind it had.
   PObject& operator=(const char* s);
   PObject& operator=(const std::string& s);
+  // Takes the string's bytes over without copying them.
+  PObject& operator=(std::string&& s);
   PObject& operator=(unsigned long long v);
   PObject& operator=(int v);           // sign-extended: -1 is 2^64-1
   PObject& operator=(unsigned int v);  // zero-extended
@@ -91,6 +93,9 @@ class S2S_EXPORT PObject {
   // A string: a copy. An integer: its low 32 bits as unsigned decimal (the
   // integer 4294967296 gives "0"). Anything else: "".
   std::string asString() const;
+  // A string: the stored string itself, without a copy. Anything else: a
+  // shared empty string. Valid until the object changes.
+  const std::string& asStringRef() const;
 
   // The stored container, or the shared empty one for any other kind.
   const Map& asMap() const;
