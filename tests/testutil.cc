@@ -17,6 +17,7 @@
 #include <mutex>
 #include <sstream>
 
+#include "S2S/logger.h"
 #include "S2S/syslog_sink.h"
 
 namespace s2s_test {
@@ -140,6 +141,46 @@ void SyslogCapture::Clear() {
   std::lock_guard<std::mutex> lock(syslog_mutex);
   syslog_messages.clear();
   syslog_priorities.clear();
+}
+
+LogCapture::LogCapture(int level) {
+  S2S::Logger::Initialize(S2S::Logger::Syslog, level, "", 0);
+}
+
+LogCapture::~LogCapture() {
+  S2S::Logger::Initialize(S2S::Logger::Syslog, S2S::Logger::Error, "", 0);
+}
+
+bool UnixSocketPair(int fds[2]) {
+  return socketpair(AF_UNIX, SOCK_STREAM, 0, fds) == 0;
+}
+
+bool TcpSocketPair(int fds[2]) {
+  int lfd = socket(AF_INET, SOCK_STREAM, 0);
+  if (lfd < 0) return false;
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t len = sizeof addr;
+  bool ok = bind(lfd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0 &&
+            listen(lfd, 1) == 0 &&
+            getsockname(lfd, reinterpret_cast<sockaddr*>(&addr), &len) == 0;
+  fds[0] = fds[1] = -1;
+  if (ok) {
+    fds[0] = socket(AF_INET, SOCK_STREAM, 0);
+    ok = fds[0] >= 0 &&
+         connect(fds[0], reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
+  }
+  if (ok) {
+    fds[1] = accept(lfd, nullptr, nullptr);
+    ok = fds[1] >= 0;
+  }
+  close(lfd);
+  if (!ok) {
+    if (fds[0] >= 0) close(fds[0]);
+    if (fds[1] >= 0) close(fds[1]);
+  }
+  return ok;
 }
 
 std::string ReadFile(const std::string& path) {

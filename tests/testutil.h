@@ -62,6 +62,19 @@ class SyslogCapture {
   void Clear();
 };
 
+// Routes the library's log, every message up to `level`, into the capture for
+// its lifetime; afterwards the logger is back on the system log, errors only.
+class LogCapture : public SyslogCapture {
+ public:
+  explicit LogCapture(int level = 7);
+  ~LogCapture();
+};
+
+// Two connected stream sockets: a Unix-domain socketpair, or a TCP
+// connection over 127.0.0.1. Both ends blocking; false on failure.
+bool UnixSocketPair(int fds[2]);
+bool TcpSocketPair(int fds[2]);
+
 // Reads a whole file; "" when it cannot be read.
 std::string ReadFile(const std::string& path);
 // Writes a whole file; true on success.

@@ -2,7 +2,9 @@
 #ifndef S2S_S2S_H_
 #define S2S_S2S_H_
 
+#include "S2S/channel.h"
 #include "S2S/export.h"
+#include "S2S/ipc.h"
 #include "S2S/logger.h"
 #include "S2S/pobject.h"
 #include "S2S/result_codes.h"
@@ -10,5 +12,6 @@
 #include "S2S/s2s_host.h"
 #include "S2S/s2s_lock.h"
 #include "S2S/s2s_share.h"
+#include "S2S/stream.h"
 
 #endif  // S2S_S2S_H_

@@ -1,0 +1,160 @@
+#include "S2S/ipc.h"
+
+#include <arpa/inet.h>
+#include <gtest/gtest.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <thread>
+
+#include "testutil.h"
+
+namespace {
+
+using S2S::IPCListener;
+using S2S::IPCSender;
+using S2S::PObject;
+using s2s_test::LogCapture;
+using s2s_test::TempDir;
+
+bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
+
+timeval Seconds(int s) {
+  timeval tv;
+  tv.tv_sec = s;
+  tv.tv_usec = 0;
+  return tv;
+}
+
+// Serves `clients` connections one after another: each request map comes
+// back with "echo" set to its "n" plus one.
+void Serve(IPCListener& listener, int clients) {
+  for (int i = 0; i < clients; ++i) {
+    if (listener.isReady() != 1) return;
+    IPCSender end;
+    if (end.assign(listener.accept()) != 0) return;
+    PObject req;
+    while (end.recv(req) == 0) {
+      PObject reply = req;
+      reply["echo"] = req["n"].asUInt64() + 1;
+      if (end.send(reply) != 0) break;
+      req.clear();
+    }
+  }
+}
+
+TEST(IPCTest, DomainListenerServesClientsOneAfterAnother) {
+  TempDir dir;
+  const std::string path = dir.Sub("ipc.sock");
+  ASSERT_TRUE(s2s_test::WriteFile(path, "stale"));  // leftover file
+  IPCListener listener;
+  ASSERT_EQ(listener.prepare(path), 0);
+  EXPECT_EQ(listener.prepare(dir.Sub("other.sock")), -1);  // keeps the first
+  EXPECT_FALSE(Exists(dir.Sub("other.sock")));
+  std::thread server(Serve, std::ref(listener), 3);
+  for (int c = 0; c < 3; ++c) {
+    IPCSender client;
+    ASSERT_EQ(client.connect(path), 0);
+    for (unsigned long long n = 0; n < 5; ++n) {
+      PObject req, reply;
+      req["n"] = n;
+      req["client"] = static_cast<unsigned long long>(c);
+      ASSERT_EQ(client.send(req, true, reply), 0);
+      EXPECT_EQ(reply["echo"].asUInt64(), n + 1);
+      EXPECT_EQ(reply["client"].asUInt64(), static_cast<unsigned>(c));
+    }
+  }
+  server.join();
+  EXPECT_TRUE(Exists(path));
+  EXPECT_EQ(listener.close(), 0);
+  EXPECT_FALSE(Exists(path));
+  EXPECT_EQ(listener.close(), -1);
+}
+
+TEST(IPCTest, TcpListenerSearchesForAFreePort) {
+  LogCapture log(6);
+  int taken_port = s2s_test::FreeLoopbackPort();
+  int taken = IPCListener::OpenSocket(taken_port);
+  ASSERT_GE(taken, 0);
+  IPCListener listener;
+  int port = listener.prepare(taken_port);
+  ASSERT_GT(port, taken_port);
+  EXPECT_NE(log.Text().find("Try to bind port: " + std::to_string(taken_port)),
+            std::string::npos);
+  EXPECT_NE(log.Text().find("Bind port " + std::to_string(taken_port) +
+                            " failed, try next one"),
+            std::string::npos);
+
+  std::thread server(Serve, std::ref(listener), 1);
+  IPCSender client;
+  ASSERT_EQ(client.connect(port), 0);
+  PObject req, reply;
+  req["n"] = 41ull;
+  ASSERT_EQ(client.send(req, true, reply), 0);
+  EXPECT_EQ(reply["echo"].asUInt64(), 42u);
+  client.close();
+  server.join();
+  IPCListener::CloseSocket(taken);
+
+  // Preparing again replaces the TCP listener.
+  EXPECT_GE(listener.prepare(port), port);
+}
+
+TEST(IPCTest, PortSearchEndsAt65535) {
+  LogCapture log(3);
+  // When this fails the port is busy anyway, which serves as well.
+  int taken = IPCListener::OpenSocket(65535);
+  IPCListener listener;
+  EXPECT_EQ(listener.prepare(65535), -1);
+  EXPECT_NE(log.Text().find("Port number exceeds 65536"), std::string::npos);
+  EXPECT_EQ(listener.getFD(), -1);
+  IPCListener::CloseSocket(taken);
+}
+
+TEST(IPCTest, RefusedPathsAndIdleListener) {
+  LogCapture log(3);
+  TempDir dir;
+  const std::string too_long = dir.path() + "/" + std::string(120, 'p');
+  IPCListener listener;
+  EXPECT_EQ(listener.prepare(too_long), -1);
+  EXPECT_EQ(listener.prepare(std::string()), -1);
+  EXPECT_EQ(listener.isReady(), 0);
+  EXPECT_EQ(listener.accept(), -1);
+  IPCSender sender;
+  EXPECT_EQ(sender.connect(too_long), -1);
+  EXPECT_EQ(sender.connect(dir.Sub("nobody")), -1);
+  EXPECT_EQ(sender.connect(-1), -1);
+  EXPECT_EQ(sender.assign(-1), -1);
+
+  ASSERT_EQ(listener.prepare(dir.Sub("idle.sock")), 0);
+  listener.setTimeout(Seconds(0));
+  EXPECT_EQ(listener.isReady(), 0);
+}
+
+TEST(IPCTest, PeerGoingAwayBeforeTheReply) {
+  LogCapture log(3);
+  TempDir dir;
+  IPCListener listener;
+  ASSERT_EQ(listener.prepare(dir.Sub("s")), 0);
+  std::thread server([&] {
+    ASSERT_EQ(listener.isReady(), 1);
+    IPCSender end;
+    ASSERT_EQ(end.assign(listener.accept()), 0);
+    PObject req;
+    ASSERT_EQ(end.recv(req), 0);  // first request: no reply wanted
+    ASSERT_EQ(end.recv(req), 0);  // second: hang up instead of answering
+  });
+  IPCSender client;
+  client.channel().SetTimeout(2);
+  ASSERT_EQ(client.connect(dir.Sub("s")), 0);
+  PObject req, reply;
+  req["n"] = 1ull;
+  EXPECT_EQ(client.send(req, false, reply), 0);
+  EXPECT_TRUE(reply.isNull());  // nothing was read
+  EXPECT_EQ(client.send(req, true, reply), -1);
+  server.join();
+  EXPECT_NE(log.Text().find("Error stack: "), std::string::npos);
+}
+
+}  // namespace

@@ -1,0 +1,306 @@
+#include "S2S/stream.h"
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <random>
+#include <string>
+
+#include "S2S/result_codes.h"
+#include "testutil.h"
+
+namespace {
+
+using S2S::Channel;
+using S2S::PObject;
+using S2S::PStream;
+using s2s_test::LogCapture;
+
+std::string Bytes(std::initializer_list<int> b) {
+  std::string s;
+  for (int c : b) s.push_back(static_cast<char>(c));
+  return s;
+}
+
+// A channel on one end of a socket pair; the test speaks raw bytes on the
+// other end.
+class Wire {
+ public:
+  Wire() : ch_(256) {
+    int fds[2];
+    ok_ = s2s_test::UnixSocketPair(fds) && ch_.Open(fds[0], true) == 0;
+    peer_ = fds[1];
+    ch_.SetTimeout(1);
+  }
+  ~Wire() {
+    if (peer_ >= 0) close(peer_);
+  }
+  bool ok() const { return ok_; }
+
+  // Encodes with a fresh stream; the bytes that reached the peer.
+  std::string Encode(const PObject& obj, int* result = nullptr) {
+    PStream ps;
+    int r = ps.Send(ch_, obj);
+    if (result != nullptr) *result = r;
+    std::string out;
+    char buf[4096];
+    ssize_t n;
+    while ((n = recv(peer_, buf, sizeof buf, MSG_DONTWAIT)) > 0) {
+      out.append(buf, n);
+    }
+    return out;
+  }
+
+  // Feeds `bytes` and ends the stream, then decodes one message into `obj`.
+  int Decode(const std::string& bytes, PObject& obj) {
+    if (write(peer_, bytes.data(), bytes.size()) !=
+        static_cast<ssize_t>(bytes.size())) {
+      return 1;
+    }
+    shutdown(peer_, SHUT_WR);
+    return stream_.Recv(ch_, obj);
+  }
+
+  PStream stream_;
+
+ private:
+  Channel ch_;
+  int peer_ = -1;
+  bool ok_ = false;
+};
+
+PObject ExampleMap() {
+  PObject m;
+  m["a"] = 5ull;
+  m["b"] = "";
+  return m;
+}
+
+TEST(PStreamTest, EncodesValuesToTheirExactBytes) {
+  PObject empty_map, empty_array;
+  empty_map.asMap();
+  empty_array.asArray();
+  PObject array_of_null;
+  array_of_null.asArray().emplace_back();
+  PObject underscored;
+  underscored["_tmp"] = 1ull;
+  underscored["a_b"] = 2ull;
+  underscored["_"] = 3ull;
+  const struct {
+    PObject value;
+    std::string bytes;
+  } cases[] = {
+      {PObject(), Bytes({0x00, 0x00})},
+      {PObject(0ull), Bytes({0x01, 0x01, 0x00})},
+      {PObject(255ull), Bytes({0x01, 0x01, 0xFF})},
+      {PObject(256ull), Bytes({0x01, 0x02, 0x01, 0x00})},
+      {PObject(65536ull), Bytes({0x01, 0x04, 0x00, 0x01, 0x00, 0x00})},
+      {PObject(4294967296ull), Bytes({0x01, 0x08, 0, 0, 0, 0x01, 0, 0, 0, 0})},
+      {PObject(""), Bytes({0x10, 0x00, 0x00})},
+      {PObject("hi"), Bytes({0x10, 0x00, 0x02, 'h', 'i'})},
+      {empty_map, Bytes({0x42, 0x40})},
+      {empty_array, Bytes({0x41, 0x40})},
+      {array_of_null, Bytes({0x41, 0x00, 0x00, 0x40})},
+      {ExampleMap(), Bytes({0x42, 0x10, 0x00, 0x01, 0x61, 0x01, 0x01, 0x05,
+                            0x10, 0x00, 0x01, 0x62, 0x10, 0x00, 0x00, 0x40})},
+      // Keys in map order: "_", "_tmp", "a_b"; the leading underscore drops.
+      {underscored, Bytes({0x42, 0x10, 0x00, 0x00, 0x01, 0x01, 0x03, 0x10, 0x00,
+                           0x03, 't',  'm',  'p',  0x01, 0x01, 0x01, 0x10, 0x00,
+                           0x03, 'a',  '_',  'b',  0x01, 0x01, 0x02, 0x40})},
+  };
+  for (const auto& c : cases) {
+    Wire w;
+    ASSERT_TRUE(w.ok());
+    EXPECT_EQ(w.Encode(c.value), c.bytes) << c.value.toString();
+  }
+}
+
+TEST(PStreamTest, LongStringsAreSplitIntoRingSizedWrites) {
+  Wire w;
+  ASSERT_TRUE(w.ok());
+  std::string s(1000, 'q');  // four times the 256-byte ring
+  PObject obj(s);
+  int r = 1;
+  std::string bytes = w.Encode(obj, &r);
+  ASSERT_EQ(r, 0);
+  EXPECT_EQ(bytes, Bytes({0x10, 0x03, 0xE8}) + s);
+}
+
+// Random nested values survive a round trip through a channel pair.
+PObject RandomValue(std::mt19937& rng, int depth) {
+  switch (rng() % (depth > 4 ? 3 : 5)) {
+    case 0:
+      return PObject();
+    case 1:
+      return PObject(static_cast<unsigned long long>(rng()) << (rng() % 33));
+    case 2: {
+      std::string s(rng() % 40, '\0');
+      for (char& c : s) c = static_cast<char>(1 + rng() % 255);
+      return PObject(s);
+    }
+    case 3: {
+      PObject m;
+      for (unsigned i = rng() % 6; i > 0; --i) {
+        m["k" + std::to_string(rng() % 100)] = RandomValue(rng, depth + 1);
+      }
+      m.asMap();
+      return m;
+    }
+    default: {
+      PObject a;
+      a.asArray();
+      for (unsigned i = rng() % 6; i > 0; --i) {
+        a.asArray().push_back(RandomValue(rng, depth + 1));
+      }
+      return a;
+    }
+  }
+}
+
+TEST(PStreamTest, RandomNestedValuesRoundTrip) {
+  Channel a(512), b(512);
+  int fds[2];
+  ASSERT_TRUE(s2s_test::UnixSocketPair(fds));
+  ASSERT_EQ(a.Open(fds[0], true), 0);
+  ASSERT_EQ(b.Open(fds[1], true), 0);
+  std::mt19937 rng(1);
+  for (int i = 0; i < 200; ++i) {
+    PObject sent = RandomValue(rng, 0);
+    PObject got;
+    PStream tx, rx;
+    ASSERT_EQ(tx.Send(a, sent), 0);
+    ASSERT_EQ(rx.Recv(b, got), 0);
+    EXPECT_EQ(got.toString(), sent.toString());
+  }
+}
+
+TEST(PStreamTest, ReceivingMergesIntoWhatTheObjectHolds) {
+  Wire w;
+  ASSERT_TRUE(w.ok());
+  PObject target;
+  target["keep"] = "old";
+  target["a"] = "replaced";
+  target["b"]["inner"] = 1ull;
+  // {a: 5, b: {x: "y"}}
+  std::string msg =
+      Bytes({0x42, 0x10, 0, 1, 'a', 0x01, 0x01, 0x05, 0x10, 0,    1,   'b',
+             0x42, 0x10, 0, 1, 'x', 0x10, 0,    1,    'y',  0x40, 0x40});
+  ASSERT_EQ(w.Decode(msg, target), 0);
+  EXPECT_EQ(target["keep"].asString(), "old");
+  EXPECT_EQ(target["a"].asUInt64(), 5u);
+  EXPECT_EQ(target["b"]["inner"].asUInt64(), 1u);
+  EXPECT_EQ(target["b"]["x"].asString(), "y");
+
+  Wire w2;
+  PObject arr;
+  arr.asArray().emplace_back("first");
+  ASSERT_EQ(w2.Decode(Bytes({0x41, 0x10, 0, 1, 'z', 0x40}), arr), 0);
+  ASSERT_EQ(arr.asArray().size(), 2u);
+  EXPECT_EQ(arr.asArray()[1].asString(), "z");
+
+  Wire w3;
+  PObject s;
+  ASSERT_EQ(w3.Decode(Bytes({0x10, 0, 3, 'a', 0, 'b'}), s), 0);
+  EXPECT_EQ(s.asString(), "a");  // cut at the zero byte
+}
+
+TEST(PStreamTest, MalformedInputIsAProtocolError) {
+  const struct {
+    std::string bytes;
+    std::string logged;
+  } cases[] = {
+      {Bytes({0x00, 0x01}), "expect length 0, but we've got 1"},
+      {Bytes({0x40}), "Error stack: "},
+      {Bytes({0x42, 0x01, 0x01, 0x05, 0x40}),
+       "PStream: expect string, but get tag 1"},
+      {Bytes({0x41, 0x40, 0x40}), ""},  // fine: trailing byte unread
+      {Bytes({0x42, 0x10, 0, 1, 'k', 0x77, 0x40}), "Error stack: k.k"},
+      {Bytes({0x01, 0x09, 1, 2, 3, 4, 5, 6, 7, 8, 9}),
+       "integer width 9 exceeds 8"},
+      {Bytes({0x42, 0x10, 0, 1, 'a', 0x42, 0x10, 0, 1, 'b', 0x00, 0x07}),
+       "Error stack: a.a.b"},
+  };
+  for (const auto& c : cases) {
+    LogCapture log(3);
+    Wire w;
+    PObject obj;
+    int r = w.Decode(c.bytes, obj);
+    if (c.logged.empty()) {
+      EXPECT_EQ(r, 0);
+      continue;
+    }
+    EXPECT_EQ(r, S2S::kProtocolError) << c.logged;
+    EXPECT_NE(log.Text().find(c.logged), std::string::npos) << log.Text();
+  }
+}
+
+TEST(PStreamTest, DeepNestingIsRefusedNotACrash) {
+  LogCapture log(3);
+  std::string deep(5000, static_cast<char>(0x41));
+  Wire w;
+  PObject obj;
+  EXPECT_EQ(w.Decode(deep, obj), S2S::kProtocolError);
+  EXPECT_NE(log.Text().find("nesting deeper than 512"), std::string::npos);
+
+  std::string ok(PStream::kMaxDepth, static_cast<char>(0x41));
+  ok += std::string(PStream::kMaxDepth, static_cast<char>(0x40));
+  Wire w2;
+  PObject obj2;
+  EXPECT_EQ(w2.Decode(ok, obj2), 0);
+}
+
+// Every prefix of a message, and the message with any one byte changed,
+// decodes to a clean answer: success, -2 or -5, and never a hang.
+TEST(PStreamTest, TruncatedAndCorruptedMessagesFailCleanly) {
+  std::mt19937 rng(3);
+  PObject msg = RandomValue(rng, 0);
+  msg["list"] = RandomValue(rng, 3);
+  msg["n"] = 1234567ull;
+  msg["nested"]["deeper"].asArray().push_back(RandomValue(rng, 2));
+  msg["nested"]["null"] = PObject();
+  for (int i = 0; i < 4; ++i)
+    msg["r" + std::to_string(i)] = RandomValue(rng, 1);
+  Wire enc;
+  const std::string bytes = enc.Encode(msg);
+  ASSERT_GT(bytes.size(), 60u);
+  for (size_t len = 0; len < bytes.size(); ++len) {
+    Wire w;
+    PObject obj;
+    int r = w.Decode(bytes.substr(0, len), obj);
+    EXPECT_TRUE(r == S2S::kIOError || r == S2S::kProtocolError)
+        << "prefix " << len << " gave " << r;
+  }
+  const unsigned char probes[] = {0x00, 0x01, 0x10, 0x40, 0x41, 0x42, 0xFF};
+  for (size_t at = 0; at < bytes.size(); ++at) {
+    for (unsigned char p : probes) {
+      std::string bad = bytes;
+      bad[at] = static_cast<char>(p);
+      Wire w;
+      PObject obj;
+      int r = w.Decode(bad, obj);
+      EXPECT_TRUE(r == 0 || r == S2S::kIOError || r == S2S::kProtocolError)
+          << "byte " << at << " = " << int(p) << " gave " << r;
+    }
+  }
+}
+
+TEST(PStreamTest, HistoryAndStatus) {
+  PStream ps;
+  std::string h = "x";
+  unsigned long long first = 9, second = 9;
+  ps.GetStatus(h, first, second);
+  EXPECT_EQ(h, "");
+  EXPECT_EQ(first, 0u);
+  ps.UpdateStatus(3, 4);
+  ps.GetStatus(h, first, second);
+  EXPECT_EQ(first, 3u);
+  EXPECT_EQ(second, 4u);
+  unsigned int major, minor, patch;
+  ps.GetVersion(major, minor, patch);
+  EXPECT_EQ(major * 100 + minor * 10 + patch, 100u);
+  EXPECT_EQ(PStream::GetTag<std::string>(), 0x10);
+  EXPECT_EQ(PStream::GetType<PObject::Map>(), 2);
+}
+
+}  // namespace
