@@ -32,29 +32,36 @@
 extern "C" {
 #endif
 
+/* The hash and list calls marked KARO_C_EXPORT are also part of libs2s's C
+ * interface (S2S/is_syncedshare.h): C programs build with them the sections
+ * that the registry functions take. */
+#define KARO_C_EXPORT __attribute__((visibility("default")))
+
 /* ---- String hash: an insertion-ordered map of string keys to values. ---- */
 typedef struct KSZHASH KSZHASH;
 
 /* Returns an empty hash that holds at most `capacity` keys, or NULL
  * (KERR_NO_MEMORY, KERR_INVALID_ARG for capacity < 1). */
-KSZHASH* KLIBCSzHashAlloc(int capacity);
+KARO_C_EXPORT KSZHASH* KLIBCSzHashAlloc(int capacity);
 /* Frees the hash and its strings; NULL is ignored. */
-void KLIBCSzHashFree(KSZHASH* hash);
+KARO_C_EXPORT void KLIBCSzHashFree(KSZHASH* hash);
 /* Sets `key` to a copy of `value` (replacing an older value in place).
  * Returns 0, or -1: KERR_INVALID_ARG (null argument), KERR_NO_MEMORY (the
  * capacity is reached). */
-int KLIBCSzHashSetValue(KSZHASH* hash, const char* key, const char* value);
+KARO_C_EXPORT int KLIBCSzHashSetValue(KSZHASH* hash, const char* key,
+                                      const char* value);
 /* Returns the value of `key` (owned by the hash), or NULL when absent
  * (KERR_NOT_FOUND) or on a null argument (KERR_INVALID_ARG). */
-const char* KLIBCSzHashGetValue(const KSZHASH* hash, const char* key);
+KARO_C_EXPORT const char* KLIBCSzHashGetValue(const KSZHASH* hash,
+                                              const char* key);
 /* Removes `key`; 0, or -1 with KERR_NOT_FOUND. */
 int KLIBCSzHashRemove(KSZHASH* hash, const char* key);
 /* Number of keys; 0 for NULL. */
-int KLIBCSzHashCount(const KSZHASH* hash);
+KARO_C_EXPORT int KLIBCSzHashCount(const KSZHASH* hash);
 /* Key and value of the i-th pair in insertion order, or NULL when out of
  * range. */
-const char* KLIBCSzHashKeyAt(const KSZHASH* hash, int i);
-const char* KLIBCSzHashValueAt(const KSZHASH* hash, int i);
+KARO_C_EXPORT const char* KLIBCSzHashKeyAt(const KSZHASH* hash, int i);
+KARO_C_EXPORT const char* KLIBCSzHashValueAt(const KSZHASH* hash, int i);
 /* Removes every pair. */
 void KLIBCSzHashClear(KSZHASH* hash);
 
@@ -62,15 +69,15 @@ void KLIBCSzHashClear(KSZHASH* hash);
 typedef struct KSZLIST KSZLIST;
 
 /* Returns an empty list, or NULL (KERR_NO_MEMORY). */
-KSZLIST* KLIBCSzListAlloc(void);
+KARO_C_EXPORT KSZLIST* KLIBCSzListAlloc(void);
 /* Frees the list and its strings; NULL is ignored. */
-void KLIBCSzListFree(KSZLIST* list);
+KARO_C_EXPORT void KLIBCSzListFree(KSZLIST* list);
 /* Appends a copy of `s`; 0, or -1 (KERR_INVALID_ARG, KERR_NO_MEMORY). */
-int KLIBCSzListPush(KSZLIST* list, const char* s);
+KARO_C_EXPORT int KLIBCSzListPush(KSZLIST* list, const char* s);
 /* Number of strings; 0 for NULL. */
-int KLIBCSzListCount(const KSZLIST* list);
+KARO_C_EXPORT int KLIBCSzListCount(const KSZLIST* list);
 /* The i-th string (owned by the list), or NULL when out of range. */
-const char* KLIBCSzListGet(const KSZLIST* list, int i);
+KARO_C_EXPORT const char* KLIBCSzListGet(const KSZLIST* list, int i);
 
 /* ---- Formatted strings. ---- */
 /* Returns a newly allocated string formatted like printf, or NULL

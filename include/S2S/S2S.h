@@ -5,6 +5,7 @@
 #include "S2S/channel.h"
 #include "S2S/export.h"
 #include "S2S/ipc.h"
+#include "S2S/is_syncedshare.h"
 #include "S2S/logger.h"
 #include "S2S/pobject.h"
 #include "S2S/result_codes.h"

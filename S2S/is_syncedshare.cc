@@ -1,0 +1,221 @@
+// The registry file: creating it, reading sections, replacing them under the
+// registry lock, switching the service, and whether a share is a sync target.
+#include "S2S/is_syncedshare.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include "S2S/is_syncedshare_detail.h"
+#include "S2S/syslog_sink.h"
+#include "karo_err.h"
+#include "karo_root.h"
+
+namespace S2S {
+namespace detail {
+namespace {
+
+// A fresh root has no /usr/karo/etc yet; the registry's directory is made on
+// demand so that a relocated appliance starts from an empty tree.
+void MakeParents(const std::string& path) {
+  for (size_t slash = path.find('/', 1); slash != std::string::npos;
+       slash = path.find('/', slash + 1)) {
+    mkdir(path.substr(0, slash).c_str(), 0755);
+  }
+}
+
+// Reads `key` of `section` into `buf`; a missing file, section or key reads
+// as "". false (after logging) on any other failure.
+bool ReadTolerant(const std::string& file, const char* section, const char* key,
+                  char* buf, int size) {
+  buf[0] = '\0';
+  if (KLIBCFileGetSectionValue(file.c_str(), section, key, buf, size) >= 0) {
+    return true;
+  }
+  int err = KLIBCErrGet();
+  buf[0] = '\0';
+  if (err == KERR_NOT_FOUND || err == KERR_FILE_NOT_FOUND) return true;
+  REGISTRY_ERR_PREFIXED(
+      "KLIBCFileGetSectionValue error. key:[%s] errno=[0x%04X]", section, err);
+  return false;
+}
+
+}  // namespace
+
+std::string RegistryPath() { return KaroRootPath(kRegistryFile); }
+
+RegistryLock::RegistryLock() {
+  handle_ = KLIBCSemOpen(kRegistrySemKey);
+  if (handle_ < 0) return;
+  locked_ = KLIBCSemLock(handle_) == 0;
+}
+
+RegistryLock::~RegistryLock() {
+  if (locked_) KLIBCSemUnlock(handle_);
+  if (handle_ >= 0) KLIBCSemClose(handle_);
+}
+
+HashPtr LoadPairedClientInfo() {
+  HashPtr hash(KLIBCSzHashAlloc(1024));
+  if (!hash || S2SCheckServerInfo() != 0) return nullptr;
+  if (KLIBCFileGetSection(RegistryPath().c_str(), kPairedClientInfo,
+                          hash.get()) < 0) {
+    return nullptr;
+  }
+  return hash;
+}
+
+int StorePairedClientInfo(const KSZHASH* values) {
+  if (S2SCheckServerInfo() != 0) return -1;
+  const std::string file = RegistryPath();
+  int ret =
+      KLIBCIFileModifySection(file.c_str(), kPairedClientInfo, 0, values, 1, 0);
+  if (ret == 0) {
+    ret = KLIBCFileAddSection(file.c_str(), kPairedClientInfo, values, nullptr);
+  }
+  return ret < 0 ? -1 : 0;
+}
+
+int UpdateServerInfoLocked(const char* section, const KSZHASH* values) {
+  const std::string file = RegistryPath();
+  const char* name = section != nullptr ? section : "";
+  HashPtr scratch(KLIBCSzHashAlloc(512));
+  if (!scratch) return -1;
+  bool ok = true;
+  bool exists = false;
+  if (name[0] != '\0') {
+    int ret = KLIBCFileGetSection(file.c_str(), name, scratch.get());
+    if (ret < 0) {
+      Syslog(LOG_ERR,
+             "KLIBCFileGetSection error. filePath:[%s] szOldSecName:[%s]  "
+             "iRet:[%d]",
+             file.c_str(), name, ret);
+      ok = false;
+    } else if (ret > 0) {
+      exists = true;
+      if (KLIBCFileSetSection(file.c_str(), name, 0, values,
+                              KLIBC_SECTION_PAIR_FORMAT) < 0) {
+        Syslog(LOG_ERR,
+               "KLIBCFileSetSection() failed!! szFile=[%s], section=[%s], "
+               "errno=[0x%04X]",
+               file.c_str(), name, KLIBCErrGet());
+        ok = false;
+      }
+    }
+  }
+  if (ok && !exists) {
+    struct stat st;
+    if (stat(file.c_str(), &st) != 0) {
+      if (errno != ENOENT) {
+        Syslog(LOG_ERR, "Failed to stat file [%s], errno=[%d/%m]", file.c_str(),
+               errno);
+        ok = false;
+      } else {
+        int fd = open(file.c_str(),
+                      O_RDWR | O_CREAT | O_EXCL | O_TRUNC | O_SYNC | O_CLOEXEC,
+                      0777);
+        if (fd < 0) {
+          Syslog(LOG_ERR, "Failed to open file [%s], errno=[%d/%m]",
+                 file.c_str(), errno);
+          ok = false;
+        } else {
+          close(fd);
+        }
+      }
+    }
+    if (ok && KLIBCFileAddSection(file.c_str(), section, values,
+                                  KLIBC_SECTION_PAIR_FORMAT) < 1) {
+      Syslog(LOG_ERR,
+             "KLIBCFileAddSection() failed!! szFile=[%s], section=[%s], "
+             "errno=[0x%04X]",
+             file.c_str(), name, KLIBCErrGet());
+      ok = false;
+    }
+  }
+  if (ok) return 0;
+  Syslog(LOG_ERR, "Set section [%s ] value into [%s] error.", name,
+         file.c_str());
+  return -1;
+}
+
+}  // namespace detail
+}  // namespace S2S
+
+using S2S::detail::HashPtr;
+using S2S::detail::kPairedClientInfo;
+using S2S::detail::RegistryLock;
+using S2S::detail::RegistryPath;
+
+extern "C" int S2SCheckServerInfo(void) {
+  const std::string file = RegistryPath();
+  if (KLIBCFileExist(file.c_str())) return 0;
+  S2S::detail::MakeParents(file);
+  int fd = open(file.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+  if (fd < 0) return -1;
+  close(fd);
+  return 0;
+}
+
+extern "C" int S2SGetServerInfo(const char* section, KSZHASH* out) {
+  S2SCheckServerInfo();
+  return KLIBCFileGetSection(RegistryPath().c_str(), section, out);
+}
+
+extern "C" int S2SUpdateServerInfo(const char* section, const KSZHASH* values) {
+  S2SCheckServerInfo();
+  RegistryLock lock;
+  if (!lock.Held()) {
+    S2S::detail::Syslog(LOG_ERR, "S2SUpdateServerInfo() lock failed");
+    return -1;
+  }
+  return S2S::detail::UpdateServerInfoLocked(section, values);
+}
+
+extern "C" int KAROUISetS2S(int enable, const char* clientID,
+                            const char* serverName) {
+  if (S2SCheckServerInfo() != 0) return -1;
+  // Loaded under the lock, so that a pairing stored meanwhile by another
+  // process is not written back over with the old one.
+  RegistryLock lock;
+  if (!lock.Held()) return -1;
+  HashPtr hash = S2S::detail::LoadPairedClientInfo();
+  if (!hash) return -1;
+  if (clientID != nullptr && serverName != nullptr &&
+      (KLIBCSzHashSetValue(hash.get(), "clientID", clientID) != 0 ||
+       KLIBCSzHashSetValue(hash.get(), "serverName", serverName) != 0)) {
+    return -1;
+  }
+  if (KLIBCSzHashSetValue(hash.get(), "s2sEnabled", enable ? "yes" : "no") !=
+      0) {
+    return -1;
+  }
+  return S2S::detail::StorePairedClientInfo(hash.get());
+}
+
+extern "C" int KAROS2SIsSyncedShare(const char* shareName) {
+  if (shareName == nullptr || shareName[0] == '\0') {
+    KLIBCErrSetEx(KERR_INVALID_ARG, S2S_REGISTRY_SOURCE, __LINE__);
+    return 0;
+  }
+  S2S::detail::StrPtr section(KLIBCStrGet("SHARE_%s", shareName));
+  if (!section) {
+    REGISTRY_ERR_PREFIXED("Fail to KLIBCStrGet shareName:[%s] errno=[0x%04X]",
+                          shareName, KLIBCErrGet());
+    return 0;
+  }
+  const std::string file = RegistryPath();
+  char value[256];
+  if (!S2S::detail::ReadTolerant(file, kPairedClientInfo, "s2sEnabled", value,
+                                 sizeof value)) {
+    return 0;
+  }
+  if (strcmp(value, "no") == 0) return 0;
+  if (!S2S::detail::ReadTolerant(file, section.get(), "RunningID", value,
+                                 sizeof value)) {
+    return 0;
+  }
+  return value[0] != '\0' ? 1 : 0;
+}
