@@ -18,7 +18,7 @@ packages=(
   g++ cmake ninja-build pkg-config
   libssl-dev openssl libboost-dev
   libgtest-dev libgmock-dev libbenchmark-dev
-  rsync openssh-server openssh-client samba-common-bin acl
+  rsync openssh-server openssh-client samba-common-bin acl tzdata
 )
 
 install_missing() {

@@ -301,6 +301,15 @@ ScopedEnv::~ScopedEnv() {
   }
 }
 
+ScopedTZ::ScopedTZ(const std::string& tz) : env_(new ScopedEnv("TZ", tz)) {
+  tzset();
+}
+
+ScopedTZ::~ScopedTZ() {
+  env_.reset();
+  tzset();
+}
+
 namespace {
 
 // Runs a program to completion with its output discarded; true on exit 0.

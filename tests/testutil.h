@@ -6,6 +6,7 @@
 
 #include <sys/types.h>
 
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -181,6 +182,19 @@ class TempRoot : public TempDir {
 // Writes an executable shell script `body` (without the "#!/bin/sh" line)
 // at `path`; true on success.
 bool WriteScript(const std::string& path, const std::string& body);
+
+// A ScopedEnv for TZ that also makes the C library reread it (tzset) when
+// it is set and when it is restored.
+class ScopedTZ {
+ public:
+  explicit ScopedTZ(const std::string& tz);
+  ~ScopedTZ();
+  ScopedTZ(const ScopedTZ&) = delete;
+  ScopedTZ& operator=(const ScopedTZ&) = delete;
+
+ private:
+  std::unique_ptr<ScopedEnv> env_;
+};
 
 }  // namespace s2s_test
 
