@@ -14,5 +14,6 @@
 #include "S2S/s2s_lock.h"
 #include "S2S/s2s_share.h"
 #include "S2S/stream.h"
+#include "S2S/sync_obj.h"
 
 #endif  // S2S_S2S_H_
