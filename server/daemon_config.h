@@ -1,0 +1,49 @@
+// Generation of the server's rsync daemon configuration from its share
+// configuration: rsyncd.conf and the secrets file, both under the root.
+//
+// Modules: one per configured share (named after the share, "@share@" for an
+// encrypted one, whose module is its encrypted lower directory), each
+// guarded by the handler's "data" hook; "s2scmd" (command replies, with the
+// early/pre/post hooks), "s2sspool" (write-only upload of large commands)
+// and "s2skeys" (the key-file directory). All modules require the one daemon
+// user; the daemon keeps owners and modes with `fake super` unless it runs
+// as root.
+#ifndef S2S_SERVER_DAEMON_CONFIG_H_
+#define S2S_SERVER_DAEMON_CONFIG_H_
+
+#include <sys/types.h>
+
+#include <string>
+
+namespace S2S {
+namespace server {
+
+struct DaemonConfig {
+  // Absolute path of the command handler program the hooks run.
+  std::string handler;
+  // The one daemon user and its password (goes only to the secrets file).
+  std::string user;
+  std::string password;
+  // Who the daemon's transfers run as.
+  uid_t uid = 0;
+  gid_t gid = 0;
+  // The handler behaves as an old server (protocol version 0).
+  bool old_server = false;
+};
+
+// Where the files go (under the root).
+std::string DaemonConfigPath();   // /etc/s2s/rsyncd.conf
+std::string DaemonSecretsPath();  // /etc/s2s/rsyncd.secrets
+std::string DaemonPidPath();      // /var/run/rsyncd.pid
+
+// Writes both files (the secrets file with mode 0600) and creates the spool
+// directories. Returns 0, or -1 (logged) when a value cannot be written
+// safely (a handler path or root with characters a shell would interpret, a
+// user or password that the secrets file cannot hold, a share path with a
+// line break) or a file cannot be written.
+int WriteDaemonConfig(const DaemonConfig& config);
+
+}  // namespace server
+}  // namespace S2S
+
+#endif  // S2S_SERVER_DAEMON_CONFIG_H_

@@ -1,0 +1,45 @@
+// s2s-cmd-handler: the program the server's rsync daemon runs from its hooks.
+//
+//   s2s-cmd-handler [--root DIR] [--old-server] early|pre|post|data
+//
+// --root sets the appliance root (as S2S_ROOT does) for the registry, the
+// share configuration and the spool directories.
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+
+#include "S2S/logger.h"
+#include "hooks.h"
+#include "karo_root.h"
+
+int main(int argc, char** argv) {
+  bool old_server = false;
+  const char* mode = nullptr;
+  for (int i = 1; i < argc; ++i) {
+    if (strcmp(argv[i], "--root") == 0 && i + 1 < argc) {
+      setenv(KARO_ROOT_ENV, argv[++i], 1);
+    } else if (strcmp(argv[i], "--old-server") == 0) {
+      old_server = true;
+    } else if (mode == nullptr) {
+      mode = argv[i];
+    } else {
+      mode = nullptr;
+      break;
+    }
+  }
+  if (mode == nullptr) {
+    fprintf(stderr,
+            "usage: %s [--root DIR] [--old-server] early|pre|post|data\n",
+            argv[0]);
+    return 2;
+  }
+  S2S::Logger::Initialize(S2S::Logger::Syslog, S2S::Logger::Note, "", 0);
+  using namespace S2S::server;
+  HookEnv env = HookEnv::FromEnvironment();
+  if (strcmp(mode, "early") == 0) return EarlyHook(env, stdin);
+  if (strcmp(mode, "pre") == 0) return PreHook(env, old_server);
+  if (strcmp(mode, "post") == 0) return PostHook(env);
+  if (strcmp(mode, "data") == 0) return DataHook(env, stdout);
+  fprintf(stderr, "%s: unknown mode %s\n", argv[0], mode);
+  return 2;
+}
