@@ -125,7 +125,10 @@ int WriteDaemonConfig(const DaemonConfig& c) {
       "\nuse chroot = no\n"
       "uid = " +
       std::to_string(c.uid) + "\ngid = " + std::to_string(c.gid) +
-      "\nsocket options = TCP_NODELAY\n";
+      "\nsocket options = TCP_NODELAY\n"
+      // Access is by user and password; a reverse lookup of every peer
+      // would only add a resolver round trip to each connection.
+      "reverse lookup = no\n";
   if (c.uid != 0) conf += "fake super = yes\n";
   conf += std::string("[") + kCommandModule + "]\n\tpath = " + ReplyDir() +
           "\n\tread only = yes\n\tlist = no\n" + auth +
