@@ -3,6 +3,10 @@
 #include <gtest/gtest.h>
 
 #include <string>
+#include <thread>
+
+#include "S2S/ipc.h"
+#include "testutil.h"
 
 namespace {
 
@@ -133,6 +137,36 @@ TEST(SyncTaskMapping, StatusAndResultAreReadWhenAskedFor) {
   S2S::PObj2SyncTask(empty, task, status, result);
   EXPECT_EQ(status, 0);
   EXPECT_EQ(result, 0);
+}
+
+// The way tasks really travel: as maps between processes' IPC ends. The
+// serving end rebuilds the task and sends it back as a map of its own.
+TEST(SyncTaskMapping, TaskCrossesAnIpcLinkAndIsRebuiltEqual) {
+  s2s_test::TempDir dir;
+  S2S::IPCListener listener;
+  ASSERT_EQ(listener.prepare(dir.Sub("ipc.sock")), 0);
+  std::thread server([&listener] {
+    S2S::IPCSender end;
+    if (listener.isReady() != 1 || end.assign(listener.accept()) != 0) return;
+    PObject request;
+    if (end.recv(request) != 0) return;
+    SyncTask rebuilt;
+    S2S::PObj2SyncTask(request, rebuilt);
+    PObject reply;
+    S2S::SyncTask2PObj(rebuilt, reply);
+    end.send(reply);
+  });
+  S2S::IPCSender client;
+  ASSERT_EQ(client.connect(dir.Sub("ipc.sock")), 0);
+  SyncTask task = FullTask();
+  PObject request, reply;
+  S2S::SyncTask2PObj(task, request);
+  EXPECT_EQ(client.send(request, true, reply), 0);
+  server.join();
+  SyncTask back;
+  S2S::PObj2SyncTask(reply, back);
+  EXPECT_TRUE(back == task);
+  EXPECT_EQ(back.GetInfo().GetSyncInfo().GetPassword(), "s3cret");
 }
 
 }  // namespace
