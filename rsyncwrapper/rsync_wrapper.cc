@@ -35,6 +35,23 @@ void RsyncWrapper::setTimeout(unsigned int seconds) {
   settings_->timeout = seconds;
 }
 
+bool RsyncWrapper::getDelete() const { return settings_->del; }
+bool RsyncWrapper::getNumericIds() const { return settings_->numeric_ids; }
+bool RsyncWrapper::getKaroAuthUse() const { return settings_->use_auth; }
+bool RsyncWrapper::getKaroAuthRequire() const {
+  return settings_->require_auth;
+}
+bool RsyncWrapper::getKaroPseudoRoot() const { return settings_->pseudo_root; }
+bool RsyncWrapper::getSsh() const { return settings_->ssh; }
+unsigned int RsyncWrapper::getPort() const { return settings_->ssh_port; }
+bool RsyncWrapper::getCompress() const { return settings_->compress; }
+bool RsyncWrapper::getDeltaCopy() const { return settings_->delta_copy; }
+bool RsyncWrapper::getListOnly() const { return settings_->list_only; }
+bool RsyncWrapper::getRelativePath() const { return settings_->relative; }
+bool RsyncWrapper::getKaroAcl() const { return settings_->acl; }
+bool RsyncWrapper::getDebugLog() const { return settings_->debug_log; }
+unsigned int RsyncWrapper::getTimeout() const { return settings_->timeout; }
+
 void RsyncWrapper::setKaroCustCmdRule(const std::list<std::string>& lines) {
   settings_->command_lines = lines;
 }

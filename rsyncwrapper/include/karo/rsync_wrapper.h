@@ -99,6 +99,22 @@ class KARO_RSYNC_EXPORT RsyncWrapper {
   void setDebugLog(bool on);
   void setTimeout(unsigned int seconds);
 
+  // The switches as set, for whoever configured the object to check it.
+  bool getDelete() const;
+  bool getNumericIds() const;
+  bool getKaroAuthUse() const;
+  bool getKaroAuthRequire() const;
+  bool getKaroPseudoRoot() const;
+  bool getSsh() const;
+  unsigned int getPort() const;  // 0 when never set
+  bool getCompress() const;
+  bool getDeltaCopy() const;
+  bool getListOnly() const;
+  bool getRelativePath() const;
+  bool getKaroAcl() const;
+  bool getDebugLog() const;
+  unsigned int getTimeout() const;
+
   // The command lines (key="value", no line breaks). A non-empty rule makes
   // execute() a command; an `outfile="PATH"` line names the local file that
   // receives the server's answer.
