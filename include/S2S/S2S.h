@@ -9,6 +9,7 @@
 #include "S2S/logger.h"
 #include "S2S/pobject.h"
 #include "S2S/result_codes.h"
+#include "S2S/rsyncer.h"
 #include "S2S/s2s_address.h"
 #include "S2S/s2s_host.h"
 #include "S2S/s2s_lock.h"
