@@ -1,0 +1,87 @@
+// Two appliances on one machine: a client root and a server root in one
+// temporary directory, the server's rsync daemon configured by the server's
+// own generator and running on a free loopback port, and the environment
+// pointed at the client (S2S_ROOT, S2S_RSYNC_PORT) so that the library under
+// test talks to that daemon as a client would.
+#ifndef S2S_TESTS_APPLIANCES_H_
+#define S2S_TESTS_APPLIANCES_H_
+
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "S2S/sync_obj_task.h"
+#include "testutil.h"
+
+namespace s2s_test {
+
+class Appliances {
+ public:
+  // `handler`: the server's command handler program, which the daemon's
+  // hooks run. S2S_ROOT points at the client root while the object lives.
+  explicit Appliances(const std::string& handler);
+  ~Appliances();
+  Appliances(const Appliances&) = delete;
+  Appliances& operator=(const Appliances&) = delete;
+
+  // Declares share `name` on both appliances (and on every client added
+  // later), with an empty directory on each side. An encrypted share has its
+  // data in its lower directory "@name@" and a key file of its own on the
+  // client. Call before StartServer.
+  bool AddShare(const std::string& name, bool encrypted = false);
+  // Generates the server's daemon configuration under the server root and
+  // starts the daemon; S2S_RSYNC_PORT then names its port. `old_server`
+  // makes the handler answer as a protocol-0 server.
+  bool StartServer(bool old_server = false);
+  void StopServer();
+
+  // Another client appliance with its own identity (serial) and the same
+  // shares; returns its root. Enter() it to act as that client.
+  std::string AddClient(const std::string& serial);
+  // Points S2S_ROOT at `root` (client_root(), server_root() or an added
+  // client) until the next Enter or the end of the object.
+  void Enter(const std::string& root);
+
+  const std::string& client_root() const { return client_root_; }
+  const std::string& server_root() const { return server_root_; }
+  // A share's directory on the client / the server (the lower directory
+  // for an encrypted share).
+  std::string ClientShare(const std::string& name) const;
+  std::string ServerShare(const std::string& name) const;
+  // The client's key file of an encrypted share.
+  std::string ClientKeyFile(const std::string& name) const;
+  // The key-file directory of the server.
+  std::string ServerKeyDir() const;
+
+  // What a client knows of the server: 127.0.0.1, the daemon's user and
+  // password, no SSH.
+  S2S::SyncInfo Info() const;
+  const std::string& user() const { return user_; }
+  RsyncDaemon& daemon() { return daemon_; }
+  std::string DaemonLog() const { return daemon_.Log(); }
+
+ private:
+  struct Share {
+    std::string name;
+    bool encrypted;
+  };
+  bool WriteClient(const std::string& root, const std::string& serial,
+                   const std::string& hostname);
+  std::string ShareConf(const std::string& root) const;
+
+  TempDir dir_;
+  std::string client_root_;
+  std::string server_root_;
+  std::string handler_;
+  std::string user_;
+  std::string password_;
+  std::vector<Share> shares_;
+  std::vector<std::string> clients_;
+  std::unique_ptr<ScopedEnv> root_env_;
+  std::unique_ptr<ScopedEnv> port_env_;
+  RsyncDaemon daemon_;
+};
+
+}  // namespace s2s_test
+
+#endif  // S2S_TESTS_APPLIANCES_H_
