@@ -9,6 +9,12 @@ int main() {
   msg["id"] = 7u;
   if (msg.toString() != "{\"id\": 7, \"name\": \"task\"}") return 1;
   if (std::string(S2S::ResultMessage(-5)) != "Protocal error") return 1;
+  // The Rsyncer's tasks derive from the rsync wrapper: libkarorsync must come
+  // along with libs2s.
+  S2S::Rsyncer rsyncer;
+  std::list<std::string> parts;
+  S2S::Rsyncer::SplitStringByChars("a:b", ":", parts);
+  if (parts.size() != 2 || rsyncer.SupportMultiSource()) return 1;
   if (S2S::Logger::Initialize(S2S::Logger::Stdout, 3, "", 0) != 0) return 1;
   std::puts("consumer ok");
   return 0;
