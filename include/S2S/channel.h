@@ -68,9 +68,17 @@ class S2S_EXPORT Channel {
   virtual int SetTimeout(unsigned int seconds);
   // The channel only reads through `flag`; it must outlive every operation.
   virtual int SetFlag(int* flag);
-  // Turns an open plain channel into TLS, as server or client end. 0; -2 on
-  // set-up or handshake failure; -24 when verification fails; see
-  // channel_ssl.cc. 0 without change when already TLS.
+  // Turns an open plain channel into TLS in place, as server end (presents
+  // GetCertPath() and GetKeyPath()) or client end. A client that does not
+  // allow untrusted peers checks the chain against GetCAPath() and, when a
+  // host name is set, the name (SetSSLHostname). 0; -2 when the channel is
+  // closed, on set-up failure and when the handshake fails or outlasts the
+  // time-out; -24 when verification fails. A failure leaves the channel open
+  // and plain. 0 without change when already TLS. Close() returns to plain.
+  //
+  // The handshake uses the library's general-purpose method; with OpenSSL 3
+  // at its default security level that allows TLS 1.2 and TLS 1.3 only
+  // (older versions need security level 0 on both ends).
   virtual int ConvertToSSLChannel(bool server);
 
   // Integer reads fill the output only on success.
@@ -139,10 +147,41 @@ class S2S_EXPORT Channel {
   unsigned int GetTimeout() const { return timeout; }
   bool IsSSL() const { return is_ssl; }
 
-  // TLS settings (channel_ssl.cc). They survive Close().
+  // TLS settings (channel_ssl.cc). They survive Close(). A client end that
+  // allows untrusted peers (the default) accepts any server certificate and
+  // loads no CA file. An empty host name (the default) skips the name check.
   void SetAllowUntrust(bool allow) { allow_untrust = allow; }
   bool IsAllowingUntrust() const { return allow_untrust; }
+  // A name matches the certificate's subject common name or any DNS entry of
+  // its alternative names, ignoring case; "*.example.test" stands for one
+  // leading label ("a.example.test", not "a.b.example.test").
   void SetSSLHostname(const std::string& name) { ssl_hostname = name; }
+
+  // Process-wide file locations: the server end's certificate chain and PEM
+  // private key, and the CA file a client end verifies against. Set them
+  // before the first conversion; they are not guarded.
+  static const std::string& GetCertPath();
+  static void SetCERTPath(std::string path);
+  static const std::string& GetKeyPath();
+  static void SetPriKeyPath(std::string path);
+  static const std::string& GetCAPath();
+  static void SetVerifyCAPath(const std::string& path);
+
+  // The steps of a conversion. InitSSL makes a context and a session for
+  // one end (0, or -1 with both freed); DeinitSSL frees what is there and
+  // nulls the pointers, sending close_notify first when `shutdown`;
+  // SSLHandshake drives the handshake on the session's descriptor, one
+  // `slice` at a time, until done (0), failed (-2, -3) or `timeout` seconds
+  // pass without progress (-9; 0 waits for ever). The cancel flag is not
+  // watched during a handshake. The Install functions load the files above
+  // into a context: 0, or -1 with the OpenSSL errors logged.
+  static int InitSSL(SSL*& ssl, SSL_CTX*& ctx, bool server, bool allowUntrust);
+  static int DeinitSSL(SSL*& ssl, SSL_CTX*& ctx, bool shutdown);
+  static int SSLHandshake(SSL* ssl, timeval slice, unsigned int timeout,
+                          int* flag);
+  static int InstallCERT(SSL_CTX* ctx);
+  static int InstallPriKey(SSL_CTX* ctx);
+  static int InstallVerifyCA(SSL_CTX* ctx);
 
  private:
   void* handle;  // int* socket for a plain channel, SSL* for TLS, or null
@@ -165,6 +204,10 @@ class S2S_EXPORT Channel {
   bool allow_untrust;
   std::string ssl_hostname;
 };
+
+// Drains this thread's OpenSSL error queue into the log, one WARNING line
+// "ssl-errors: ..." per entry.
+S2S_EXPORT void log_ssl();
 
 }  // namespace S2S
 
