@@ -5,10 +5,9 @@
 #include <openssl/err.h>
 #include <openssl/ssl.h>
 #include <openssl/x509v3.h>
-#include <pthread.h>
-#include <signal.h>
+#include <stdint.h>
 #include <string.h>
-#include <time.h>
+#include <sys/socket.h>
 
 #include <string>
 
@@ -32,53 +31,80 @@ void log_ssl() {
 
 namespace {
 
-// OpenSSL writes to the socket with write(), which raises SIGPIPE when the
-// peer is gone. The plain channel sends with MSG_NOSIGNAL; here the signal is
-// held back on this thread for the length of one OpenSSL call and discarded if
-// that call raised it, so a vanished peer is a result code, not the death of
-// the host. The error queue is emptied first: SSL_get_error() reads it.
-class SSLCall {
- public:
-  SSLCall() {
-    ERR_clear_error();
-    sigset_t pipe;
-    sigemptyset(&pipe);
-    sigaddset(&pipe, SIGPIPE);
-    pthread_sigmask(SIG_BLOCK, &pipe, &saved_);
-    sigset_t pending;
-    sigpending(&pending);
-    was_pending_ = sigismember(&pending, SIGPIPE) == 1;
-  }
-  ~SSLCall() {
-    int e = errno;
-    sigset_t pending;
-    if (!was_pending_ && sigpending(&pending) == 0 &&
-        sigismember(&pending, SIGPIPE) == 1) {
-      sigset_t pipe;
-      sigemptyset(&pipe);
-      sigaddset(&pipe, SIGPIPE);
-      timespec now = {0, 0};
-      sigtimedwait(&pipe, nullptr, &now);
-    }
-    pthread_sigmask(SIG_SETMASK, &saved_, nullptr);
-    errno = e;
-  }
-  SSLCall(const SSLCall&) = delete;
-  SSLCall& operator=(const SSLCall&) = delete;
+// The session's transport: a socket BIO of our own, because OpenSSL's sends
+// with write(), which raises SIGPIPE once the peer is gone. This one sends
+// with MSG_NOSIGNAL, as the plain channel does, so a vanished peer is a
+// result code and not the death of the host. The descriptor is not owned.
+int NoSignalWrite(BIO* b, const char* buf, int len) {
+  int fd = static_cast<int>(reinterpret_cast<intptr_t>(BIO_get_data(b)));
+  ssize_t n = send(fd, buf, static_cast<size_t>(len), MSG_NOSIGNAL);
+  BIO_clear_retry_flags(b);
+  if (n < 0 && BIO_sock_should_retry(-1)) BIO_set_retry_write(b);
+  return static_cast<int>(n);
+}
 
- private:
-  sigset_t saved_;
-  bool was_pending_;
-};
+int NoSignalRead(BIO* b, char* buf, int len) {
+  int fd = static_cast<int>(reinterpret_cast<intptr_t>(BIO_get_data(b)));
+  ssize_t n = recv(fd, buf, static_cast<size_t>(len), 0);
+  BIO_clear_retry_flags(b);
+  if (n < 0 && BIO_sock_should_retry(-1)) BIO_set_retry_read(b);
+  if (n == 0) BIO_set_flags(b, BIO_FLAGS_IN_EOF);
+  return static_cast<int>(n);
+}
+
+long NoSignalCtrl(BIO* b, int cmd, long /*num*/, void* ptr) {
+  switch (cmd) {
+    case BIO_C_SET_FD:
+      BIO_set_data(b, reinterpret_cast<void*>(
+                          static_cast<intptr_t>(*static_cast<int*>(ptr))));
+      BIO_set_init(b, 1);
+      return 1;
+    case BIO_C_GET_FD: {
+      if (!BIO_get_init(b)) return -1;
+      int fd = static_cast<int>(reinterpret_cast<intptr_t>(BIO_get_data(b)));
+      if (ptr != nullptr) *static_cast<int*>(ptr) = fd;
+      return fd;
+    }
+    case BIO_CTRL_EOF:
+      return BIO_test_flags(b, BIO_FLAGS_IN_EOF) != 0;
+    case BIO_CTRL_FLUSH:
+      return 1;
+    default:
+      return 0;
+  }
+}
+
+const BIO_METHOD* NoSignalSocket() {
+  static const BIO_METHOD* method = [] {
+    // A descriptor type, so that SSL_get_fd finds the socket.
+    BIO_METHOD* m = BIO_meth_new(
+        BIO_get_new_index() | BIO_TYPE_SOURCE_SINK | BIO_TYPE_DESCRIPTOR,
+        "s2s socket");
+    if (m != nullptr) {
+      BIO_meth_set_write(m, NoSignalWrite);
+      BIO_meth_set_read(m, NoSignalRead);
+      BIO_meth_set_ctrl(m, NoSignalCtrl);
+    }
+    return m;
+  }();
+  return method;
+}
+
+// SSL_set_fd with the socket BIO above: 1 on success.
+int SetSessionFd(SSL* ssl, int fd) {
+  const BIO_METHOD* method = NoSignalSocket();
+  BIO* bio = method == nullptr ? nullptr : BIO_new(method);
+  if (bio == nullptr) return 0;
+  BIO_set_fd(bio, fd, BIO_NOCLOSE);
+  SSL_set_bio(ssl, bio, bio);
+  return 1;
+}
 
 // Sends close_notify where possible. What a shutdown leaves in the error
 // queue (a peer already gone, a handshake never finished) is of no interest
 // to anyone once the session is being thrown away.
 void ShutdownSession(SSL* ssl) {
-  {
-    SSLCall call;
-    SSL_shutdown(ssl);
-  }
+  SSL_shutdown(ssl);
   ERR_clear_error();
 }
 
@@ -353,11 +379,9 @@ int Channel::SSLHandshake(SSL* ssl, timeval slice, unsigned int timeout,
                           int* /*flag*/) {
   // Seconds waited since the peer last moved the handshake on.
   unsigned int waited = 0;
-  int r;
-  {
-    SSLCall call;
-    r = SSL_do_handshake(ssl);
-  }
+  // SSL_get_error reads the error queue: it must hold only this call's.
+  ERR_clear_error();
+  int r = SSL_do_handshake(ssl);
   for (;;) {
     if (r == 1) return 0;
     int err = SSL_get_error(ssl, r);
@@ -397,7 +421,7 @@ int Channel::SSLHandshake(SSL* ssl, timeval slice, unsigned int timeout,
       LOG_DEBUG("SSLHandshake: reset timeout");
       waited = 0;
     }
-    SSLCall call;
+    ERR_clear_error();
     r = SSL_do_handshake(ssl);
   }
 }
@@ -412,11 +436,8 @@ int Channel::SSLReadFd(SSL* ssl, void* buf, unsigned int len,
   // A record already decrypted is not on the socket any more: select would
   // not see it.
   if (SSL_pending(ssl) > 0) {
-    int n;
-    {
-      SSLCall call;
-      n = SSL_read(ssl, buf, static_cast<int>(len));
-    }
+    ERR_clear_error();
+    int n = SSL_read(ssl, buf, static_cast<int>(len));
     if (n <= 0) {
       LOG_WARNING("Diagnose: SSL_read failed");
       log_ssl();
@@ -435,11 +456,8 @@ int Channel::SSLReadFd(SSL* ssl, void* buf, unsigned int len,
     LOG_WARNING("ReadFd: select but fd [%d] not ready", fd);
     return kSystemError;
   }
-  int n;
-  {
-    SSLCall call;
-    n = SSL_read(ssl, buf, static_cast<int>(len));
-  }
+  ERR_clear_error();
+  int n = SSL_read(ssl, buf, static_cast<int>(len));
   if (n > 0) {
     LOG_DEBUG("ReadFd: read %d bytes", n);
     return n;
@@ -468,11 +486,8 @@ int Channel::SSLWriteFd(SSL* ssl, const void* buf, unsigned int len,
     LOG_WARNING("WriteFd: select but fd [%d] not ready", fd);
     return kSystemError;
   }
-  int n;
-  {
-    SSLCall call;
-    n = SSL_write(ssl, buf, static_cast<int>(len));
-  }
+  ERR_clear_error();
+  int n = SSL_write(ssl, buf, static_cast<int>(len));
   if (n > 0) {
     LOG_DEBUG("WriteFd: write %d bytes", n);
     return n;
@@ -511,7 +526,7 @@ int Channel::ConvertToSSLChannel(bool server) {
     DeinitSSL(ssl, ctx, false);
     return kIOError;
   }
-  if (SSL_set_fd(ssl, fd_of(handle)) != 1) {
+  if (SetSessionFd(ssl, fd_of(handle)) != 1) {
     LOG_WARNING("set fd failed");
     log_ssl();
     DeinitSSL(ssl, ctx, false);
