@@ -3,6 +3,7 @@
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <netinet/in.h>
+#include <poll.h>
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -12,6 +13,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <mutex>
@@ -310,9 +312,6 @@ ScopedTZ::~ScopedTZ() {
   tzset();
 }
 
-namespace {
-
-// Runs a program to completion with its output discarded; true on exit 0.
 bool RunQuiet(const std::vector<std::string>& args) {
   pid_t pid = fork();
   if (pid < 0) return false;
@@ -333,7 +332,70 @@ bool RunQuiet(const std::vector<std::string>& args) {
   return WIFEXITED(status) && WEXITSTATUS(status) == 0;
 }
 
-}  // namespace
+PipedProcess::~PipedProcess() { Stop(); }
+
+bool PipedProcess::Start(std::vector<std::string> args) {
+  Stop();
+  int in[2], out[2];
+  if (pipe(in) != 0) return false;
+  if (pipe(out) != 0) {
+    close(in[0]);
+    close(in[1]);
+    return false;
+  }
+  pid_ = fork();
+  if (pid_ == 0) {
+    dup2(in[0], 0);
+    dup2(out[1], 1);
+    dup2(out[1], 2);
+    close(in[1]);
+    close(out[0]);
+    std::vector<char*> argv;
+    for (std::string& a : args) argv.push_back(&a[0]);
+    argv.push_back(nullptr);
+    execvp(argv[0], argv.data());
+    _exit(127);
+  }
+  close(in[0]);
+  close(out[1]);
+  in_ = in[1];
+  out_ = out[0];
+  output_.clear();
+  return pid_ > 0;
+}
+
+bool PipedProcess::WaitFor(const std::string& text, double seconds) {
+  auto deadline = std::chrono::steady_clock::now() +
+                  std::chrono::milliseconds(static_cast<int>(seconds * 1000));
+  while (output_.find(text) == std::string::npos) {
+    auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+                    deadline - std::chrono::steady_clock::now())
+                    .count();
+    pollfd p = {out_, POLLIN, 0};
+    if (left <= 0 || poll(&p, 1, static_cast<int>(left)) <= 0) return false;
+    char buf[4096];
+    ssize_t n = read(out_, buf, sizeof buf);
+    if (n <= 0) return false;
+    output_.append(buf, static_cast<size_t>(n));
+  }
+  return true;
+}
+
+bool PipedProcess::Send(const std::string& data) {
+  return write(in_, data.data(), data.size()) ==
+         static_cast<ssize_t>(data.size());
+}
+
+void PipedProcess::Stop() {
+  if (pid_ > 0) {
+    kill(pid_, SIGTERM);
+    waitpid(pid_, nullptr, 0);
+    pid_ = -1;
+  }
+  if (in_ >= 0) close(in_);
+  if (out_ >= 0) close(out_);
+  in_ = out_ = -1;
+}
 
 SshServer::SshServer(const std::string& dir) : dir_(dir) {}
 

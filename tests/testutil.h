@@ -179,6 +179,39 @@ class TempRoot : public TempDir {
   ScopedEnv env_;
 };
 
+// Runs a program (an argument vector, looked up in PATH, no shell) to
+// completion with its input and output on /dev/null; true on exit 0.
+bool RunQuiet(const std::vector<std::string>& args);
+
+// A program run by the test with its standard input and output (standard
+// error included) on pipes; stopped by its own pid (SIGTERM) at the latest
+// when the object goes away.
+class PipedProcess {
+ public:
+  PipedProcess() = default;
+  ~PipedProcess();
+  PipedProcess(const PipedProcess&) = delete;
+  PipedProcess& operator=(const PipedProcess&) = delete;
+
+  // Starts `args` (looked up in PATH, no shell); false when it cannot.
+  bool Start(std::vector<std::string> args);
+  // Reads output until it holds `text`; false at the end of the output or
+  // after `seconds`.
+  bool WaitFor(const std::string& text, double seconds = 5);
+  // Writes to its standard input; true when all of `data` went.
+  bool Send(const std::string& data);
+  // Stops it and waits for it. Idempotent.
+  void Stop();
+  // Everything read so far.
+  const std::string& output() const { return output_; }
+
+ private:
+  pid_t pid_ = -1;
+  int in_ = -1;
+  int out_ = -1;
+  std::string output_;
+};
+
 // Writes an executable shell script `body` (without the "#!/bin/sh" line)
 // at `path`; true on success.
 bool WriteScript(const std::string& path, const std::string& body);

@@ -1,0 +1,467 @@
+#include <arpa/inet.h>
+#include <gtest/gtest.h>
+#include <netinet/in.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <random>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "S2S/channel.h"
+#include "S2S/result_codes.h"
+#include "S2S/stream.h"
+#include "testutil.h"
+
+namespace {
+
+using S2S::Channel;
+using s2s_test::LogCapture;
+using Clock = std::chrono::steady_clock;
+
+double SecondsSince(Clock::time_point t) {
+  return std::chrono::duration<double>(Clock::now() - t).count();
+}
+
+bool Has(const LogCapture& log, const std::string& text) {
+  return log.Text().find(text) != std::string::npos;
+}
+
+// A CA; leaves signed by it carrying the name in the subject only ("cn",
+// whose file holds the chain), in the alternative names only ("san", after
+// an address entry) and as a wildcard ("wild"); a self-signed leaf ("self").
+bool MakeCertificates(const s2s_test::TempDir& dir) {
+  const std::string conf = dir.Sub("x509.cnf");
+  if (!s2s_test::WriteFile(
+          conf,
+          "[req]\ndistinguished_name = dn\nprompt = no\n[dn]\n"
+          "[ca]\nbasicConstraints = critical,CA:true\n"
+          "keyUsage = critical,keyCertSign\n"
+          "[leaf]\nbasicConstraints = CA:false\n"
+          "[san]\nbasicConstraints = CA:false\nsubjectAltName = "
+          "IP:127.0.0.1,DNS:first.example.test,DNS:second.example.test\n")) {
+    return false;
+  }
+  struct Cert {
+    const char *name, *subject, *ext;
+    bool signed_by_ca;
+  } certs[] = {{"ca", "/CN=S2S Test CA", "ca", false},
+               {"cn", "/CN=server.example.test", "leaf", true},
+               {"san", "/O=S2S/CN=Storage Appliance", "san", true},
+               {"wild", "/CN=*.example.test", "leaf", true},
+               {"self", "/CN=server.example.test", "leaf", false}};
+  for (const Cert& c : certs) {
+    std::string base = dir.Sub(c.name);
+    std::vector<std::string> args = {
+        "openssl",     "req",      "-x509",
+        "-config",     conf,       "-newkey",
+        "ec",          "-pkeyopt", "ec_paramgen_curve:P-256",
+        "-nodes",      "-days",    "2",
+        "-subj",       c.subject,  "-keyout",
+        base + ".key", "-out",     base + ".pem",
+        "-extensions", c.ext};
+    if (c.signed_by_ca) {
+      args.insert(args.end(),
+                  {"-CA", dir.Sub("ca.pem"), "-CAkey", dir.Sub("ca.key")});
+    }
+    struct stat st;
+    if (!s2s_test::RunQuiet(args) || stat((base + ".key").c_str(), &st) != 0 ||
+        (st.st_mode & 077) != 0) {
+      return false;
+    }
+  }
+  return s2s_test::WriteFile(dir.Sub("cn.pem"),
+                             s2s_test::ReadFile(dir.Sub("cn.pem")) +
+                                 s2s_test::ReadFile(dir.Sub("ca.pem")));
+}
+
+class ChannelSSLTest : public ::testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    dir_ = new s2s_test::TempDir;
+    made_ = MakeCertificates(*dir_);
+  }
+  static void TearDownTestSuite() {
+    delete dir_;
+    dir_ = nullptr;
+  }
+  void SetUp() override {
+    ASSERT_TRUE(made_);
+    ServeAs("cn");
+  }
+
+  static std::string File(const std::string& name) { return dir_->Sub(name); }
+  static void ServeAs(const std::string& cert) {
+    Channel::SetCERTPath(File(cert + ".pem"));
+    Channel::SetPriKeyPath(File(cert + ".key"));
+  }
+  // A client end that verifies against `ca` (a file here) and `host`.
+  static void Verify(Channel& client, const std::string& ca,
+                     const std::string& host) {
+    client.SetAllowUntrust(false);
+    Channel::SetVerifyCAPath(File(ca));
+    client.SetSSLHostname(host);
+  }
+
+  // Our server end and client end over a loopback TCP connection.
+  struct Pair {
+    explicit Pair(unsigned int capacity = 4096)
+        : server(capacity), client(capacity) {
+      int fds[2];
+      ok = s2s_test::TcpSocketPair(fds) && server.Open(fds[0], true) == 0 &&
+           client.Open(fds[1], true) == 0;
+      server.SetTimeout(5);
+      client.SetTimeout(5);
+    }
+    // Both ends convert at once; the client's result.
+    int Convert() {
+      std::thread t(
+          [this] { server_result = server.ConvertToSSLChannel(true); });
+      int r = client.ConvertToSSLChannel(false);
+      t.join();
+      return r;
+    }
+    Channel server, client;
+    int server_result = 1;
+    bool ok;
+  };
+
+  static s2s_test::TempDir* dir_;
+  static bool made_;
+};
+
+s2s_test::TempDir* ChannelSSLTest::dir_ = nullptr;
+bool ChannelSSLTest::made_ = false;
+
+TEST_F(ChannelSSLTest, ClientChecksChainAndNameOnlyWhenAskedTo) {
+  struct Case {
+    const char *cert, *ca, *host;
+    int want;
+  } cases[] = {
+      {"cn", "ca.pem", "server.example.test", 0},
+      {"cn", "ca.pem", "SERVER.Example.TEST", 0},
+      {"cn", "ca.pem", "", 0},  // chain only
+      {"cn", "ca.pem", "other.example.test", S2S::kSSLVerifyFail},
+      {"cn", "self.pem", "server.example.test", S2S::kSSLVerifyFail},
+      {"self", "ca.pem", "server.example.test", S2S::kSSLVerifyFail},
+      {"san", "ca.pem", "first.example.test", 0},
+      {"san", "ca.pem", "second.example.test", 0},
+      {"san", "ca.pem", "storage appliance", 0},
+      {"san", "ca.pem", "127.0.0.1", S2S::kSSLVerifyFail},  // not a DNS entry
+      {"san", "ca.pem", "third.example.test", S2S::kSSLVerifyFail},
+      {"wild", "ca.pem", "a.example.test", 0},
+      {"wild", "ca.pem", "A.EXAMPLE.test", 0},
+      {"wild", "ca.pem", "a.b.example.test", S2S::kSSLVerifyFail},
+      {"wild", "ca.pem", "example.test", S2S::kSSLVerifyFail},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(std::string(c.cert) + " " + c.ca + " '" + c.host + "'");
+    LogCapture log(4);
+    ServeAs(c.cert);
+    Pair p;
+    ASSERT_TRUE(p.ok);
+    Verify(p.client, c.ca, c.host);
+    EXPECT_EQ(p.Convert(), c.want);
+    EXPECT_EQ(p.server_result, 0);
+    EXPECT_EQ(p.client.IsSSL(), c.want == 0);
+    EXPECT_FALSE(p.client.IsClosed());
+    EXPECT_EQ(Has(log, "ConvertToSSLChannel: Verify Fail!"), c.want != 0);
+  }
+
+  // Allowing untrusted peers (the default) accepts anything and loads no CA.
+  LogCapture log(4);
+  ServeAs("self");
+  Pair p;
+  ASSERT_TRUE(p.ok);
+  Channel::SetVerifyCAPath(File("missing.pem"));
+  p.client.SetSSLHostname("nothing.example.test");
+  EXPECT_EQ(p.Convert(), 0);
+  EXPECT_FALSE(Has(log, "SSL_CTX_load_verify_locations"));
+  // The single suite the client asks for is gone; it carries on without.
+  EXPECT_TRUE(Has(log, "can't set cipher suit to SSL3_TXT_RSA_RC4_128_MD5"));
+
+  Pair q;
+  ASSERT_TRUE(q.ok);
+  q.client.SetAllowUntrust(false);
+  EXPECT_EQ(q.client.ConvertToSSLChannel(false), S2S::kIOError);
+  EXPECT_TRUE(Has(log, "SSL_CTX_load_verify_locations(" + File("missing.pem") +
+                           ") failed"));
+  EXPECT_TRUE(Has(log, "InitSSL(): set Verify store fail"));
+}
+
+TEST_F(ChannelSSLTest, ServerEndNeedsItsCertificateAndKey) {
+  LogCapture log(4);
+  Pair p;
+  ASSERT_TRUE(p.ok);
+  Channel::SetCERTPath(File("missing.pem"));
+  EXPECT_EQ(p.server.ConvertToSSLChannel(true), S2S::kIOError);
+  EXPECT_TRUE(Has(log, "Install certificate failed"));
+  EXPECT_TRUE(Has(log, "Open: init ssl certificate failed"));
+  EXPECT_TRUE(Has(log, "Open: init ssl failed"));
+  EXPECT_TRUE(Has(log, "ssl-errors: "));
+  ServeAs("cn");
+  Channel::SetPriKeyPath(File("san.key"));  // not the certificate's key
+  EXPECT_EQ(p.server.ConvertToSSLChannel(true), S2S::kIOError);
+  EXPECT_TRUE(Has(log, "Open: init ssl private key failed"));
+  EXPECT_FALSE(p.server.IsSSL());
+  EXPECT_FALSE(p.server.IsClosed());
+}
+
+// Buffering, integers, time-outs and PStream work unchanged over TLS, with
+// a small ring so that every run wraps.
+TEST_F(ChannelSSLTest, StreamsAndIntegersTravelUnchanged) {
+  Pair p(4093);
+  ASSERT_TRUE(p.ok);
+  ASSERT_EQ(p.Convert(), 0);
+  ASSERT_EQ(p.server_result, 0);
+
+  std::mt19937 rng(3);
+  std::string bulk(1 << 20, '\0');
+  for (char& c : bulk) c = static_cast<char>(rng());
+  S2S::PObject msg;
+  msg["name"] = std::string("share one");
+  msg["id"] = 0x0102030405060708ull;
+  msg["blob"] = std::string(60000, 'b');
+  S2S::PObject::Array list;
+  for (int i = 0; i < 100; ++i) list.emplace_back(std::to_string(i));
+  msg["list"] = list;
+
+  std::thread writer([&] {
+    S2S::PStream ps;
+    EXPECT_EQ(ps.Send(p.server, msg), 0);
+    EXPECT_EQ(p.server.WriteInt16(0xA1B2), 0);
+    EXPECT_EQ(p.server.WriteInt32(0xC3D4E5F6u), 0);
+    EXPECT_EQ(p.server.WriteInt64(1), 0);
+    std::mt19937 sizes(5);
+    for (size_t off = 0; off < bulk.size();) {
+      unsigned int n =
+          std::min<unsigned int>(1 + sizes() % 4093, bulk.size() - off);
+      ASSERT_EQ(p.server.Write(&bulk[off], n), 0);
+      off += n;
+    }
+    EXPECT_EQ(p.server.FlushWrite(0), 0);
+  });
+  S2S::PStream ps;
+  S2S::PObject got;
+  EXPECT_EQ(ps.Recv(p.client, got), 0);
+  EXPECT_EQ(got.toString(), msg.toString());
+  unsigned short v16 = 0;
+  unsigned int v32 = 0;
+  unsigned long long v64 = 0;
+  EXPECT_EQ(p.client.ReadInt16(&v16), 0);
+  EXPECT_EQ(p.client.ReadInt32(&v32), 0);
+  EXPECT_EQ(p.client.ReadInt64(&v64), 0);
+  EXPECT_EQ(v16, 0xA1B2);
+  EXPECT_EQ(v32, 0xC3D4E5F6u);
+  EXPECT_EQ(v64, 1u);
+  std::string in(bulk.size(), '\0');
+  for (size_t off = 0; off < in.size();) {
+    unsigned int n = std::min<unsigned int>(1 + rng() % 9000, in.size() - off);
+    ASSERT_EQ(p.client.Read(&in[off], n), 0) << "at " << off;
+    off += n;
+  }
+  writer.join();
+  EXPECT_TRUE(in == bulk);
+
+  p.client.SetTimeout(1);
+  char c;
+  auto start = Clock::now();
+  EXPECT_EQ(p.client.Read(&c, 1), S2S::kConnectionTimeout);
+  EXPECT_LT(SecondsSince(start), 3.0);
+}
+
+TEST_F(ChannelSSLTest, ConvertTwiceCloseAndReopenPlain) {
+  LogCapture log(4);
+  Channel closed(64);
+  EXPECT_EQ(closed.ConvertToSSLChannel(false), S2S::kIOError);
+  EXPECT_TRUE(Has(log, "invalid context"));
+  EXPECT_FALSE(closed.IsSSL());
+
+  Pair p;
+  ASSERT_TRUE(p.ok);
+  ASSERT_EQ(p.Convert(), 0);
+  EXPECT_EQ(p.client.ConvertToSSLChannel(false), 0);
+  EXPECT_TRUE(Has(log, "Channel is SSL channel, no need to be converted"));
+  ASSERT_EQ(p.client.Write("x", 1), 0);
+  ASSERT_EQ(p.client.FlushWrite(0), 0);
+  char c = 0;
+  EXPECT_EQ(p.server.Read(&c, 1), 0);
+  EXPECT_EQ(c, 'x');
+
+  EXPECT_EQ(p.client.Close(), 0);
+  EXPECT_TRUE(p.client.IsClosed());
+  EXPECT_FALSE(p.client.IsSSL());
+  EXPECT_EQ(p.server.Read(&c, 1), S2S::kIOError);  // close_notify arrived
+
+  // Reopened, the channel is plain: the peer sees the bytes as written.
+  int fds[2];
+  ASSERT_TRUE(s2s_test::TcpSocketPair(fds));
+  ASSERT_EQ(p.client.Open(fds[0], true), 0);
+  ASSERT_EQ(p.client.Write("plain", 5), 0);
+  ASSERT_EQ(p.client.FlushWrite(0), 0);
+  char buf[6] = {};
+  EXPECT_EQ(read(fds[1], buf, 5), 5);
+  EXPECT_STREQ(buf, "plain");
+  close(fds[1]);
+}
+
+TEST_F(ChannelSSLTest, HandshakeGivesUpOnSilentOrFailingPeers) {
+  LogCapture log(4);
+  {  // accepts the connection and never answers
+    Channel ch(256);
+    int fds[2];
+    ASSERT_TRUE(s2s_test::TcpSocketPair(fds));
+    ASSERT_EQ(ch.Open(fds[0], true), 0);
+    ch.SetTimeout(1);
+    auto start = Clock::now();
+    EXPECT_EQ(ch.ConvertToSSLChannel(false), S2S::kIOError);
+    EXPECT_GE(SecondsSince(start), 0.9);
+    EXPECT_LT(SecondsSince(start), 3.0);
+    EXPECT_TRUE(Has(log, "SSLHandshake: timed out during connect (1 seconds)"));
+    EXPECT_TRUE(Has(log, "Open to SSL connect to server failed"));
+    EXPECT_FALSE(ch.IsSSL());
+    EXPECT_FALSE(ch.IsClosed());
+    close(fds[1]);
+  }
+  {  // reads the client's hello and hangs up
+    Channel ch(256);
+    int fds[2];
+    ASSERT_TRUE(s2s_test::TcpSocketPair(fds));
+    ASSERT_EQ(ch.Open(fds[0], true), 0);
+    ch.SetTimeout(10);
+    std::thread peer([&] {
+      char buf[64];
+      EXPECT_GT(read(fds[1], buf, sizeof buf), 0);
+      close(fds[1]);
+    });
+    auto start = Clock::now();
+    EXPECT_EQ(ch.ConvertToSSLChannel(false), S2S::kIOError);
+    EXPECT_LT(SecondsSince(start), 5.0);
+    peer.join();
+  }
+  {  // a server end whose client speaks something else
+    Channel ch(256);
+    int fds[2];
+    ASSERT_TRUE(s2s_test::TcpSocketPair(fds));
+    ASSERT_EQ(ch.Open(fds[0], true), 0);
+    ch.SetTimeout(10);
+    const char request[] = "GET / HTTP/1.0\r\n\r\n";
+    ASSERT_EQ(write(fds[1], request, sizeof request - 1),
+              static_cast<ssize_t>(sizeof request - 1));
+    EXPECT_EQ(ch.ConvertToSSLChannel(true), S2S::kIOError);
+    EXPECT_TRUE(Has(log, "SSLHandshake: SSL fatel error code: 1"));
+    close(fds[1]);
+  }
+}
+
+// Writing to a TLS peer that has gone is a result code, not SIGPIPE.
+TEST_F(ChannelSSLTest, WritingToAVanishedPeerFailsWithoutASignal) {
+  LogCapture log(4);
+  Pair p;
+  ASSERT_TRUE(p.ok);
+  ASSERT_EQ(p.Convert(), 0);
+  p.server.Close();
+  std::string block(4096, 'v');
+  int r = 0;
+  for (int i = 0; i < 64 && r == 0; ++i) {
+    r = p.client.Write(block.data(), 4096);
+    if (r == 0) r = p.client.FlushWrite(0);
+  }
+  EXPECT_LT(r, 0);
+}
+
+// Our client end against a real TLS server, for each protocol version the
+// library's default method still offers and the last one it refuses.
+TEST_F(ChannelSSLTest, ClientTalksToOpenSSLServer) {
+  struct Case {
+    std::vector<std::string> opts;
+    bool agrees;
+  } cases[] = {{{"-tls1_3"}, true},
+               {{"-tls1_2"}, true},
+               {{"-tls1_1", "-cipher", "DEFAULT@SECLEVEL=0"}, false}};
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.opts[0]);
+    LogCapture log(4);
+    s2s_test::PipedProcess server;
+    int port = -1;
+    for (int attempt = 0; attempt < 3 && port < 0; ++attempt) {
+      int candidate = s2s_test::FreeLoopbackPort();
+      std::vector<std::string> args = {
+          "openssl",  "s_server",
+          "-accept",  "127.0.0.1:" + std::to_string(candidate),
+          "-cert",    File("cn.pem"),
+          "-key",     File("cn.key"),
+          "-naccept", "1"};
+      args.insert(args.end(), c.opts.begin(), c.opts.end());
+      ASSERT_TRUE(server.Start(args));
+      if (server.WaitFor("ACCEPT")) {
+        port = candidate;
+      } else {
+        server.Stop();  // the port was taken meanwhile
+      }
+    }
+    ASSERT_GT(port, 0) << server.output();
+
+    Channel ch(4096);
+    ch.SetTimeout(5);
+    ASSERT_EQ(ch.Open("127.0.0.1", port), 0);
+    Verify(ch, "ca.pem", "server.example.test");
+    if (!c.agrees) {
+      EXPECT_EQ(ch.ConvertToSSLChannel(false), S2S::kIOError);
+      continue;
+    }
+    ASSERT_EQ(ch.ConvertToSSLChannel(false), 0) << log.Text();
+    ASSERT_EQ(ch.Write("ping from s2s\n", 14), 0);
+    ASSERT_EQ(ch.FlushWrite(0), 0);
+    EXPECT_TRUE(server.WaitFor("ping from s2s\n")) << server.output();
+    ASSERT_TRUE(server.Send("pong\n"));
+    char buf[6] = {};
+    EXPECT_EQ(ch.Read(buf, 5), 0);
+    EXPECT_STREQ(buf, "pong\n");
+    ch.Close();
+  }
+}
+
+// Our server end, with its chain file, against a real TLS client that
+// insists on a valid chain and name.
+TEST_F(ChannelSSLTest, ServerTalksToOpenSSLClient) {
+  int lfd = socket(AF_INET, SOCK_STREAM, 0);
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t len = sizeof addr;
+  ASSERT_EQ(bind(lfd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  ASSERT_EQ(listen(lfd, 1), 0);
+  ASSERT_EQ(getsockname(lfd, reinterpret_cast<sockaddr*>(&addr), &len), 0);
+
+  s2s_test::PipedProcess client;
+  ASSERT_TRUE(
+      client.Start({"openssl", "s_client", "-connect",
+                    "127.0.0.1:" + std::to_string(ntohs(addr.sin_port)),
+                    "-CAfile", File("ca.pem"), "-verify_return_error",
+                    "-verify_hostname", "server.example.test", "-brief"}));
+  pollfd pfd = {lfd, POLLIN, 0};
+  ASSERT_EQ(poll(&pfd, 1, 5000), 1);
+  int fd = accept(lfd, nullptr, nullptr);
+  close(lfd);
+  Channel ch(4096);
+  ch.SetTimeout(5);
+  ASSERT_EQ(ch.Open(fd, true), 0);
+  ASSERT_EQ(ch.ConvertToSSLChannel(true), 0);
+  ASSERT_EQ(ch.Write("hello client\n", 13), 0);
+  ASSERT_EQ(ch.FlushWrite(0), 0);
+  EXPECT_TRUE(client.WaitFor("hello client\n")) << client.output();
+  EXPECT_NE(client.output().find("Verification: OK"), std::string::npos);
+  ASSERT_TRUE(client.Send("hello server\n"));
+  char buf[14] = {};
+  EXPECT_EQ(ch.Read(buf, 13), 0);
+  EXPECT_STREQ(buf, "hello server\n");
+}
+
+}  // namespace
