@@ -1,0 +1,131 @@
+// s2s-client: runs one sync task against a server appliance.
+//
+//   s2s-client [--root DIR] [--task-file FILE] [options]   (see --help)
+//   s2s-client --daemon
+//
+// Progress goes to standard output, one line per step, then a summary; the
+// library's log goes to standard error. The exit code says what failed
+// (exit_codes.h).
+#include <errno.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <syslog.h>
+
+#include <string>
+
+#include "S2S/logger.h"
+#include "cancel.h"
+#include "client_options.h"
+#include "exit_codes.h"
+#include "karo/rsync_wrapper.h"
+#include "karo_root.h"
+#include "secret.h"
+#include "task_runner.h"
+
+namespace {
+
+using namespace s2s_tools;
+
+int g_verbose = 0;
+
+// rsync's own lines (debug) only when asked for; warnings always.
+void WrapperLog(int priority, const char* message) {
+  if (priority <= LOG_WARNING || g_verbose >= 2) {
+    fprintf(stderr, "rsync: %s\n", message);
+  }
+}
+
+bool MakeTempDir(std::string& error) {
+  std::string dir = KaroRootPath("/tmp/S2S");
+  std::string partial;
+  for (size_t pos = 1; pos != std::string::npos;) {
+    pos = dir.find('/', pos + 1);
+    partial = dir.substr(0, pos);
+    if (mkdir(partial.c_str(), pos == std::string::npos ? 0700 : 0755) != 0 &&
+        errno != EEXIST) {
+      error = "cannot create " + partial + ": " + strerror(errno);
+      return false;
+    }
+  }
+  return true;
+}
+
+void Print(const std::string& line) {
+  printf("%s\n", line.c_str());
+  fflush(stdout);
+}
+
+void PrintSummary(const TaskSpec& spec, const TaskOutcome& out) {
+  size_t ok = 0;
+  for (const ShareOutcome& s : out.shares) ok += s.ok ? 1 : 0;
+  printf(
+      "summary: task %s, server %s, %zu/%zu shares synced, %d beacons, "
+      "%.2f s, exit %d%s%s\n",
+      spec.name.c_str(), out.server_ip.empty() ? "-" : out.server_ip.c_str(),
+      ok, spec.shares.size(), out.beacons, out.seconds, out.exit_code,
+      out.error.empty() ? "" : ": ", out.error.c_str());
+  for (const ShareOutcome& s : out.shares) {
+    if (s.ok) {
+      printf("  %-20s ok (%.2f s)\n", s.name.c_str(), s.seconds);
+    } else {
+      printf("  %-20s FAILED at %s: %s\n", s.name.c_str(),
+             s.failed_step.c_str(), StatusText(s.status).c_str());
+    }
+  }
+  fflush(stdout);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  ClientOptions o;
+  std::string error;
+  if (!ParseClientArgs(argc, argv, o, error)) {
+    fprintf(stderr, "s2s-client: %s\n(try --help)\n", error.c_str());
+    return kExitUsage;
+  }
+  if (o.help) {
+    fputs(ClientUsage(), stdout);
+    return kExitOk;
+  }
+  if (!o.root.empty()) setenv(KARO_ROOT_ENV, o.root.c_str(), 1);
+  g_verbose = o.verbose;
+  S2S::Logger::Initialize(S2S::Logger::Stderr,
+                          o.verbose >= 2   ? S2S::Logger::Debug
+                          : o.verbose == 1 ? S2S::Logger::Info
+                                           : S2S::Logger::Warning,
+                          "", 0);
+  KARO::Backup::RsyncWrapper::setLogHandler(WrapperLog);
+  if (!InstallCancelSignals()) {
+    fprintf(stderr, "s2s-client: cannot handle signals\n");
+    return kExitLocal;
+  }
+  if (o.daemon) {
+    // The service mode of the platform's "s2s_daemon": no scheduler yet,
+    // so it only stays up until it is told to stop.
+    WaitForCancel();
+    return kExitOk;
+  }
+  if (!CheckTaskSpec(o.spec, error)) {
+    fprintf(stderr, "s2s-client: %s\n", error.c_str());
+    return kExitUsage;
+  }
+  std::string password;
+  if (!ReadPassword(o.spec.password_file, password, error)) {
+    fprintf(stderr, "s2s-client: %s\n", error.c_str());
+    return kExitUsage;
+  }
+  if (!MakeTempDir(error)) {
+    fprintf(stderr, "s2s-client: %s\n", error.c_str());
+    return kExitLocal;
+  }
+  if (o.spec.port != 0) {
+    setenv("S2S_RSYNC_PORT", std::to_string(o.spec.port).c_str(), 1);
+  }
+  S2S::SyncTask task = MakeSyncTask(o.spec, password);
+  TaskOutcome out = RunTask(task, o.spec.excludes, o.beacon_interval, Print);
+  PrintSummary(o.spec, out);
+  return out.exit_code;
+}

@@ -1,0 +1,303 @@
+#include "task_runner.h"
+
+#include <stdio.h>
+#include <time.h>
+
+#include "S2S/rsyncer.h"
+#include "S2S/s2s_share.h"
+#include "cancel.h"
+#include "exit_codes.h"
+
+namespace s2s_tools {
+
+namespace {
+
+const int kCancelledStatus = 20;
+const int kServiceDisabled = 244;
+const int kPairedElsewhere = 245;
+
+double Now() {
+  timespec ts;
+  clock_gettime(CLOCK_MONOTONIC, &ts);
+  return static_cast<double>(ts.tv_sec) + ts.tv_nsec / 1e9;
+}
+
+std::string Join(const std::list<std::string>& items) {
+  std::string out;
+  for (const std::string& s : items) out += (out.empty() ? "" : ", ") + s;
+  return out;
+}
+
+std::string Format(const char* format, double value) {
+  char buf[64];
+  snprintf(buf, sizeof buf, format, value);
+  return buf;
+}
+
+// One task's run: the Rsyncer and the outcome that the steps fill in.
+class Run {
+ public:
+  Run(const S2S::SyncTask& task, const std::list<std::string>& excludes,
+      const Reporter& report)
+      : task_(task), excludes_(excludes), report_(report) {}
+
+  void Go(unsigned int beacon_interval);
+  TaskOutcome& outcome() { return out_; }
+
+ private:
+  bool Probe();
+  bool Pair();
+  void Beacon(const char* when);
+  void SyncShare(const std::string& share);
+  bool ShareStep(ShareOutcome& share, const char* step, int rc, int status);
+  void FinishTask();
+  bool Stop(int code, const std::string& error);
+
+  const S2S::SyncTask& task_;
+  const std::list<std::string>& excludes_;
+  const Reporter& report_;
+  S2S::Rsyncer rsyncer_;
+  TaskOutcome out_;
+};
+
+bool Run::Stop(int code, const std::string& error) {
+  if (CancelRequested()) {
+    out_.exit_code = kExitCancelled;
+    out_.error = "cancelled";
+  } else {
+    out_.exit_code = code;
+    out_.error = error;
+  }
+  report_("error: " + out_.error);
+  return false;
+}
+
+bool Run::Probe() {
+  const S2S::SyncInfo& info = task_.GetInfo().GetSyncInfo();
+  std::string target =
+      info.GetServerIP().empty() ? info.GetServerName() : info.GetServerIP();
+  report_("probe: " + target);
+  int rc = rsyncer_.Initialize(info);
+  out_.server_ip = rsyncer_.GetSyncInfo().GetServerIP();
+  out_.server_version = rsyncer_.GetServerVersionValue();
+  if (rc == kServiceDisabled || rc == kPairedElsewhere) {
+    return Stop(kExitPairing, "server refused this client: " + StatusText(rc));
+  }
+  if (rc != 0 || out_.server_version < 0) {
+    return Stop(kExitUnreachable, "server " + target + " unreachable: " +
+                                      StatusText(rc != 0 ? rc : 251));
+  }
+  report_("probe: " + out_.server_ip + " answers, protocol version " +
+          std::to_string(out_.server_version));
+  return true;
+}
+
+bool Run::Pair() {
+  const std::list<std::string>& shares = task_.GetInfo().GetShareList();
+  int status = 0;
+  int rc = rsyncer_.DoPairing(false, shares, out_.conflicts, status);
+  if (rc != 0 || status != 0) {
+    return Stop(kExitPairing, "pairing refused: " + StatusText(status));
+  }
+  if (!out_.conflicts.empty()) {
+    return Stop(kExitPairing,
+                "shares fed by another client: " + Join(out_.conflicts));
+  }
+  report_("pair: " + Join(shares) +
+          (rsyncer_.SupportMultiSource() ? "" : " (single-client server)"));
+  return true;
+}
+
+void Run::Beacon(const char* when) {
+  int status = 0;
+  if (rsyncer_.SendBeacon(task_.GetInfo().GetName(), status) == 0 &&
+      status == 0) {
+    ++out_.beacons;
+    report_(std::string("beacon: ") + when);
+  } else if (!CancelRequested()) {
+    report_("beacon: not taken: " + StatusText(status));
+  }
+  BeaconSent();
+}
+
+bool Run::ShareStep(ShareOutcome& share, const char* step, int rc, int status) {
+  if (rc == 0 && status == 0) return true;
+  share.failed_step = step;
+  share.status = rc != 0 && status == 0 ? rc : status;
+  report_("share " + share.name + ": " + step +
+          " failed: " + StatusText(share.status));
+  return false;
+}
+
+void Run::SyncShare(const std::string& name) {
+  ShareOutcome share;
+  share.name = name;
+  int status = 0;
+  int rc = rsyncer_.StartSyncShare(name, status);
+  if (ShareStep(share, "start", rc, status)) {
+    report_("share " + name + ": started");
+    double t0 = Now();
+    status = 0;
+    rc = rsyncer_.RunSync(task_.GetID(), name, "/", excludes_, status);
+    share.seconds = Now() - t0;
+    if (ShareStep(share, "transfer", rc, status)) {
+      report_("share " + name + ": transferred in " +
+              Format("%.2f s", share.seconds));
+      S2S::ShareInfo info;
+      bool key_ok = true;
+      if (rsyncer_.GetShareInfo(name, info) == 0 && info.IsEncrypted()) {
+        rc = rsyncer_.SyncEncryptKey(name);
+        key_ok = ShareStep(share, "key", rc, 0);
+        if (key_ok) report_("share " + name + ": key file copied");
+      }
+      if (key_ok) {
+        status = 0;
+        rc = rsyncer_.FinishSync("share", name, status);
+        share.ok = ShareStep(share, "finish", rc, status);
+        if (share.ok) report_("share " + name + ": finished");
+      }
+    }
+  }
+  out_.shares.push_back(share);
+}
+
+void Run::FinishTask() {
+  // A cancelled task still tells the server it is idle again: without the
+  // checker, so that this last command is not cancelled as well.
+  rsyncer_.SetCancelChecker(nullptr);
+  int status = 0;
+  const std::string& name = task_.GetInfo().GetName();
+  int rc = rsyncer_.FinishSync("task", name, status);
+  if (rc == 0 && status == 0) {
+    report_("task " + name + ": finished");
+  } else {
+    report_("task " + name +
+            ": end not recorded: " + StatusText(status != 0 ? status : rc));
+    if (out_.exit_code == kExitOk) {
+      out_.exit_code = kExitShare;
+      out_.error = "the server did not record the end of the task";
+    }
+  }
+}
+
+void Run::Go(unsigned int beacon_interval) {
+  double t0 = Now();
+  rsyncer_.SetCancelChecker(CancelChecker);
+  if (Probe() && Pair()) {
+    SetBeaconHook([this] { Beacon("transfer running"); }, beacon_interval);
+    Beacon("task started");
+    const std::list<std::string>& shares = task_.GetInfo().GetShareList();
+    size_t done = 0;
+    for (const std::string& share : shares) {
+      if (CancelRequested()) break;
+      if (done++ > 0) Beacon("next share");
+      SyncShare(share);
+    }
+    SetBeaconHook(nullptr, 0);
+    size_t failed = 0;
+    for (const ShareOutcome& s : out_.shares) failed += s.ok ? 0 : 1;
+    if (CancelRequested()) {
+      out_.exit_code = kExitCancelled;
+      out_.error = "cancelled";
+      report_("error: cancelled");
+    } else if (failed > 0) {
+      out_.exit_code = kExitShare;
+      out_.error = std::to_string(failed) + " of " +
+                   std::to_string(shares.size()) + " shares failed";
+    }
+    FinishTask();
+  }
+  out_.seconds = Now() - t0;
+}
+
+}  // namespace
+
+std::string StatusText(int status) {
+  std::string text;
+  switch (status) {
+    case 0:
+      text = "ok";
+      break;
+    case 5:
+      text = "refused by the daemon (user, password or module)";
+      break;
+    case 10:
+      text = "no connection";
+      break;
+    case 20:
+      text = "cancelled";
+      break;
+    case 23:
+      text = "partial transfer";
+      break;
+    case 30:
+    case 35:
+      text = "time-out";
+      break;
+    case 42:
+      text = "address lookup failed";
+      break;
+    case 43:
+      text = "command unknown to the server";
+      break;
+    case 202:
+      text = "share attributes refused";
+      break;
+    case 213:
+      text = "no address to try";
+      break;
+    case 214:
+      text = "shares fed by another client";
+      break;
+    case 240:
+      text = "command malformed";
+      break;
+    case 241:
+      text = "a name was refused";
+      break;
+    case 242:
+      text = "server registry failure";
+      break;
+    case 243:
+      text = "no such share on the server";
+      break;
+    case 244:
+      text = "service switched off on the server";
+      break;
+    case 245:
+      text = "the server is paired with another client";
+      break;
+    case 246:
+      text = "the server holds no sync of this client";
+      break;
+    case 250:
+      text = "rsync could not be started";
+      break;
+    case 251:
+      text = "no reply from the server";
+      break;
+    case 252:
+      text = "incomplete settings";
+      break;
+    case 300:
+      text = "share record unreadable";
+      break;
+    case -1:
+      text = "request could not be prepared";
+      break;
+    default:
+      text = "failed";
+      break;
+  }
+  return text + " [" + std::to_string(status) + "]";
+}
+
+TaskOutcome RunTask(const S2S::SyncTask& task,
+                    const std::list<std::string>& excludes,
+                    unsigned int beacon_interval, const Reporter& report) {
+  Run run(task, excludes, report);
+  run.Go(beacon_interval);
+  return run.outcome();
+}
+
+}  // namespace s2s_tools

@@ -1,0 +1,55 @@
+// One sync task end to end, as the client program runs it.
+//
+// RunTask probes the server (Initialize), pairs the task's shares, then for
+// each share announces the sync, pushes the data, carries an encrypted
+// share's key file and reports the share's end; beacons keep the task alive
+// on the server between shares and, during long transfers, from the cancel
+// checker's poll; the task's end is reported last. Each step is reported as
+// one line through the caller's reporter. A share that fails does not stop
+// the others; a failed probe or pairing, or a cancel, stops the task.
+#ifndef S2S_TOOLS_TASK_RUNNER_H_
+#define S2S_TOOLS_TASK_RUNNER_H_
+
+#include <functional>
+#include <list>
+#include <string>
+#include <vector>
+
+#include "S2S/sync_obj_task.h"
+
+namespace s2s_tools {
+
+struct ShareOutcome {
+  std::string name;
+  bool ok = false;
+  std::string failed_step;  // "start", "transfer", "key", "finish"
+  int status = 0;           // the failed step's status
+  double seconds = 0;       // time of the transfer
+};
+
+struct TaskOutcome {
+  int exit_code = 0;  // an ExitCode
+  std::string error;  // why the task stopped or failed; "" when it did not
+  std::string server_ip;
+  int server_version = -1;
+  std::list<std::string> conflicts;
+  std::vector<ShareOutcome> shares;
+  int beacons = 0;
+  double seconds = 0;
+};
+
+using Reporter = std::function<void(const std::string& line)>;
+
+// Runs `task`. `beacon_interval` is the least time between beacons sent from
+// the cancel checker during a transfer. REQUIRES: the task was checked
+// (CheckTaskSpec).
+TaskOutcome RunTask(const S2S::SyncTask& task,
+                    const std::list<std::string>& excludes,
+                    unsigned int beacon_interval, const Reporter& report);
+
+// What a status from the rsync wrapper or the server means, for people.
+std::string StatusText(int status);
+
+}  // namespace s2s_tools
+
+#endif  // S2S_TOOLS_TASK_RUNNER_H_
