@@ -1,0 +1,157 @@
+// The client program's inputs: task files, options on top of them, password
+// sources, and the cancel checker's beacons.
+#include <stdlib.h>
+#include <sys/stat.h>
+
+#include <string>
+#include <vector>
+
+#include "cancel.h"
+#include "client_options.h"
+#include "gtest/gtest.h"
+#include "secret.h"
+#include "task_spec.h"
+#include "testutil.h"
+
+namespace {
+
+using namespace s2s_tools;
+using s2s_test::WriteFile;
+
+bool Parse(std::vector<std::string> args, ClientOptions& o,
+           std::string& error) {
+  args.insert(args.begin(), "s2s-client");
+  std::vector<char*> argv;
+  for (std::string& a : args) argv.push_back(&a[0]);
+  argv.push_back(nullptr);
+  return ParseClientArgs(static_cast<int>(args.size()), argv.data(), o, error);
+}
+
+TEST(ClientOptions, TaskFileKeysThenOptionsOnTop) {
+  s2s_test::TempDir tmp;
+  std::string task = tmp.Sub("t.task");
+  ASSERT_TRUE(WriteFile(task,
+                        "[Task]\n\tname=\"nightly\"\n\tid=\"7\"\n"
+                        "\tserver_ip=\"10.0.0.9\"\n\tport=\"8873\"\n"
+                        "\tuser=\"s2s\"\n\tshares=\"docs:photos\"\n"
+                        "\texcludes=\"*.tmp\"\n\tcompress=\"yes\"\n"
+                        "\tdelta=\"no\"\n\tssh=\"no\"\n\tssh_port=\"2222\"\n"
+                        "\tpassword_file=\"/p\"\n"));
+  ClientOptions o;
+  std::string error;
+  ASSERT_TRUE(Parse({"--task-file", task, "--server-ip", "127.0.0.1",
+                     "--share", "a", "--share", "b", "--delta", "-v", "-v"},
+                    o, error))
+      << error;
+  EXPECT_EQ("nightly", o.spec.name);
+  EXPECT_EQ(7u, o.spec.id);
+  EXPECT_EQ("127.0.0.1", o.spec.server_ip);  // the option wins
+  EXPECT_EQ(8873u, o.spec.port);
+  EXPECT_EQ((std::list<std::string>{"a", "b"}), o.spec.shares);
+  EXPECT_EQ(std::list<std::string>{"*.tmp"}, o.spec.excludes);
+  EXPECT_TRUE(o.spec.compress);
+  EXPECT_TRUE(o.spec.delta);
+  EXPECT_EQ(2222u, o.spec.ssh_port);
+  EXPECT_EQ("/p", o.spec.password_file);
+  EXPECT_EQ(2, o.verbose);
+
+  S2S::SyncTask t = MakeSyncTask(o.spec, "pw");
+  EXPECT_EQ(7u, t.GetID());
+  EXPECT_TRUE(t.GetInfo().GetSyncInfo().UseCompression());
+  EXPECT_TRUE(t.GetInfo().GetSyncInfo().UseBlockLevelSync());
+  EXPECT_FALSE(t.GetInfo().GetSyncInfo().UseSSH());
+}
+
+TEST(ClientOptions, RefusesBadInputsWithoutEchoingSecrets) {
+  s2s_test::TempDir tmp;
+  struct Case {
+    std::string task_file;  // "" for none
+    std::vector<std::string> args;
+    std::string error_part;
+  };
+  const Case cases[] = {
+      {"", {"--password=hunter2-x"}, "command line"},
+      {"", {"--port", "70000"}, "--port"},
+      {"", {"--task-id", "12x"}, "--task-id"},
+      {"", {"stray"}, "unexpected argument"},
+      {"", {"--bogus"}, "unknown"},
+      {"[Task]\n\tpassword=\"hunter2-x\"\n", {}, "passwords do not go"},
+      {"[Task]\n\tcolour=\"red\"\n", {}, "unknown key 'colour'"},
+      {"[Task]\n\tcompress=\"maybe\"\n", {}, "'compress'"},
+      {"[Other]\n\tname=\"x\"\n", {}, "no [Task] section"},
+  };
+  for (const Case& c : cases) {
+    std::vector<std::string> args = c.args;
+    if (!c.task_file.empty()) {
+      ASSERT_TRUE(WriteFile(tmp.Sub("t.task"), c.task_file));
+      args.push_back("--task-file=" + tmp.Sub("t.task"));
+    }
+    ClientOptions o;
+    std::string error;
+    EXPECT_FALSE(Parse(args, o, error)) << c.error_part;
+    EXPECT_NE(std::string::npos, error.find(c.error_part)) << error;
+    EXPECT_EQ(std::string::npos, error.find("hunter2")) << error;
+  }
+}
+
+TEST(ClientOptions, SplitListDropsEmptyPieces) {
+  EXPECT_EQ((std::list<std::string>{"a", "b"}), SplitList(":a::b:"));
+  EXPECT_TRUE(SplitList("").empty());
+}
+
+TEST(Secret, FileMustBePrivateAndEnvironmentIsConsumed) {
+  s2s_test::TempDir tmp;
+  std::string path = tmp.Sub("pw");
+  ASSERT_TRUE(WriteFile(path, "s3cret-line\nsecond line\n"));
+  std::string pw, error;
+  chmod(path.c_str(), 0640);
+  EXPECT_FALSE(ReadPassword(path, pw, error));
+  EXPECT_NE(std::string::npos, error.find("0600"));
+  chmod(path.c_str(), 0600);
+  ASSERT_TRUE(ReadPassword(path, pw, error)) << error;
+  EXPECT_EQ("s3cret-line", pw);
+
+  ASSERT_TRUE(WriteFile(tmp.Sub("empty"), "\n"));
+  chmod(tmp.Sub("empty").c_str(), 0600);
+  EXPECT_FALSE(ReadPassword(tmp.Sub("empty"), pw, error));
+
+  // The variable is read once and removed, so that rsync and every other
+  // child does not inherit it; a file given as well wins over it.
+  setenv(kPasswordEnv, "from-env", 1);
+  ASSERT_TRUE(ReadPassword("", pw, error));
+  EXPECT_EQ("from-env", pw);
+  EXPECT_EQ(nullptr, getenv(kPasswordEnv));
+  EXPECT_FALSE(ReadPassword("", pw, error));
+  setenv(kPasswordEnv, "from-env", 1);
+  ASSERT_TRUE(ReadPassword(path, pw, error));
+  EXPECT_EQ("s3cret-line", pw);
+  EXPECT_EQ(nullptr, getenv(kPasswordEnv));
+}
+
+int g_beacons = 0;
+
+TEST(CancelChecker, BeaconsFromThePollNeverNest) {
+  SetCancelRequested(false);
+  g_beacons = 0;
+  // The hook polls the checker itself, as a beacon's own rsync run does.
+  SetBeaconHook(
+      [] {
+        ++g_beacons;
+        EXPECT_FALSE(CancelChecker());
+      },
+      0);
+  EXPECT_FALSE(CancelChecker());
+  EXPECT_FALSE(CancelChecker());
+  EXPECT_EQ(2, g_beacons);
+
+  SetBeaconHook([] { ++g_beacons; }, 3600);
+  EXPECT_FALSE(CancelChecker());
+  EXPECT_EQ(2, g_beacons);  // not due yet
+
+  SetCancelRequested(true);
+  EXPECT_TRUE(CancelChecker());
+  SetCancelRequested(false);
+  SetBeaconHook(nullptr, 0);
+}
+
+}  // namespace

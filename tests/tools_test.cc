@@ -1,0 +1,339 @@
+// The programs end to end: s2s-server sets up a server root and runs its
+// rsync daemon on loopback, s2s-client syncs client roots to it. What is
+// checked is what a person sees: exit codes, the copied files, the
+// registry, and that the password shows nowhere.
+#include <dirent.h>
+#include <fcntl.h>
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <vector>
+
+#include "S2S/is_syncedshare.h"
+#include "exit_codes.h"
+#include "gtest/gtest.h"
+#include "testutil.h"
+
+namespace {
+
+using s2s_test::ReadFile;
+using s2s_test::WriteFile;
+using namespace s2s_tools;
+
+const char kPassword[] = "pw-Tq83-never-shown";
+
+struct Child {
+  pid_t pid = -1;
+  std::string out_path, err_path;
+  std::string out, err;
+  int code = -1;
+
+  // Waits for the child; its exit code, or 128 + signal.
+  int Wait() {
+    int st = 0;
+    waitpid(pid, &st, 0);
+    code = WIFEXITED(st) ? WEXITSTATUS(st) : 128 + WTERMSIG(st);
+    out = ReadFile(out_path);
+    err = ReadFile(err_path);
+    return code;
+  }
+};
+
+// Starts `argv` with `env` ("NAME=VALUE") added to an environment without
+// S2S_ROOT and S2S_PASSWORD; output goes to files in `dir`.
+Child Spawn(const std::string& dir, const std::vector<std::string>& argv,
+            const std::vector<std::string>& env = {}) {
+  static int serial = 0;
+  Child c;
+  c.out_path = dir + "/out." + std::to_string(++serial);
+  c.err_path = dir + "/err." + std::to_string(serial);
+  c.pid = fork();
+  if (c.pid == 0) {
+    unsetenv("S2S_ROOT");
+    unsetenv("S2S_PASSWORD");
+    unsetenv("S2S_RSYNC_PORT");
+    for (const std::string& e : env) putenv(strdup(e.c_str()));
+    int out = open(c.out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    int err = open(c.err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    dup2(out, 1);
+    dup2(err, 2);
+    std::vector<char*> args;
+    for (const std::string& a : argv) args.push_back(strdup(a.c_str()));
+    args.push_back(nullptr);
+    execv(args[0], args.data());
+    _exit(127);
+  }
+  return c;
+}
+
+Child Run(const std::string& dir, const std::vector<std::string>& argv,
+          const std::vector<std::string>& env = {}) {
+  Child c = Spawn(dir, argv, env);
+  c.Wait();
+  return c;
+}
+
+// Command lines of every process now, NUL-separated arguments as spaces.
+std::vector<std::string> AllCommandLines() {
+  std::vector<std::string> out;
+  DIR* d = opendir("/proc");
+  if (d == nullptr) return out;
+  while (dirent* e = readdir(d)) {
+    if (e->d_name[0] < '0' || e->d_name[0] > '9') continue;
+    std::string cmd = ReadFile(std::string("/proc/") + e->d_name + "/cmdline");
+    for (char& ch : cmd) {
+      if (ch == '\0') ch = ' ';
+    }
+    if (!cmd.empty()) out.push_back(cmd);
+  }
+  closedir(d);
+  return out;
+}
+
+void SleepMs(int ms) {
+  timespec ts = {ms / 1000, (ms % 1000) * 1000000L};
+  nanosleep(&ts, nullptr);
+}
+
+class ToolsTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    server_ = tmp_.Sub("server");
+    pw_file_ = tmp_.Sub("password");
+    ASSERT_TRUE(WriteFile(pw_file_, std::string(kPassword) + "\n"));
+    chmod(pw_file_.c_str(), 0600);
+    Child init = Run(tmp_.path(), {S2S_SERVER_PROGRAM, "--root", server_,
+                                   "init", "--share", "docs", "--share",
+                                   "big", "--user", "s2s", "--password-file",
+                                   pw_file_});
+    ASSERT_EQ(0, init.code) << init.err;
+    Child start =
+        Run(tmp_.path(), {S2S_SERVER_PROGRAM, "--root", server_, "start"});
+    ASSERT_EQ(0, start.code) << start.err;
+    port_ = start.out.substr(start.out.rfind(' ') + 1);
+    port_.pop_back();  // the line break
+  }
+
+  void TearDown() override {
+    Child stop =
+        Run(tmp_.path(), {S2S_SERVER_PROGRAM, "--root", server_, "stop"});
+    EXPECT_EQ(0, stop.code) << stop.err;
+    EXPECT_NE(std::string::npos, stop.out.find("stopped")) << stop.out;
+  }
+
+  // A client root with serial `serial` and the share docs holding a tree.
+  std::string MakeClient(const std::string& name, const std::string& serial) {
+    std::string root = tmp_.Sub(name);
+    std::string vol = root + "/volume1";
+    std::filesystem::create_directories(root + "/etc/s2s");
+    std::filesystem::create_directories(vol + "/docs/sub/deeper");
+    std::filesystem::create_directories(vol + "/big");
+    WriteFile(root + "/etc/s2s/platform.conf",
+              "[Platform]\n\tserial=\"" + serial + "\"\n\tlookup=\"hosts\"\n");
+    WriteFile(root + "/etc/s2s/shares.conf",
+              "[docs]\n\tpath=\"" + vol + "/docs\"\n\tvolume=\"" + vol +
+                  "\"\n[big]\n\tpath=\"" + vol + "/big\"\n\tvolume=\"" + vol +
+                  "\"\n");
+    WriteFile(vol + "/docs/a.txt", "alpha\n");
+    WriteFile(vol + "/docs/sub/deeper/b.txt", "bravo from " + serial + "\n");
+    return root;
+  }
+
+  std::vector<std::string> Client(const std::string& root,
+                                  const std::string& share,
+                                  const std::vector<std::string>& more = {}) {
+    std::vector<std::string> argv = {
+        S2S_CLIENT_PROGRAM, "--root",    root,   "--server-ip",
+        "127.0.0.1",        "--port",    port_,  "--user",
+        "s2s",              "--task",    "t1",   "--share",
+        share,              "--password-file",   pw_file_};
+    argv.insert(argv.end(), more.begin(), more.end());
+    return argv;
+  }
+
+  std::string ShareKey(const std::string& share, const char* key) {
+    s2s_test::ScopedEnv root("S2S_ROOT", server_);
+    char buf[256] = "";
+    S2SServerGetShare(share.c_str(), key, buf, sizeof buf);
+    return buf;
+  }
+
+  s2s_test::TempDir tmp_;
+  std::string server_, pw_file_, port_;
+};
+
+TEST_F(ToolsTest, SyncsAShareAndTheServerRecordsIt) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  Child c = Run(tmp_.path(), Client(client, "docs"));
+  ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
+  EXPECT_EQ("bravo from CLIENT-A\n",
+            ReadFile(server_ + "/volume1/docs/sub/deeper/b.txt"));
+  EXPECT_NE(std::string::npos, c.out.find("share docs: finished")) << c.out;
+  EXPECT_NE(std::string::npos, c.out.find("1/1 shares synced")) << c.out;
+  EXPECT_EQ("CLIENT-A", ShareKey("docs", "CompleteID"));
+  EXPECT_EQ("", ShareKey("docs", "RunningID"));
+
+  // A file deleted on the client goes on the server too.
+  unlink((client + "/volume1/docs/a.txt").c_str());
+  ASSERT_EQ(kExitOk, Run(tmp_.path(), Client(client, "docs")).code);
+  EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/docs/a.txt"));
+
+  Child status =
+      Run(tmp_.path(), {S2S_SERVER_PROGRAM, "--root", server_, "status"});
+  EXPECT_NE(std::string::npos, status.out.find("service:  running"))
+      << status.out;
+  EXPECT_NE(std::string::npos, status.out.find("last completed by CLIENT-A"));
+  EXPECT_NE(std::string::npos, status.out.find("task  t1"));
+}
+
+TEST_F(ToolsTest, ExitCodesNameTheFailedStage) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  std::string other = MakeClient("other", "CLIENT-B");
+  int free_port = s2s_test::FreeLoopbackPort();
+  std::string wrong_pw = tmp_.Sub("wrong");
+  WriteFile(wrong_pw, "not-the-password\n");
+  chmod(wrong_pw.c_str(), 0600);
+  std::string open_pw = tmp_.Sub("open");
+  WriteFile(open_pw, std::string(kPassword) + "\n");
+  chmod(open_pw.c_str(), 0644);
+
+  ASSERT_EQ(kExitOk, Run(tmp_.path(), Client(client, "docs")).code);
+  struct Case {
+    std::string what;
+    std::vector<std::string> argv;
+    int code;
+    std::string says;
+  };
+  const Case cases[] = {
+      {"nothing listens",
+       Client(client, "docs", {"--port", std::to_string(free_port)}),
+       kExitUnreachable, "unreachable"},
+      {"wrong password", Client(client, "docs", {"--password-file", wrong_pw}),
+       kExitUnreachable, "unreachable"},
+      // A second client with another serial may not feed the same share.
+      {"pairing conflict", Client(other, "docs"), kExitPairing,
+       "shares fed by another client: docs"},
+      {"unknown share", Client(client, "nosuch"), kExitUsage,
+       "no local share"},
+      {"readable password file",
+       Client(client, "docs", {"--password-file", open_pw}), kExitUsage,
+       "0600"},
+  };
+  for (const Case& c : cases) {
+    Child r = Run(tmp_.path(), c.argv);
+    EXPECT_EQ(c.code, r.code) << c.what << "\n" << r.out << r.err;
+    EXPECT_NE(std::string::npos, (r.out + r.err).find(c.says))
+        << c.what << "\n" << r.out << r.err;
+  }
+  // The conflict left the first client's copy and record alone.
+  EXPECT_EQ("bravo from CLIENT-A\n",
+            ReadFile(server_ + "/volume1/docs/sub/deeper/b.txt"));
+  EXPECT_EQ("CLIENT-A", ShareKey("docs", "CompleteID"));
+}
+
+TEST_F(ToolsTest, PasswordNeverOnACommandLineOrInTheLogs) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  // From the environment this time, with every log line switched on.
+  std::vector<std::string> argv = Client(client, "docs", {"-v", "-v"});
+  argv.erase(argv.end() - 4, argv.end() - 2);  // --password-file FILE
+  Child c = Spawn(tmp_.path(), argv,
+                  {std::string("S2S_PASSWORD=") + kPassword});
+  int rsync_seen = 0;
+  int st = 0;
+  while (waitpid(c.pid, &st, WNOHANG) == 0) {
+    for (const std::string& cmd : AllCommandLines()) {
+      EXPECT_EQ(std::string::npos, cmd.find(kPassword)) << cmd;
+      if (cmd.find("rsync") == 0 && cmd.find(":" + port_) != std::string::npos) {
+        ++rsync_seen;
+      }
+    }
+  }
+  c.code = WIFEXITED(st) ? WEXITSTATUS(st) : -1;
+  c.out = ReadFile(c.out_path);
+  c.err = ReadFile(c.err_path);
+  ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
+  EXPECT_GT(rsync_seen, 0) << "the scan saw none of the client's rsync runs";
+  EXPECT_NE(std::string::npos, c.err.find("DEBUG")) << "not verbose?";
+  EXPECT_EQ(std::string::npos, c.out.find(kPassword));
+  EXPECT_EQ(std::string::npos, c.err.find(kPassword));
+  EXPECT_EQ(std::string::npos,
+            ReadFile(server_ + "/var/log/s2s/rsyncd.log").find(kPassword));
+  EXPECT_EQ(std::string::npos,
+            ReadFile(server_ + "/etc/s2s/rsyncd.conf").find(kPassword));
+  struct stat st_secrets;
+  ASSERT_EQ(0, stat((server_ + "/etc/s2s/rsyncd.secrets").c_str(),
+                    &st_secrets));
+  EXPECT_EQ(0600u, st_secrets.st_mode & 0777);
+}
+
+TEST_F(ToolsTest, SigtermCancelsARunningTransfer) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  {
+    // Big enough that the transfer is still running when the signal comes.
+    std::ofstream big(client + "/volume1/big/blob", std::ios::binary);
+    std::string chunk(1 << 20, 'x');
+    for (int i = 0; i < 400; ++i) {
+      chunk[i] = static_cast<char>(i);
+      big << chunk;
+    }
+  }
+  Child c = Spawn(tmp_.path(), Client(client, "big"));
+  bool signalled = false;
+  for (int waited = 0; waited < 20000 && !signalled; waited += 2) {
+    for (const std::string& cmd : AllCommandLines()) {
+      if (cmd.find("rsync") == 0 && cmd.find("/big/") != std::string::npos &&
+          cmd.find("/volume1/big") != std::string::npos) {
+        kill(c.pid, SIGTERM);
+        signalled = true;
+        break;
+      }
+    }
+    SleepMs(2);
+  }
+  ASSERT_TRUE(signalled) << "the transfer was never seen";
+  EXPECT_EQ(kExitCancelled, c.Wait()) << c.out << c.err;
+  EXPECT_NE(std::string::npos, c.out.find("cancelled")) << c.out;
+  // The task is recorded as idle again; the share's sync stays unfinished.
+  EXPECT_NE(std::string::npos, c.out.find("task t1: finished")) << c.out;
+  EXPECT_EQ("CLIENT-A", ShareKey("big", "RunningID"));
+}
+
+TEST(ToolsPrograms, DaemonModeWaitsForSigterm) {
+  s2s_test::TempDir tmp;
+  Child c = Spawn(tmp.path(), {S2S_CLIENT_PROGRAM, "--daemon"});
+  SleepMs(200);
+  EXPECT_EQ(0, waitpid(c.pid, nullptr, WNOHANG)) << "exited early";
+  kill(c.pid, SIGTERM);
+  EXPECT_EQ(0, c.Wait()) << c.err;
+}
+
+TEST(ToolsPrograms, ServerStopSignalsOnlyItsOwnDaemon) {
+  s2s_test::TempDir tmp;
+  std::string root = tmp.Sub("root");
+  std::filesystem::create_directories(root + "/var/run");
+  // A live process that is not this root's daemon, behind its pid file.
+  Child sleeper = Spawn(tmp.path(), {"/bin/sleep", "30"});
+  WriteFile(root + "/var/run/s2s-rsyncd.pid",
+            std::to_string(sleeper.pid) + "\n");
+  Child stop = Run(tmp.path(), {S2S_SERVER_PROGRAM, "--root", root, "stop"});
+  EXPECT_EQ(1, stop.code);
+  EXPECT_NE(std::string::npos, stop.err.find("not signalled")) << stop.err;
+  EXPECT_EQ(0, kill(sleeper.pid, 0)) << "the foreign process was signalled";
+  kill(sleeper.pid, SIGKILL);
+  sleeper.Wait();
+
+  Child none = Run(tmp.path(), {S2S_SERVER_PROGRAM, "--root", root, "stop"});
+  EXPECT_EQ(0, none.code);
+  EXPECT_NE(std::string::npos, none.out.find("was not running"));
+  Child usage = Run(tmp.path(), {S2S_SERVER_PROGRAM, "status"});
+  EXPECT_EQ(2, usage.code) << "no root given";
+}
+
+}  // namespace
