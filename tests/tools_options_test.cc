@@ -39,8 +39,8 @@ TEST(ClientOptions, TaskFileKeysThenOptionsOnTop) {
                         "\tpassword_file=\"/p\"\n"));
   ClientOptions o;
   std::string error;
-  ASSERT_TRUE(Parse({"--task-file", task, "--server-ip", "127.0.0.1",
-                     "--share", "a", "--share", "b", "--delta", "-v", "-v"},
+  ASSERT_TRUE(Parse({"--task-file", task, "--server-ip", "127.0.0.1", "--share",
+                     "a", "--share", "b", "--delta", "-v", "-v"},
                     o, error))
       << error;
   EXPECT_EQ("nightly", o.spec.name);

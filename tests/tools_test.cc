@@ -73,8 +73,8 @@ Child Spawn(const std::string& dir, const std::vector<std::string>& argv,
   return c;
 }
 
-Child Run(const std::string& dir, const std::vector<std::string>& argv,
-          const std::vector<std::string>& env = {}) {
+Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
+                 const std::vector<std::string>& env = {}) {
   Child c = Spawn(dir, argv, env);
   c.Wait();
   return c;
@@ -109,21 +109,21 @@ class ToolsTest : public ::testing::Test {
     pw_file_ = tmp_.Sub("password");
     ASSERT_TRUE(WriteFile(pw_file_, std::string(kPassword) + "\n"));
     chmod(pw_file_.c_str(), 0600);
-    Child init = Run(tmp_.path(), {S2S_SERVER_PROGRAM, "--root", server_,
-                                   "init", "--share", "docs", "--share",
-                                   "big", "--user", "s2s", "--password-file",
-                                   pw_file_});
+    Child init =
+        RunProgram(tmp_.path(), {S2S_SERVER_PROGRAM, "--root", server_, "init",
+                                 "--share", "docs", "--share", "big", "--user",
+                                 "s2s", "--password-file", pw_file_});
     ASSERT_EQ(0, init.code) << init.err;
-    Child start =
-        Run(tmp_.path(), {S2S_SERVER_PROGRAM, "--root", server_, "start"});
+    Child start = RunProgram(tmp_.path(),
+                             {S2S_SERVER_PROGRAM, "--root", server_, "start"});
     ASSERT_EQ(0, start.code) << start.err;
     port_ = start.out.substr(start.out.rfind(' ') + 1);
     port_.pop_back();  // the line break
   }
 
   void TearDown() override {
-    Child stop =
-        Run(tmp_.path(), {S2S_SERVER_PROGRAM, "--root", server_, "stop"});
+    Child stop = RunProgram(tmp_.path(),
+                            {S2S_SERVER_PROGRAM, "--root", server_, "stop"});
     EXPECT_EQ(0, stop.code) << stop.err;
     EXPECT_NE(std::string::npos, stop.out.find("stopped")) << stop.out;
   }
@@ -149,11 +149,21 @@ class ToolsTest : public ::testing::Test {
   std::vector<std::string> Client(const std::string& root,
                                   const std::string& share,
                                   const std::vector<std::string>& more = {}) {
-    std::vector<std::string> argv = {
-        S2S_CLIENT_PROGRAM, "--root",    root,   "--server-ip",
-        "127.0.0.1",        "--port",    port_,  "--user",
-        "s2s",              "--task",    "t1",   "--share",
-        share,              "--password-file",   pw_file_};
+    std::vector<std::string> argv = {S2S_CLIENT_PROGRAM,
+                                     "--root",
+                                     root,
+                                     "--server-ip",
+                                     "127.0.0.1",
+                                     "--port",
+                                     port_,
+                                     "--user",
+                                     "s2s",
+                                     "--task",
+                                     "t1",
+                                     "--share",
+                                     share,
+                                     "--password-file",
+                                     pw_file_};
     argv.insert(argv.end(), more.begin(), more.end());
     return argv;
   }
@@ -171,7 +181,7 @@ class ToolsTest : public ::testing::Test {
 
 TEST_F(ToolsTest, SyncsAShareAndTheServerRecordsIt) {
   std::string client = MakeClient("client", "CLIENT-A");
-  Child c = Run(tmp_.path(), Client(client, "docs"));
+  Child c = RunProgram(tmp_.path(), Client(client, "docs"));
   ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
   EXPECT_EQ("bravo from CLIENT-A\n",
             ReadFile(server_ + "/volume1/docs/sub/deeper/b.txt"));
@@ -182,11 +192,11 @@ TEST_F(ToolsTest, SyncsAShareAndTheServerRecordsIt) {
 
   // A file deleted on the client goes on the server too.
   unlink((client + "/volume1/docs/a.txt").c_str());
-  ASSERT_EQ(kExitOk, Run(tmp_.path(), Client(client, "docs")).code);
+  ASSERT_EQ(kExitOk, RunProgram(tmp_.path(), Client(client, "docs")).code);
   EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/docs/a.txt"));
 
-  Child status =
-      Run(tmp_.path(), {S2S_SERVER_PROGRAM, "--root", server_, "status"});
+  Child status = RunProgram(tmp_.path(),
+                            {S2S_SERVER_PROGRAM, "--root", server_, "status"});
   EXPECT_NE(std::string::npos, status.out.find("service:  running"))
       << status.out;
   EXPECT_NE(std::string::npos, status.out.find("last completed by CLIENT-A"));
@@ -204,7 +214,7 @@ TEST_F(ToolsTest, ExitCodesNameTheFailedStage) {
   WriteFile(open_pw, std::string(kPassword) + "\n");
   chmod(open_pw.c_str(), 0644);
 
-  ASSERT_EQ(kExitOk, Run(tmp_.path(), Client(client, "docs")).code);
+  ASSERT_EQ(kExitOk, RunProgram(tmp_.path(), Client(client, "docs")).code);
   struct Case {
     std::string what;
     std::vector<std::string> argv;
@@ -220,17 +230,17 @@ TEST_F(ToolsTest, ExitCodesNameTheFailedStage) {
       // A second client with another serial may not feed the same share.
       {"pairing conflict", Client(other, "docs"), kExitPairing,
        "shares fed by another client: docs"},
-      {"unknown share", Client(client, "nosuch"), kExitUsage,
-       "no local share"},
+      {"unknown share", Client(client, "nosuch"), kExitUsage, "no local share"},
       {"readable password file",
        Client(client, "docs", {"--password-file", open_pw}), kExitUsage,
        "0600"},
   };
   for (const Case& c : cases) {
-    Child r = Run(tmp_.path(), c.argv);
+    Child r = RunProgram(tmp_.path(), c.argv);
     EXPECT_EQ(c.code, r.code) << c.what << "\n" << r.out << r.err;
     EXPECT_NE(std::string::npos, (r.out + r.err).find(c.says))
-        << c.what << "\n" << r.out << r.err;
+        << c.what << "\n"
+        << r.out << r.err;
   }
   // The conflict left the first client's copy and record alone.
   EXPECT_EQ("bravo from CLIENT-A\n",
@@ -243,14 +253,15 @@ TEST_F(ToolsTest, PasswordNeverOnACommandLineOrInTheLogs) {
   // From the environment this time, with every log line switched on.
   std::vector<std::string> argv = Client(client, "docs", {"-v", "-v"});
   argv.erase(argv.end() - 4, argv.end() - 2);  // --password-file FILE
-  Child c = Spawn(tmp_.path(), argv,
-                  {std::string("S2S_PASSWORD=") + kPassword});
+  Child c =
+      Spawn(tmp_.path(), argv, {std::string("S2S_PASSWORD=") + kPassword});
   int rsync_seen = 0;
   int st = 0;
   while (waitpid(c.pid, &st, WNOHANG) == 0) {
     for (const std::string& cmd : AllCommandLines()) {
       EXPECT_EQ(std::string::npos, cmd.find(kPassword)) << cmd;
-      if (cmd.find("rsync") == 0 && cmd.find(":" + port_) != std::string::npos) {
+      if (cmd.find("rsync") == 0 &&
+          cmd.find(":" + port_) != std::string::npos) {
         ++rsync_seen;
       }
     }
@@ -260,7 +271,8 @@ TEST_F(ToolsTest, PasswordNeverOnACommandLineOrInTheLogs) {
   c.err = ReadFile(c.err_path);
   ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
   EXPECT_GT(rsync_seen, 0) << "the scan saw none of the client's rsync runs";
-  EXPECT_NE(std::string::npos, c.err.find("DEBUG")) << "not verbose?";
+  EXPECT_NE(std::string::npos, c.err.find("[INFO]")) << "not verbose?";
+  EXPECT_NE(std::string::npos, c.err.find("karorsync")) << "no rsync output";
   EXPECT_EQ(std::string::npos, c.out.find(kPassword));
   EXPECT_EQ(std::string::npos, c.err.find(kPassword));
   EXPECT_EQ(std::string::npos,
@@ -268,8 +280,8 @@ TEST_F(ToolsTest, PasswordNeverOnACommandLineOrInTheLogs) {
   EXPECT_EQ(std::string::npos,
             ReadFile(server_ + "/etc/s2s/rsyncd.conf").find(kPassword));
   struct stat st_secrets;
-  ASSERT_EQ(0, stat((server_ + "/etc/s2s/rsyncd.secrets").c_str(),
-                    &st_secrets));
+  ASSERT_EQ(0,
+            stat((server_ + "/etc/s2s/rsyncd.secrets").c_str(), &st_secrets));
   EXPECT_EQ(0600u, st_secrets.st_mode & 0777);
 }
 
@@ -322,17 +334,19 @@ TEST(ToolsPrograms, ServerStopSignalsOnlyItsOwnDaemon) {
   Child sleeper = Spawn(tmp.path(), {"/bin/sleep", "30"});
   WriteFile(root + "/var/run/s2s-rsyncd.pid",
             std::to_string(sleeper.pid) + "\n");
-  Child stop = Run(tmp.path(), {S2S_SERVER_PROGRAM, "--root", root, "stop"});
+  Child stop =
+      RunProgram(tmp.path(), {S2S_SERVER_PROGRAM, "--root", root, "stop"});
   EXPECT_EQ(1, stop.code);
   EXPECT_NE(std::string::npos, stop.err.find("not signalled")) << stop.err;
   EXPECT_EQ(0, kill(sleeper.pid, 0)) << "the foreign process was signalled";
   kill(sleeper.pid, SIGKILL);
   sleeper.Wait();
 
-  Child none = Run(tmp.path(), {S2S_SERVER_PROGRAM, "--root", root, "stop"});
+  Child none =
+      RunProgram(tmp.path(), {S2S_SERVER_PROGRAM, "--root", root, "stop"});
   EXPECT_EQ(0, none.code);
   EXPECT_NE(std::string::npos, none.out.find("was not running"));
-  Child usage = Run(tmp.path(), {S2S_SERVER_PROGRAM, "status"});
+  Child usage = RunProgram(tmp.path(), {S2S_SERVER_PROGRAM, "status"});
   EXPECT_EQ(2, usage.code) << "no root given";
 }
 

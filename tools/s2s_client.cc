@@ -30,10 +30,11 @@ using namespace s2s_tools;
 
 int g_verbose = 0;
 
-// rsync's own lines (debug) only when asked for; warnings always.
+// The wrapper's lines: warnings always, rsync's own output (debug) only
+// when asked for.
 void WrapperLog(int priority, const char* message) {
   if (priority <= LOG_WARNING || g_verbose >= 2) {
-    fprintf(stderr, "rsync: %s\n", message);
+    fprintf(stderr, "%s\n", message);
   }
 }
 

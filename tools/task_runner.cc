@@ -12,7 +12,7 @@ namespace s2s_tools {
 
 namespace {
 
-const int kCancelledStatus = 20;
+const int kConflictStatus = 214;
 const int kServiceDisabled = 244;
 const int kPairedElsewhere = 245;
 
@@ -96,12 +96,14 @@ bool Run::Pair() {
   const std::list<std::string>& shares = task_.GetInfo().GetShareList();
   int status = 0;
   int rc = rsyncer_.DoPairing(false, shares, out_.conflicts, status);
-  if (rc != 0 || status != 0) {
-    return Stop(kExitPairing, "pairing refused: " + StatusText(status));
-  }
-  if (!out_.conflicts.empty()) {
+  // 214 is the server's answer that some shares conflict; the list says
+  // which.
+  if (rc == 0 && status == kConflictStatus && !out_.conflicts.empty()) {
     return Stop(kExitPairing,
                 "shares fed by another client: " + Join(out_.conflicts));
+  }
+  if (rc != 0 || status != 0) {
+    return Stop(kExitPairing, "pairing refused: " + StatusText(status));
   }
   report_("pair: " + Join(shares) +
           (rsyncer_.SupportMultiSource() ? "" : " (single-client server)"));
