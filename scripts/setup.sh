@@ -3,6 +3,9 @@
 # packages S2S needs (only those missing), configures and builds, then runs
 # the requested job.
 #
+#   bash scripts/setup.sh demo     build and run the demo (tools/demo.sh):
+#                                  a client and a server appliance on this
+#                                  machine, a sync between them, checked
 #   bash scripts/setup.sh test     build and run the test suite
 #   bash scripts/setup.sh build    build only
 #
@@ -56,18 +59,26 @@ configure_and_build() {
     -DS2S_BUILD_TESTS=ON \
     -DS2S_BUILD_BENCHMARKS=$benches \
     -DS2S_SANITIZE="$sanitize" >/dev/null
-  cmake --build "$dir" -j "$(nproc)"
+  # The demo needs only the programs.
+  local targets=()
+  if [ "$job" = demo ]; then
+    targets=(--target s2s-client s2s-server s2s-cmd-handler)
+  fi
+  cmake --build "$dir" -j "$(nproc)" "${targets[@]}"
 }
 
 install_missing
 configure_and_build
 case "$job" in
   build) ;;
+  demo)
+    bash tools/demo.sh "$BUILD"
+    ;;
   test)
     ctest --test-dir "$BUILD" --output-on-failure -j "$(nproc)" --timeout 300
     ;;
   *)
-    echo "usage: bash scripts/setup.sh [test|build]" >&2
+    echo "usage: bash scripts/setup.sh [demo|test|build]" >&2
     exit 2
     ;;
 esac
