@@ -24,20 +24,14 @@ std::string ValidateMessage(const Schedule& s, bool* ok) {
   return text.substr(text.find("): ") + 3);
 }
 
-TEST(Schedule, DefaultsDescribeAManualTaskRunningDailyAtMidnight) {
+TEST(Schedule, DefaultIsAValidManualSchedule) {
   Schedule s;
   EXPECT_EQ(s.GetMode(), S2S::SCHD_MANUAL);
   EXPECT_EQ(s.GetModeStr(), "manual");
-  EXPECT_EQ(s.GetWeekSchedule(), "1111111");
-  EXPECT_EQ(s.GetBeginYear(), 2014);
-  EXPECT_EQ(s.GetBeginMonth(), 1);
-  EXPECT_EQ(s.GetBeginDay(), 1);
-  EXPECT_EQ(s.GetPeriodSeconds(), 0);
-  EXPECT_EQ(s.GetRepeatTimesInDay(), 0);
   bool ok = false;
   EXPECT_EQ(ValidateMessage(s, &ok), "");
   EXPECT_TRUE(ok);
-
+  // Every other member of the broken-down begin is zero, tm_isdst included.
   struct tm b = s.GetScheduleBegin();
   EXPECT_EQ(b.tm_year, 114);
   EXPECT_EQ(b.tm_mon, 0);
@@ -103,79 +97,43 @@ TEST(Schedule, WeekScheduleIsNormalisedToSevenFlags) {
 }
 
 TEST(Schedule, ValidateReportsTheFirstBrokenRule) {
-  struct Case {
+  const struct {
     const char* what;
-    void (*edit)(Schedule&);
+    int hour, minute;
+    long period, repeat;
+    int year, month, day, mode;
     const char* message;  // "" when valid
-  };
-  const Case cases[] = {
-      {"negative hour", [](Schedule& s) { s.SetStartHour(-1); },
-       "Invalid begin hour\n"},
-      {"hour 24", [](Schedule& s) { s.SetStartHour(24); },
-       "Invalid begin hour\n"},
-      {"minute 60", [](Schedule& s) { s.SetStartMinute(60); },
-       "Invalid begin minute\n"},
-      {"period a day",
-       [](Schedule& s) {
-         s.SetPeriod(86400);
-         s.SetRepeatTimesInDay(1);
-       },
+  } cases[] = {
+      {"negative hour", -1, 0, 0, 0, 2014, 1, 1, 0, "Invalid begin hour\n"},
+      {"hour 24", 24, 0, 0, 0, 2014, 1, 1, 0, "Invalid begin hour\n"},
+      {"minute 60", 0, 60, 0, 0, 2014, 1, 1, 0, "Invalid begin minute\n"},
+      {"period a day", 0, 0, 86400, 1, 2014, 1, 1, 0,
        "Invalid period or repeat\n"},
-      {"negative period",
-       [](Schedule& s) {
-         s.SetPeriod(-60);
-         s.SetRepeatTimesInDay(1);
-       },
+      {"negative period", 0, 0, -60, 1, 2014, 1, 1, 0,
        "Invalid period or repeat\n"},
-      {"repeat 96",
-       [](Schedule& s) {
-         s.SetPeriod(60);
-         s.SetRepeatTimesInDay(96);
-       },
-       "Invalid period\n"},
-      {"last run tomorrow",
-       [](Schedule& s) {
-         s.SetStartHour(23);
-         s.SetPeriod(3600);
-         s.SetRepeatTimesInDay(1);
-       },
+      {"repeat 96", 0, 0, 60, 96, 2014, 1, 1, 0, "Invalid period\n"},
+      {"last run tomorrow", 23, 0, 3600, 1, 2014, 1, 1, 0,
        "Invalid repeat in day [82800 + 3600 * 1]\n"},
-      {"last run 23:59",
-       [](Schedule& s) {
-         s.SetStartHour(22);
-         s.SetStartMinute(59);
-         s.SetPeriod(3600);
-         s.SetRepeatTimesInDay(1);
-       },
-       ""},
-      {"29 February 2015",
-       [](Schedule& s) {
-         s.SetBeginYear(2015);
-         s.SetBeginMonth(2);
-         s.SetBeginDay(29);
-       },
-       "Invalid begin date\n"},
-      {"29 February 2016",
-       [](Schedule& s) {
-         s.SetBeginYear(2016);
-         s.SetBeginMonth(2);
-         s.SetBeginDay(29);
-       },
-       ""},
-      {"month 13", [](Schedule& s) { s.SetBeginMonth(13); },
-       "Invalid begin date\n"},
-      {"before the epoch", [](Schedule& s) { s.SetBeginYear(1960); },
-       "Invalid begin\n"},
-      {"mode 6", [](Schedule& s) { s.SetMode(S2S::SCHD_MODE(6)); },
-       "Invalid schedule mode [6]\n"},
-      {"mode -1", [](Schedule& s) { s.SetMode(S2S::SCHD_MODE(-1)); },
-       "Invalid schedule mode [-1]\n"},
-      {"once", [](Schedule& s) { s.SetMode(S2S::SCHD_ONCE); }, ""},
+      {"last run 23:59", 22, 59, 3600, 1, 2014, 1, 1, 0, ""},
+      {"29 February 2015", 0, 0, 0, 0, 2015, 2, 29, 0, "Invalid begin date\n"},
+      {"29 February 2016", 0, 0, 0, 0, 2016, 2, 29, 0, ""},
+      {"month 13", 0, 0, 0, 0, 2014, 13, 1, 0, "Invalid begin date\n"},
+      {"before the epoch", 0, 0, 0, 0, 1960, 1, 1, 0, "Invalid begin\n"},
+      {"mode 6", 0, 0, 0, 0, 2014, 1, 1, 6, "Invalid schedule mode [6]\n"},
+      {"mode -1", 0, 0, 0, 0, 2014, 1, 1, -1, "Invalid schedule mode [-1]\n"},
+      {"once", 0, 0, 0, 0, 2014, 1, 1, S2S::SCHD_ONCE, ""},
   };
   s2s_test::ScopedTZ tz("UTC");
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     Schedule s;
-    c.edit(s);
+    s.SetStartHour(c.hour);
+    s.SetStartMinute(c.minute);
+    s.SetPeriod(c.period);
+    s.SetRepeatTimesInDay(c.repeat);
+    s.SetBeginYear(c.year);
+    s.SetBeginMonth(c.month);
+    s.SetBeginDay(c.day);
+    s.SetMode(static_cast<S2S::SCHD_MODE>(c.mode));
     bool ok = true;
     std::string message = ValidateMessage(s, &ok);
     if (std::string(c.message) == "Invalid begin\n") {
