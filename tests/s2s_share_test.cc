@@ -17,30 +17,16 @@ using s2s_test::SyslogCapture;
 using s2s_test::TempRoot;
 
 const char kShares[] =
-    "[docs]\n"
-    "\tpath=\"/volume1/docs\"\n"
-    "\tencrypted=\"yes\"\n"
-    "\tauto_mount=\"yes\"\n"
-    "\tkey_length=\"32\"\n"
-    "\tenc_path=\"/volume1/@docs@\"\n"
-    "\tvolume=\"/volume1\"\n"
-    "\tvolume_type=\"1\"\n"
-    "[public]\n"
-    "\tpath=\"/volume1/public/\"\n"
-    "\twin_share=\"yes\"\n"
-    "\tcluster=\"yes\"\n"
-    "\tvolume=\"/volume1\"\n"
-    "[secret]\n"
-    "\tpath=\"/volume2/secret\"\n"
-    "\tencrypted=\"yes\"\n"
+    "[docs]\n\tpath=\"/volume1/docs\"\n\tencrypted=\"yes\"\n"
+    "\tauto_mount=\"yes\"\n\tkey_length=\"32\"\n\tvolume_type=\"1\"\n"
+    "\tenc_path=\"/volume1/@docs@\"\n\tvolume=\"/volume1\"\n"
+    "[public]\n\tpath=\"/volume1/public/\"\n\twin_share=\"yes\"\n"
+    "\tcluster=\"yes\"\n\tvolume=\"/volume1\"\n"
+    "[secret]\n\tpath=\"/volume2/secret\"\n\tencrypted=\"yes\"\n"
     "\tkey_file=\"/keys/secret.key\"\n"
-    "[usb]\n"
-    "\tpath=\"/media/usb/photos\"\n"
-    "\tvolume=\"/media/usb\"\n"
-    "\tvolume_type=\"3\"\n"
-    "\tsharebin=\"yes\"\n"
-    "[nopath]\n"
-    "\tacl=\"yes\"\n";
+    "[usb]\n\tpath=\"/media/usb/photos\"\n\tvolume=\"/media/usb\"\n"
+    "\tvolume_type=\"3\"\n\tsharebin=\"yes\"\n"
+    "[nopath]\n\tacl=\"yes\"\n";
 
 class ShareTest : public ::testing::Test {
  protected:
