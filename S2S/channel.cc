@@ -47,6 +47,28 @@ int PlainIsClosed(void* h) {
   return h == nullptr || *static_cast<int*>(h) == -1;
 }
 
+// Copies of the integer widths become single moves instead of calls.
+inline void CopyBytes(char* dst, const char* src, uint32_t n) {
+  switch (n) {
+    case 0:
+      return;
+    case 1:
+      *dst = *src;
+      return;
+    case 2:
+      memcpy(dst, src, 2);
+      return;
+    case 4:
+      memcpy(dst, src, 4);
+      return;
+    case 8:
+      memcpy(dst, src, 8);
+      return;
+    default:
+      memcpy(dst, src, n);
+  }
+}
+
 }  // namespace
 
 Channel::Channel(unsigned int capacity)
@@ -358,11 +380,29 @@ int Channel::FlushWrite(int want) {
 }
 
 int Channel::Read(char* buf, unsigned int len, unsigned int& got) {
-  if (IsClosed()) return kIOError;
+  if (is_closed_op(handle)) return kIOError;
+  // Most reads of a message (tags, lengths, short strings) are served whole
+  // from one run of the ring. This is the general path below with n = len
+  // and no wrap, so the counters end exactly as it would leave them
+  // (including a head left at `capacity`, which only the next read wraps).
+  if (len <= r_size && len <= capacity - r_head) {
+    CopyBytes(buf, r_buf + r_head, len);
+    r_size -= len;
+    r_head = r_size == 0 ? 0 : r_head + len;
+    got = len;
+    LOG_DEBUG("Read: read %d bytes, head = %d, size = %d",
+              static_cast<int>(got), static_cast<int>(r_head),
+              static_cast<int>(r_size));
+    return 0;
+  }
+  return ReadWrapped(buf, len, got);
+}
+
+int Channel::ReadWrapped(char* buf, unsigned int len, unsigned int& got) {
   uint32_t n = std::min(len, r_size);
   uint32_t first = std::min(n, capacity - r_head);
-  memcpy(buf, r_buf + r_head, first);
-  memcpy(buf + first, r_buf, n - first);
+  if (first > 0) memcpy(buf, r_buf + r_head, first);
+  if (n > first) memcpy(buf + first, r_buf, n - first);
   r_size -= n;
   if (r_size == 0) {
     r_head = 0;
@@ -380,7 +420,7 @@ int Channel::Read(char* buf, unsigned int len, unsigned int& got) {
     result = ReadMore(static_cast<int>(chunk));
     if (result < 0) {
       // Hand over what did arrive; the ring keeps its counters.
-      memcpy(buf + got, r_buf, r_size);
+      if (r_size > 0) memcpy(buf + got, r_buf, r_size);
       got += r_size;
       break;
     }
@@ -400,7 +440,21 @@ int Channel::Read(char* buf, unsigned int len) {
 }
 
 int Channel::Write(const char* buf, unsigned int len) {
-  if (IsClosed()) return kIOError;
+  if (is_closed_op(handle)) return kIOError;
+  uint32_t tail = w_head + w_size;
+  if (tail >= capacity) tail -= capacity;
+  // The block fits the ring without a flush and without wrapping: the
+  // general path below would copy it in one piece too.
+  if (len <= capacity - w_size && len <= capacity - tail) {
+    CopyBytes(w_buf + tail, buf, len);
+    w_size += len;
+    LOG_DEBUG("Write: write %d bytes", static_cast<int>(len));
+    return 0;
+  }
+  return WriteWrapped(buf, len);
+}
+
+int Channel::WriteWrapped(const char* buf, unsigned int len) {
   if (len > capacity) {
     LOG_WARNING("Write: Exceed maximum data block size");
     return kInvalidArgument;
@@ -415,8 +469,8 @@ int Channel::Write(const char* buf, unsigned int len) {
   uint32_t tail = w_head + w_size;
   if (tail >= capacity) tail -= capacity;
   uint32_t first = std::min(len, capacity - tail);
-  memcpy(w_buf + tail, buf, first);
-  memcpy(w_buf, buf + first, len - first);
+  if (first > 0) memcpy(w_buf + tail, buf, first);
+  if (len > first) memcpy(w_buf, buf + first, len - first);
   w_size += len;
   LOG_DEBUG("Write: write %d bytes", static_cast<int>(len));
   return 0;

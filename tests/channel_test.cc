@@ -162,6 +162,24 @@ TEST(ChannelTest, WriteBuffersUpToCapacityAndFlushesOnlyForRoom) {
   EXPECT_GE(p.Pending().size(), 10u);
 }
 
+// A read may end exactly at the end of the ring while wrapped bytes remain;
+// the next read must continue from the start of the ring.
+TEST(ChannelTest, ReadsContinueAcrossTheEndOfAWrappedRing) {
+  RawPeer p(8);
+  ASSERT_TRUE(p.ok);
+  ASSERT_EQ(write(p.peer, "0123456789abcdef", 16), 16);
+  char buf[8] = {};
+  ASSERT_EQ(p.ch.Read(buf, 3), 0);  // the ring takes 8 bytes: 5 remain
+  EXPECT_EQ(std::string(buf, 3), "012");
+  ASSERT_EQ(p.ch.ReadMore(1), 0);   // fills the 3 free bytes at the start
+  ASSERT_EQ(p.ch.Read(buf, 5), 0);  // up to the very end of the ring
+  EXPECT_EQ(std::string(buf, 5), "34567");
+  ASSERT_EQ(p.ch.Read(buf, 3), 0);
+  EXPECT_EQ(std::string(buf, 3), "89a");
+  ASSERT_EQ(p.ch.Read(buf, 5), 0);
+  EXPECT_EQ(std::string(buf, 5), "bcdef");
+}
+
 TEST(ChannelTest, PeerClosingMidMessageFailsTheReadWithWhatArrived) {
   LogCapture log(4);
   RawPeer p;

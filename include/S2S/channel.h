@@ -184,6 +184,11 @@ class S2S_EXPORT Channel {
   static int InstallVerifyCA(SSL_CTX* ctx);
 
  private:
+  // The general paths of Read and Write: ring runs that wrap, reads that
+  // need the socket, writes that need room or are refused.
+  int ReadWrapped(char* buf, unsigned int len, unsigned int& got);
+  int WriteWrapped(const char* buf, unsigned int len);
+
   void* handle;  // int* socket for a plain channel, SSL* for TLS, or null
   ReadOp read_op;
   WriteOp write_op;
