@@ -138,7 +138,9 @@ int PStream::Send(Channel& ch, const std::map<std::string, PObject>& m) {
   ++depth;
   for (const auto& member : m) {
     const std::string& key = member.first;
-    std::string wire_key = !key.empty() && key[0] == '_' ? key.substr(1) : key;
+    std::string stripped;
+    if (!key.empty() && key[0] == '_') stripped = key.substr(1);
+    const std::string& wire_key = key.empty() || key[0] != '_' ? key : stripped;
     r = Send(ch, wire_key);
     if (r < 0) return r;
     PushKey(wire_key);
@@ -242,16 +244,28 @@ int PStream::Recv(Channel& ch, std::string& s) {
   unsigned short len;
   int r = ch.ReadInt16(&len);
   if (r < 0) return ChannelFailure(r);
-  s.resize(len);
+  // Short strings (keys, most values) are read into the stack and assigned
+  // once; longer ones straight into the string.
+  char small[128];
+  char* bytes = small;
+  if (len > sizeof small) {
+    s.resize(len);
+    bytes = &s[0];
+  }
   if (len > 0) {
-    r = ch.Read(&s[0], len);
+    r = ch.Read(bytes, len);
     if (r < 0) {
       s.clear();
       return ChannelFailure(r);
     }
   }
   // A string ends at its first zero byte, whatever the length said.
-  s.resize(strnlen(s.data(), len));
+  size_t n = strnlen(bytes, len);
+  if (bytes == small) {
+    s.assign(small, n);
+  } else {
+    s.resize(n);
+  }
   LOG_DEBUG("%s\"%s\"", Indent(), s.c_str());
   return 0;
 }
@@ -297,7 +311,9 @@ int PStream::Recv(Channel& ch, std::map<std::string, PObject>& m) {
     r = Recv(ch, key);
     if (r < 0) return r;
     PushKey(key);
-    r = RecvObject(ch, m[key]);
+    // Senders write members in key order, so the end is the usual place
+    // for a new key; the hint falls back to a full search otherwise.
+    r = RecvObject(ch, m.try_emplace(m.end(), std::move(key))->second);
     if (r < 0) return r;
     PopKey();
   }
@@ -349,7 +365,8 @@ void PStream::ClearHistory() {
   {
     MutexLock lock(&mutex);
     history.clear();
-    first_status = second_status = 0;
+    first_status.store(0, std::memory_order_relaxed);
+    second_status.store(0, std::memory_order_relaxed);
   }
   depth = 0;
 }
@@ -368,17 +385,26 @@ void PStream::DumpHistory() {
 
 void PStream::UpdateStatus(unsigned long long first,
                            unsigned long long second) {
+  // Every primitive reports (0, 0), which the counters nearly always hold
+  // already; storing equal values again would change nothing a reader under
+  // the mutex can see, so the lock is taken only for a real change. Updates
+  // come from the thread running the codec (the mutex is for readers), so
+  // the values seen here are the current ones.
+  if (first_status.load(std::memory_order_relaxed) == first &&
+      second_status.load(std::memory_order_relaxed) == second) {
+    return;
+  }
   MutexLock lock(&mutex);
-  first_status = first;
-  second_status = second;
+  first_status.store(first, std::memory_order_relaxed);
+  second_status.store(second, std::memory_order_relaxed);
 }
 
 void PStream::GetStatus(std::string& h, unsigned long long& first,
                         unsigned long long& second) {
   MutexLock lock(&mutex);
   h = GetHistory();
-  first = first_status;
-  second = second_status;
+  first = first_status.load(std::memory_order_relaxed);
+  second = second_status.load(std::memory_order_relaxed);
 }
 
 void PStream::SetDefaultRecvLocation(const std::string& location) {

@@ -4,8 +4,10 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <random>
 #include <string>
+#include <thread>
 
 #include "S2S/result_codes.h"
 #include "testutil.h"
@@ -37,6 +39,13 @@ class Wire {
     if (peer_ >= 0) close(peer_);
   }
   bool ok() const { return ok_; }
+  Channel& channel() { return ch_; }
+  // Discards what reached the peer.
+  void Drain() {
+    char buf[4096];
+    while (recv(peer_, buf, sizeof buf, MSG_DONTWAIT) > 0) {
+    }
+  }
 
   // Encodes with a fresh stream; the bytes that reached the peer.
   std::string Encode(const PObject& obj, int* result = nullptr) {
@@ -205,6 +214,37 @@ TEST(PStreamTest, ReceivingMergesIntoWhatTheObjectHolds) {
   EXPECT_EQ(s.asString(), "a");  // cut at the zero byte
 }
 
+// Short strings are received through a stack buffer, long ones in place:
+// both sides of that line keep every byte and stop at the first zero.
+TEST(PStreamTest, StringsOfEveryLengthArriveCutAtTheirFirstZero) {
+  const struct {
+    size_t len;
+    size_t zero_at;  // npos: no zero byte
+  } cases[] = {{0, std::string::npos},
+               {1, 0},
+               {127, std::string::npos},
+               {128, std::string::npos},
+               {128, 127},
+               {129, std::string::npos},
+               {129, 128},
+               {700, 3},
+               {700, std::string::npos}};
+  for (const auto& c : cases) {
+    std::string body(c.len, '\0');
+    for (size_t i = 0; i < c.len; ++i)
+      body[i] = static_cast<char>('A' + i % 26);
+    if (c.zero_at != std::string::npos) body[c.zero_at] = '\0';
+    Wire w;
+    ASSERT_TRUE(w.ok());
+    PObject got;
+    std::string msg = Bytes({0x10, static_cast<int>(c.len >> 8),
+                             static_cast<int>(c.len & 0xFF)}) +
+                      body;
+    ASSERT_EQ(w.Decode(msg, got), 0) << c.len;
+    EXPECT_EQ(got.asStringRef(), body.substr(0, c.zero_at)) << c.len;
+  }
+}
+
 TEST(PStreamTest, MalformedInputIsAProtocolError) {
   const struct {
     std::string bytes;
@@ -296,6 +336,32 @@ TEST(PStreamTest, HistoryAndStatus) {
   ps.GetStatus(h, first, second);
   EXPECT_EQ(first, 3u);
   EXPECT_EQ(second, 4u);
+  ps.UpdateStatus(0, 4);  // only one counter changes
+  ps.GetStatus(h, first, second);
+  EXPECT_EQ(first, 0u);
+  EXPECT_EQ(second, 4u);
+  ps.UpdateStatus(0, 0);
+  ps.GetStatus(h, first, second);
+  EXPECT_EQ(second, 0u);
+
+  // Another thread may read the status while messages are encoded.
+  Wire w;
+  ASSERT_TRUE(w.ok());
+  std::atomic<bool> done{false};
+  std::thread reader([&] {
+    std::string hist;
+    unsigned long long f, s;
+    while (!done) w.stream_.GetStatus(hist, f, s);
+  });
+  PObject msg;
+  msg["a"]["b"] = "c";
+  for (int i = 0; i < 200; ++i) {
+    w.stream_.UpdateStatus(i % 3, 0);
+    ASSERT_EQ(w.stream_.Send(w.channel(), msg), 0);
+    w.Drain();
+  }
+  done = true;
+  reader.join();
   unsigned int major, minor, patch;
   ps.GetVersion(major, minor, patch);
   EXPECT_EQ(major * 100 + minor * 10 + patch, 100u);

@@ -26,6 +26,7 @@
 
 #include <pthread.h>
 
+#include <atomic>
 #include <map>
 #include <string>
 #include <vector>
@@ -108,8 +109,10 @@ class S2S_EXPORT PStream {
   const char* Indent() const;
 
   std::vector<std::string> history;
-  unsigned long long second_status;
-  unsigned long long first_status;
+  // Written under the mutex; atomic so that UpdateStatus may look at them
+  // without it.
+  std::atomic<unsigned long long> second_status;
+  std::atomic<unsigned long long> first_status;
   pthread_mutex_t mutex;
   unsigned int depth;
   std::string default_recv_location;
