@@ -203,6 +203,42 @@ TEST_F(ToolsTest, SyncsAShareAndTheServerRecordsIt) {
   EXPECT_NE(std::string::npos, status.out.find("task  t1"));
 }
 
+// A task file run with a beacon due at every poll: the beacons' own rsync
+// runs nest inside the transfer's wait without disturbing it.
+TEST_F(ToolsTest, TaskFileRunWithBeaconsDuringTheTransfer) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  {
+    std::ofstream blob(client + "/volume1/big/blob", std::ios::binary);
+    std::string chunk(1 << 20, 'y');
+    for (int i = 0; i < 64; ++i) {
+      chunk[i] = static_cast<char>(i);
+      blob << chunk;
+    }
+  }
+  std::string task = tmp_.Sub("t.task");
+  WriteFile(task,
+            "[Task]\n\tname=\"filetask\"\n\tserver_ip=\"127.0.0.1\"\n"
+            "\tport=\"" +
+                port_ +
+                "\"\n\tuser=\"s2s\"\n"
+                "\tpassword_file=\"" +
+                pw_file_ +
+                "\"\n"
+                "\tshares=\"docs:big\"\n");
+  Child c =
+      RunProgram(tmp_.path(), {S2S_CLIENT_PROGRAM, "--root", client,
+                               "--task-file", task, "--beacon-interval", "0"});
+  ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
+  EXPECT_NE(std::string::npos, c.out.find("beacon: transfer running")) << c.out;
+  EXPECT_NE(std::string::npos, c.out.find("2/2 shares synced")) << c.out;
+  EXPECT_EQ(64u << 20,
+            std::filesystem::file_size(server_ + "/volume1/big/blob"));
+  Child status = RunProgram(tmp_.path(),
+                            {S2S_SERVER_PROGRAM, "--root", server_, "status"});
+  EXPECT_NE(std::string::npos, status.out.find("task  filetask         idle"))
+      << status.out;
+}
+
 TEST_F(ToolsTest, ExitCodesNameTheFailedStage) {
   std::string client = MakeClient("client", "CLIENT-A");
   std::string other = MakeClient("other", "CLIENT-B");
