@@ -310,6 +310,11 @@ int Channel::GetPeerInfo(std::string& ip, int& port) const {
 
 // ---------------------------------------------------------------------------
 // The rings.
+//
+// Every byte passes through a ring, even where a large read or write could
+// go straight between the socket and the caller's buffer: what ClearRead
+// and ClearWrite drop, what a flush sends, and what a subclass's ReadMore
+// or FlushWrite sees all depend on the bytes being buffered there.
 
 int Channel::ReadMore(int want) {
   if (want < 1) return 0;
