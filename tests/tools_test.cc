@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "S2S/is_syncedshare.h"
+#include "S2S/s2s_host.h"
 #include "exit_codes.h"
 #include "gtest/gtest.h"
 #include "testutil.h"
@@ -360,6 +361,20 @@ TEST(ToolsPrograms, DaemonModeWaitsForSigterm) {
   EXPECT_EQ(0, waitpid(c.pid, nullptr, WNOHANG)) << "exited early";
   kill(c.pid, SIGTERM);
   EXPECT_EQ(0, c.Wait()) << c.err;
+}
+
+// The platform's service "s2s_daemon" runs `s2s-client --daemon`, which
+// must stay up until the service is paused.
+TEST(ToolsPrograms, ClientRunsAsThePlatformService) {
+  s2s_test::TempRoot root;
+  ASSERT_TRUE(root.Write("/etc/s2s/platform.conf",
+                         std::string("[Platform]\n\tdaemon_program=\"") +
+                             S2S_CLIENT_PROGRAM + "\"\n"));
+  ASSERT_EQ(0, S2S::StartDaemon());
+  SleepMs(100);
+  EXPECT_TRUE(S2S::IsDaemonRunning());
+  EXPECT_EQ(0, S2S::StopDaemon());
+  EXPECT_FALSE(S2S::IsDaemonRunning());
 }
 
 TEST(ToolsPrograms, ServerStopSignalsOnlyItsOwnDaemon) {
