@@ -5,6 +5,7 @@
 
 #include <filesystem>
 
+#include "S2S/is_syncedshare.h"
 #include "daemon_config.h"
 
 namespace s2s_test {
@@ -152,12 +153,92 @@ std::string Appliances::ServerKeyDir() const {
   return server_root_ + "/usr/karo/etc/.encrypt";
 }
 
+std::string Appliances::ServerRegistry(const std::string& section,
+                                       const std::string& key) {
+  std::string value;
+  ScopedEnv server("S2S_ROOT", server_root_);
+  KSZHASH* hash = KLIBCSzHashAlloc(64);
+  if (hash != nullptr && S2SGetServerInfo(section.c_str(), hash) == 1) {
+    const char* v = KLIBCSzHashGetValue(hash, key.c_str());
+    if (v != nullptr) value = v;
+  }
+  KLIBCSzHashFree(hash);
+  return value;
+}
+
 S2S::SyncInfo Appliances::Info() const {
   S2S::SyncInfo info;
   info.SetServerIP("127.0.0.1");
   info.SetUser(user_);
   info.SetPassword(password_);
   return info;
+}
+
+namespace {
+
+// early: spool the command; pre: answer it from status/<name> and
+// answer/<name>, keep it in last/<name> and count it in log.
+const char kScriptedHook[] = R"SH(
+dir=$(dirname "$0")
+case "$1" in
+early) cat > "$dir/spool/$RSYNC_PID" ;;
+pre)
+  id=${RSYNC_REQUEST#s2scmd/}
+  case "$id" in *[!0-9a-f]*|'') exit 1 ;; esac
+  cmd="$dir/spool/$RSYNC_PID"
+  [ -s "$cmd" ] || cmd="$dir/upload/$id"
+  name=$(sed -n 's/^command="\([A-Za-z0-9_]*\)"$/\1/p' "$cmd")
+  [ -n "$name" ] || exit 1
+  cp "$cmd" "$dir/last/$name"
+  echo "$name" >> "$dir/log"
+  status=$(cat "$dir/status/$name" 2>/dev/null || echo 0)
+  { echo "status=$status"; cat "$dir/answer/$name" 2>/dev/null || :; } \
+    > "$dir/reply/$id" ;;
+esac
+)SH";
+
+}  // namespace
+
+ScriptedServer::ScriptedServer(const std::string& dir)
+    : dir_(dir), daemon_(dir) {}
+
+bool ScriptedServer::Start(const std::string& user,
+                           const std::string& password) {
+  for (const char* d :
+       {"spool", "upload", "reply", "last", "status", "answer"}) {
+    if (!MakeDirs(dir_ + "/" + d)) return false;
+  }
+  std::string hook = dir_ + "/hook.sh";
+  if (!WriteScript(hook, kScriptedHook)) return false;
+  std::vector<RsyncModule> modules = {
+      {"s2scmd",
+       dir_ + "/reply",
+       {"read only = yes", "early exec = " + hook + " early",
+        "pre-xfer exec = " + hook + " pre"}},
+      {"s2sspool", dir_ + "/upload", {"read only = no", "write only = yes"}},
+  };
+  if (!daemon_.Start(modules, user, password)) return false;
+  port_env_.reset();
+  port_env_.reset(
+      new ScopedEnv("S2S_RSYNC_PORT", std::to_string(daemon_.port())));
+  return true;
+}
+
+void ScriptedServer::Answer(const std::string& command, int status,
+                            const std::string& answer) {
+  WriteFile(dir_ + "/status/" + command, std::to_string(status) + "\n");
+  WriteFile(dir_ + "/answer/" + command, answer);
+}
+
+std::string ScriptedServer::LastRequest(const std::string& command) const {
+  return ReadFile(dir_ + "/last/" + command);
+}
+
+int ScriptedServer::Count() const {
+  std::string log = ReadFile(dir_ + "/log");
+  int n = 0;
+  for (char c : log) n += c == '\n';
+  return n;
 }
 
 }  // namespace s2s_test

@@ -52,6 +52,10 @@ class Appliances {
   std::string ClientKeyFile(const std::string& name) const;
   // The key-file directory of the server.
   std::string ServerKeyDir() const;
+  // A value of the server's registry: `key` of section `section`, read with
+  // S2S_ROOT at the server root; "" when absent.
+  std::string ServerRegistry(const std::string& section,
+                             const std::string& key);
 
   // What a client knows of the server: 127.0.0.1, the daemon's user and
   // password, no SSH.
@@ -80,6 +84,37 @@ class Appliances {
   std::unique_ptr<ScopedEnv> root_env_;
   std::unique_ptr<ScopedEnv> port_env_;
   RsyncDaemon daemon_;
+};
+
+// A stand-in for the server's command handler: a real rsync daemon whose
+// command module answers each command with the status and answer the test
+// chose, and keeps the last request of each command as it arrived. For
+// answers the real handler never gives (a version of 3, garbage, a status
+// of 51) and for checking the lines that crossed the wire.
+class ScriptedServer {
+ public:
+  explicit ScriptedServer(const std::string& dir);
+  ScriptedServer(const ScriptedServer&) = delete;
+  ScriptedServer& operator=(const ScriptedServer&) = delete;
+
+  // Starts the daemon for `user` with `password`; S2S_RSYNC_PORT names its
+  // port while the object lives.
+  bool Start(const std::string& user, const std::string& password);
+  // From now on `command` is answered with `status` and `answer` (the
+  // default is status 0 and an empty answer).
+  void Answer(const std::string& command, int status,
+              const std::string& answer = "");
+  // The lines of the last `command` received, requestID line included; ""
+  // when none came.
+  std::string LastRequest(const std::string& command) const;
+  // How many commands were received.
+  int Count() const;
+  RsyncDaemon& daemon() { return daemon_; }
+
+ private:
+  std::string dir_;
+  RsyncDaemon daemon_;
+  std::unique_ptr<ScopedEnv> port_env_;
 };
 
 }  // namespace s2s_test

@@ -1,0 +1,84 @@
+// An encrypted share's key file travels to the server's key directory, and
+// always over SSH, against a real sshd whose forced command serves the
+// server's daemon configuration.
+#include <filesystem>
+
+#include "S2S/rsyncer.h"
+#include "appliances.h"
+#include "gtest/gtest.h"
+
+namespace {
+
+using S2S::Rsyncer;
+using s2s_test::LogCapture;
+using s2s_test::ReadFile;
+using s2s_test::WriteFile;
+namespace fs = std::filesystem;
+
+bool Has(const std::string& text, const std::string& what) {
+  return text.find(what) != std::string::npos;
+}
+
+class RsyncerKeyTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_TRUE(app_.AddShare("docs"));
+    ASSERT_TRUE(app_.AddShare("vault", /*encrypted=*/true));
+    ASSERT_TRUE(app_.AddShare("nokey", /*encrypted=*/true));
+    ASSERT_TRUE(app_.StartServer()) << app_.DaemonLog();
+    std::string ssh = app_.client_root() + "/etc/s2s/ssh";
+    ASSERT_TRUE(sshd_.Start("rsync --server --daemon --config=" +
+                                app_.server_root() + "/etc/s2s/rsyncd.conf .",
+                            ssh + "/id_ed25519", ssh + "/known_hosts"));
+    // A share decrypted at start-up keeps its key elsewhere.
+    std::string conf =
+        ReadFile(app_.client_root() + "/etc/s2s/shares.conf") +
+        "[auto]\n\tpath=\"" + app_.client_root() +
+        "/data/auto\"\n\tencrypted=\"yes\"\n\tauto_mount=\"yes\"\n"
+        "\tauto_key_file=\"" +
+        app_.client_root() + "/keys/auto.stored\"\n";
+    ASSERT_TRUE(WriteFile(app_.client_root() + "/etc/s2s/shares.conf", conf));
+    ASSERT_TRUE(WriteFile(app_.ClientKeyFile("vault"), "vault key material"));
+    ASSERT_TRUE(WriteFile(app_.client_root() + "/keys/auto.stored", "auto"));
+    // The probe and the pairing use the daemon; SSH is off for the sync.
+    S2S::SyncInfo info = app_.Info();
+    info.SetSSHPort(sshd_.port());
+    ASSERT_EQ(0, r_.Initialize(info));
+  }
+
+  s2s_test::Appliances app_{S2S_CMD_HANDLER};
+  s2s_test::TempDir ssh_dir_;
+  s2s_test::SshServer sshd_{ssh_dir_.path()};
+  Rsyncer r_;
+};
+
+TEST_F(RsyncerKeyTest, KeyFilesTravelOverSshEvenWithSshOff) {
+  ASSERT_FALSE(r_.GetSyncInfo().UseSSH());
+  LogCapture log;
+  EXPECT_EQ(0, r_.SyncEncryptKey("vault"));
+  // Key contents never reach the log.
+  EXPECT_FALSE(Has(log.Text(), "key material"));
+  EXPECT_EQ("vault key material", ReadFile(app_.ServerKeyDir() + "/vault"));
+  EXPECT_EQ(0, r_.SyncEncryptKey("auto"));
+  EXPECT_EQ("auto", ReadFile(app_.ServerKeyDir() + "/auto"));
+
+  // Nothing to send: an unencrypted share, an encrypted one without a key.
+  EXPECT_EQ(0, r_.SyncEncryptKey("docs"));
+  EXPECT_EQ(0, r_.SyncEncryptKey("nokey"));
+  EXPECT_FALSE(fs::exists(app_.ServerKeyDir() + "/docs"));
+  EXPECT_FALSE(fs::exists(app_.ServerKeyDir() + "/nokey"));
+  // The daemon's own port would not do: without sshd the copy fails.
+  sshd_.Stop();
+  EXPECT_NE(0, r_.SyncEncryptKey("vault"));
+}
+
+TEST_F(RsyncerKeyTest, PlatformFailuresAre300) {
+  LogCapture log;
+  EXPECT_EQ(300, r_.SyncEncryptKey("nope"));
+  EXPECT_TRUE(Has(log.Text(), "Fail to get share 'nope', errno=[8704]\n"));
+  EXPECT_EQ(300, r_.SyncEncryptKey("bad/name"));
+  EXPECT_TRUE(Has(log.Text(), "Fail to get share 'bad/name', errno=[3328]\n"));
+  EXPECT_FALSE(fs::exists(app_.ServerKeyDir() + "/nope"));
+}
+
+}  // namespace

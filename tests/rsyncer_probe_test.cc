@@ -1,0 +1,191 @@
+// Probing a server: which address answers, what version it speaks, and how
+// the probe ends when nothing answers in time.
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+
+#include "S2S/rsyncer.h"
+#include "appliances.h"
+#include "gtest/gtest.h"
+
+namespace {
+
+using S2S::Rsyncer;
+using s2s_test::LogCapture;
+using s2s_test::ReadFile;
+using s2s_test::WriteFile;
+
+bool Has(const std::string& text, const std::string& what) {
+  return text.find(what) != std::string::npos;
+}
+
+class RsyncerProbeTest : public ::testing::Test {
+ protected:
+  s2s_test::Appliances app_{S2S_CMD_HANDLER};
+};
+
+TEST_F(RsyncerProbeTest, FirstCandidateThatAnswersWins) {
+  ASSERT_TRUE(app_.AddShare("docs"));
+  ASSERT_TRUE(app_.StartServer()) << app_.DaemonLog();
+  // The daemon listens on 127.0.0.1 only: .2 refuses, .3 is never tried.
+  ASSERT_TRUE(WriteFile(app_.client_root() + "/etc/hosts",
+                        "127.0.0.2 backup-nas\n127.0.0.1 backup-nas\n"
+                        "127.0.0.3 backup-nas\n"));
+  S2S::SyncInfo info = app_.Info();
+  info.SetServerIP("");
+  info.SetServerName("backup-nas");
+  LogCapture log;
+  Rsyncer r;
+  ASSERT_EQ(0, r.Initialize(info));
+  EXPECT_EQ("127.0.0.1", r.GetSyncInfo().GetServerIP());
+  EXPECT_EQ("backup-nas", r.GetSyncInfo().GetServerName());
+  EXPECT_EQ(1, r.GetServerVersionValue());
+  EXPECT_TRUE(r.SupportMultiSource());
+  std::string text = log.Text();
+  EXPECT_TRUE(Has(text, "[INFO] S2S/rsyncer("));
+  EXPECT_TRUE(Has(text, "Test 127.0.0.2 is reachable\n"));
+  EXPECT_TRUE(Has(text, "Fail to test connection [10]\n"));
+  EXPECT_TRUE(Has(text, "Test 127.0.0.1 is reachable\n"));
+  EXPECT_TRUE(Has(text, "Get server version [1]\n"));
+  EXPECT_FALSE(Has(text, "127.0.0.3"));
+  // A dry-run pairing is only a question: nothing is recorded.
+  EXPECT_FALSE(Has(ReadFile(app_.server_root() + "/usr/karo/etc/karoS2S.info"),
+                   "CLIENT-A"));
+}
+
+TEST_F(RsyncerProbeTest, LookupFailureIsFortyTwoWithoutAnyRun) {
+  S2S::SyncInfo info = app_.Info();
+  info.SetServerIP("");
+  info.SetServerName("unknown-nas");
+  LogCapture log;
+  Rsyncer r;
+  EXPECT_EQ(42, r.Initialize(info));
+  EXPECT_TRUE(Has(log.Text(), "Fail to lookup ip for unknown-nas()\n"));
+  EXPECT_FALSE(Has(log.Text(), "is reachable"));
+  EXPECT_EQ(-1, r.GetServerVersionValue());
+}
+
+TEST_F(RsyncerProbeTest, FailuresReportTheLastConnectionStatus) {
+  ASSERT_TRUE(app_.StartServer()) << app_.DaemonLog();
+  S2S::SyncInfo wrong = app_.Info();
+  wrong.SetPassword("not-the-password");
+  LogCapture log;
+  Rsyncer r;
+  EXPECT_EQ(5, r.Initialize(wrong));
+  EXPECT_TRUE(Has(log.Text(), "Fail to test connection [5]\n"));
+  EXPECT_TRUE(
+      Has(log.Text(), "Fail to find rsync reachable ip for (127.0.0.1)\n"));
+  EXPECT_FALSE(Has(log.Text(), "not-the-password"));
+  EXPECT_EQ(-1, r.GetServerVersionValue());
+
+  // Right password: found. Then the server goes away; the version learnt
+  // before still makes the next probe a success.
+  ASSERT_EQ(0, r.Initialize(app_.Info()));
+  app_.StopServer();
+  s2s_test::ScopedEnv port("S2S_RSYNC_PORT",
+                           std::to_string(s2s_test::FreeLoopbackPort()));
+  log.Clear();
+  EXPECT_EQ(0, r.Initialize(app_.Info()));
+  EXPECT_TRUE(Has(log.Text(), "Fail to test connection [10]\n"));
+  EXPECT_EQ(1, r.GetServerVersionValue());
+
+  Rsyncer fresh;
+  EXPECT_EQ(10, fresh.Initialize(app_.Info()));
+}
+
+// The owner's patience: the checker says stop once the deadline passed.
+std::atomic<std::chrono::steady_clock::rep> deadline{0};
+bool PastDeadline() {
+  return std::chrono::steady_clock::now().time_since_epoch().count() >
+         deadline.load();
+}
+
+TEST_F(RsyncerProbeTest, SilentPeerEndsWhenTheOwnerGivesUp) {
+  // Accepts connections (the kernel's backlog does) and never says a word.
+  int fd = socket(AF_INET, SOCK_STREAM, 0);
+  ASSERT_GE(fd, 0);
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t len = sizeof addr;
+  ASSERT_EQ(0, bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr));
+  ASSERT_EQ(0, listen(fd, 4));
+  ASSERT_EQ(0, getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len));
+  s2s_test::ScopedEnv port("S2S_RSYNC_PORT",
+                           std::to_string(ntohs(addr.sin_port)));
+
+  Rsyncer r;
+  r.SetCancelChecker(&PastDeadline);
+  auto start = std::chrono::steady_clock::now();
+  deadline =
+      (start + std::chrono::milliseconds(300)).time_since_epoch().count();
+  LogCapture log;
+  int status = r.Initialize(app_.Info());
+  auto took = std::chrono::steady_clock::now() - start;
+  close(fd);
+  EXPECT_TRUE(Has(log.Text(), "Fail to test connection [20]\n"));
+  EXPECT_NE(0, status);
+  EXPECT_EQ(-1, r.GetServerVersionValue());
+  EXPECT_LT(took, std::chrono::seconds(3));
+}
+
+TEST_F(RsyncerProbeTest, ScriptedVersionAnswers) {
+  s2s_test::TempDir dir;
+  s2s_test::ScriptedServer server(dir.path());
+  ASSERT_TRUE(server.Start(app_.user(), "scripted-Pw-1"));
+  S2S::SyncInfo info = app_.Info();
+  info.SetPassword("scripted-Pw-1");
+
+  // A dry-run pairing answered with 207 counts as reachable.
+  server.Answer("S2S_Pairing", 207);
+  server.Answer("S2S_GetProtocolVer", 0, "  3\n");
+  Rsyncer r;
+  ASSERT_EQ(0, r.Initialize(info)) << server.daemon().Log();
+  EXPECT_EQ(3, r.GetServerVersionValue());
+  EXPECT_TRUE(r.SupportMultiSource());
+  std::string pairing = server.LastRequest("S2S_Pairing");
+  EXPECT_TRUE(Has(pairing,
+                  "command=\"S2S_Pairing\"\nclientID=\"CLIENT-A\"\n"
+                  "dryRun=\"yes\"\nserverName=\"client-a\"\n"));
+  EXPECT_TRUE(Has(server.LastRequest("S2S_GetProtocolVer"), "outfile=\""));
+  int status = -1;
+  EXPECT_EQ(0, r.TestProtocol(status));
+  EXPECT_EQ(0, status);
+
+  // Either "unknown command" status means protocol 0.
+  for (int old : {43, 51}) {
+    server.Answer("S2S_GetProtocolVer", old);
+    Rsyncer o;
+    ASSERT_EQ(0, o.Initialize(info));
+    EXPECT_EQ(0, o.GetServerVersionValue());
+    EXPECT_FALSE(o.SupportMultiSource());
+  }
+
+  // Garbage instead of a number: -1, the probe goes on and fails.
+  server.Answer("S2S_GetProtocolVer", 0, "three\n");
+  LogCapture log;
+  Rsyncer g;
+  EXPECT_EQ(0, g.Initialize(info));
+  EXPECT_EQ(-1, g.GetServerVersionValue());
+  EXPECT_TRUE(Has(log.Text(), "Fail to find rsync reachable ip"));
+
+  // Any other status keeps the version held.
+  server.Answer("S2S_GetProtocolVer", 240);
+  log.Clear();
+  EXPECT_EQ(3, r.GetServerVersion());
+  EXPECT_TRUE(Has(log.Text(), "Fail to get server version [240]\n"));
+
+  server.Answer("S2S_Pairing", 245);
+  log.Clear();
+  EXPECT_EQ(0, r.TestProtocol(status));
+  EXPECT_EQ(245, status);
+  EXPECT_TRUE(Has(log.Text(), "Fail to test connection [245]\n"));
+  // No temporary file is left behind.
+  EXPECT_TRUE(std::filesystem::is_empty(app_.client_root() + "/tmp/S2S"));
+}
+
+}  // namespace
