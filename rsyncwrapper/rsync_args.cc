@@ -122,7 +122,8 @@ std::string RemoteSpec(const RsyncSettings& s, const std::string& module,
 }
 
 std::vector<std::string> DataTransferArgs(const RsyncSettings& s) {
-  std::vector<std::string> args = {"rsync", "-a"};
+  // -H: a share's hard links stay links on the server, not copies.
+  std::vector<std::string> args = {"rsync", "-a", "-H"};
   if (s.del) args.push_back("--delete");
   if (s.numeric_ids) args.push_back("--numeric-ids");
   if (!s.pseudo_root) {

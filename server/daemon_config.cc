@@ -79,8 +79,15 @@ std::string ShareModule(const std::string& name, const std::string& hook,
     return "";
   }
   std::string module = encrypted ? "@" + name + "@" : name;
+  // A share keeps its symbolic links as they are. A daemon started by root
+  // chroots into the share, which confines the links without rewriting
+  // them; otherwise the daemon stores their targets kept inside the share
+  // (a leading "/" or escaping "../" dropped) rather than disguised under a
+  // prefix that makes every link unusable on this side.
+  std::string links =
+      geteuid() == 0 ? "\tuse chroot = yes\n" : "\tmunge symlinks = no\n";
   return "[" + module + "]\n\tpath = " + path +
-         "\n\tread only = no\n\tlist = no\n" + auth +
+         "\n\tread only = no\n\tlist = no\n" + links + auth +
          "\tpre-xfer exec = " + hook + " data\n";
 }
 

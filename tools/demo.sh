@@ -57,8 +57,8 @@ for share in docs photos projects; do
 	volume="$client/volume1"
 CONF
 done
-# Sample data: small trees with text, binary data and an empty directory.
-# No symbolic links: the server's daemon stores them munged (tools/README.md).
+# Sample data: small trees with text, binary data, an empty directory, a
+# symbolic link and a hard link.
 d=$client/volume1
 mkdir -p "$d/docs/reports/2026" "$d/docs/empty" "$d/photos/trip" \
   "$d/projects/s2s/src" "$d/projects/s2s/doc"
@@ -69,6 +69,8 @@ for i in 1 2 3 4 5; do
 done
 echo "Read me first." >"$d/docs/README"
 echo "design notes" >"$d/projects/s2s/doc/notes.md"
+ln -s reports/2026/q5.txt "$d/docs/latest-report"
+ln "$d/docs/README" "$d/docs/README.txt"
 echo "client shares:"
 for share in docs photos projects; do
   printf '  %-9s %3d files, %s\n' "$share" \

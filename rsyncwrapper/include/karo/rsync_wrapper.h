@@ -9,7 +9,7 @@
 // status.
 //
 // Switches and the rsync options they become (a data transfer always runs
-// with -a, --timeout, and --contimeout/--sockopts=TCP_NODELAY on a daemon
+// with -a -H, --timeout, and --contimeout/--sockopts=TCP_NODELAY on a daemon
 // socket):
 //   setDelete(true)          --delete
 //   setNumericIds(true)      --numeric-ids
