@@ -46,9 +46,10 @@ struct Server {
   }
 };
 
+// Destroyed at exit, which stops the daemon and removes its tree.
 Server& TheServer() {
-  static Server* server = new Server;
-  return *server;
+  static Server server;
+  return server;
 }
 
 void BM_CommandRoundTrip(benchmark::State& state) {
