@@ -10,7 +10,7 @@
 #include "client_options.h"
 #include "gtest/gtest.h"
 #include "secret.h"
-#include "task_spec.h"
+#include "task_file.h"
 #include "testutil.h"
 
 namespace {

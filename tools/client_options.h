@@ -4,7 +4,7 @@
 
 #include <string>
 
-#include "task_spec.h"
+#include "task_file.h"
 
 namespace s2s_tools {
 

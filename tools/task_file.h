@@ -20,8 +20,8 @@
 //   	ssh_port="22"
 //
 // A "password" key is refused: passwords live in private files only.
-#ifndef S2S_TOOLS_TASK_SPEC_H_
-#define S2S_TOOLS_TASK_SPEC_H_
+#ifndef S2S_TOOLS_TASK_FILE_H_
+#define S2S_TOOLS_TASK_FILE_H_
 
 #include <list>
 #include <string>
@@ -68,4 +68,4 @@ S2S::SyncTask MakeSyncTask(const TaskSpec& spec, const std::string& password);
 
 }  // namespace s2s_tools
 
-#endif  // S2S_TOOLS_TASK_SPEC_H_
+#endif  // S2S_TOOLS_TASK_FILE_H_

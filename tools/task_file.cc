@@ -1,4 +1,4 @@
-#include "task_spec.h"
+#include "task_file.h"
 
 #include <strings.h>
 
