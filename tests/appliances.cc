@@ -127,22 +127,20 @@ void Appliances::Enter(const std::string& root) {
   root_env_.reset(new ScopedEnv("S2S_ROOT", root));
 }
 
-std::string Appliances::ClientShare(const std::string& name) const {
+std::string Appliances::ShareDir(const std::string& root,
+                                 const std::string& name) const {
   for (const Share& s : shares_) {
-    if (s.name == name && s.encrypted) {
-      return client_root_ + "/data/@" + name + "@";
-    }
+    if (s.name == name && s.encrypted) return root + "/data/@" + name + "@";
   }
-  return client_root_ + "/data/" + name;
+  return root + "/data/" + name;
+}
+
+std::string Appliances::ClientShare(const std::string& name) const {
+  return ShareDir(client_root_, name);
 }
 
 std::string Appliances::ServerShare(const std::string& name) const {
-  for (const Share& s : shares_) {
-    if (s.name == name && s.encrypted) {
-      return server_root_ + "/data/@" + name + "@";
-    }
-  }
-  return server_root_ + "/data/" + name;
+  return ShareDir(server_root_, name);
 }
 
 std::string Appliances::ClientKeyFile(const std::string& name) const {
@@ -202,8 +200,8 @@ esac
 ScriptedServer::ScriptedServer(const std::string& dir)
     : dir_(dir), daemon_(dir) {}
 
-bool ScriptedServer::Start(const std::string& user,
-                           const std::string& password) {
+bool ScriptedServer::Start(const std::string& user, const std::string& password,
+                           const std::vector<RsyncModule>& more) {
   for (const char* d :
        {"spool", "upload", "reply", "last", "status", "answer"}) {
     if (!MakeDirs(dir_ + "/" + d)) return false;
@@ -217,6 +215,7 @@ bool ScriptedServer::Start(const std::string& user,
         "pre-xfer exec = " + hook + " pre"}},
       {"s2sspool", dir_ + "/upload", {"read only = no", "write only = yes"}},
   };
+  modules.insert(modules.end(), more.begin(), more.end());
   if (!daemon_.Start(modules, user, password)) return false;
   port_env_.reset();
   port_env_.reset(

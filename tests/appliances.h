@@ -72,6 +72,7 @@ class Appliances {
   bool WriteClient(const std::string& root, const std::string& serial,
                    const std::string& hostname);
   std::string ShareConf(const std::string& root) const;
+  std::string ShareDir(const std::string& root, const std::string& name) const;
 
   TempDir dir_;
   std::string client_root_;
@@ -97,9 +98,10 @@ class ScriptedServer {
   ScriptedServer(const ScriptedServer&) = delete;
   ScriptedServer& operator=(const ScriptedServer&) = delete;
 
-  // Starts the daemon for `user` with `password`; S2S_RSYNC_PORT names its
-  // port while the object lives.
-  bool Start(const std::string& user, const std::string& password);
+  // Starts the daemon for `user` with `password`, with `more` modules beside
+  // the command ones; S2S_RSYNC_PORT names its port while the object lives.
+  bool Start(const std::string& user, const std::string& password,
+             const std::vector<RsyncModule>& more = {});
   // From now on `command` is answered with `status` and `answer` (the
   // default is status 0 and an empty answer).
   void Answer(const std::string& command, int status,

@@ -16,6 +16,7 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <mutex>
 #include <sstream>
 
@@ -35,16 +36,83 @@ std::mutex syslog_mutex;
 std::vector<std::string> syslog_messages;
 std::vector<int> syslog_priorities;
 
-bool Accepts(int port) {
-  int fd = socket(AF_INET, SOCK_STREAM, 0);
-  if (fd < 0) return false;
+sockaddr_in LoopbackAddr(int port) {
   sockaddr_in addr{};
   addr.sin_family = AF_INET;
   addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
   addr.sin_port = htons(static_cast<uint16_t>(port));
-  bool ok = connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
-  close(fd);
-  return ok;
+  return addr;
+}
+
+// A new socket connected to 127.0.0.1:`port`, or -1.
+int Connect(int port) {
+  int fd = socket(AF_INET, SOCK_STREAM, 0);
+  sockaddr_in addr = LoopbackAddr(port);
+  if (fd >= 0 &&
+      connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
+    close(fd);
+    fd = -1;
+  }
+  return fd;
+}
+
+bool Accepts(int port) {
+  int fd = Connect(port);
+  if (fd >= 0) close(fd);
+  return fd >= 0;
+}
+
+// SIGTERM to a child this process started, then waits for it.
+void StopChild(pid_t* pid) {
+  if (*pid <= 0) return;
+  kill(*pid, SIGTERM);
+  waitpid(*pid, nullptr, 0);
+  *pid = -1;
+}
+
+// Starts `args` (looked up in PATH, no shell) with standard input `in` and
+// standard output and error `out` (-1: inherited); its pid, or -1.
+pid_t Exec(std::vector<std::string> args, int in, int out) {
+  pid_t pid = fork();
+  if (pid != 0) return pid;
+  if (in >= 0) dup2(in, 0);
+  if (out >= 0) {
+    dup2(out, 1);
+    dup2(out, 2);
+  }
+  std::vector<char*> argv;
+  for (std::string& a : args) argv.push_back(&a[0]);
+  argv.push_back(nullptr);
+  execvp(argv[0], argv.data());
+  _exit(127);
+}
+
+// Starts the program that `argv_for` gives for a free port, with its output
+// appended to `log`, and waits until it accepts on that port. Retries on other
+// ports, since a port found free may be taken before the program binds it.
+// The program's pid (and the port in `port`), or -1.
+pid_t SpawnListening(
+    const std::function<std::vector<std::string>(int)>& argv_for,
+    const std::string& log, int* port) {
+  for (int attempt = 0; attempt < 5; ++attempt) {
+    *port = FreeLoopbackPort();
+    std::vector<std::string> args = argv_for(*port);
+    if (args.empty()) return -1;
+    int fd = open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
+    pid_t pid = Exec(args, -1, fd);
+    if (fd >= 0) close(fd);
+    if (pid < 0) return -1;
+    for (int waited = 0; waited < 5000; waited += 5) {
+      if (Accepts(*port)) return pid;
+      if (waitpid(pid, nullptr, WNOHANG) == pid) break;
+      timespec ts = {0, 5 * 1000 * 1000};
+      nanosleep(&ts, nullptr);
+    }
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+  }
+  *port = -1;
+  return -1;
 }
 
 void RecordSyslog(int priority, const char* format, va_list ap) {
@@ -158,31 +226,29 @@ bool UnixSocketPair(int fds[2]) {
 }
 
 bool TcpSocketPair(int fds[2]) {
-  int lfd = socket(AF_INET, SOCK_STREAM, 0);
+  int port = 0;
+  int lfd = LoopbackListener(&port);
   if (lfd < 0) return false;
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t len = sizeof addr;
-  bool ok = bind(lfd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0 &&
-            listen(lfd, 1) == 0 &&
-            getsockname(lfd, reinterpret_cast<sockaddr*>(&addr), &len) == 0;
-  fds[0] = fds[1] = -1;
-  if (ok) {
-    fds[0] = socket(AF_INET, SOCK_STREAM, 0);
-    ok = fds[0] >= 0 &&
-         connect(fds[0], reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
-  }
-  if (ok) {
-    fds[1] = accept(lfd, nullptr, nullptr);
-    ok = fds[1] >= 0;
-  }
+  fds[0] = Connect(port);
+  fds[1] = fds[0] >= 0 ? accept(lfd, nullptr, nullptr) : -1;
   close(lfd);
-  if (!ok) {
-    if (fds[0] >= 0) close(fds[0]);
-    if (fds[1] >= 0) close(fds[1]);
+  if (fds[1] < 0 && fds[0] >= 0) close(fds[0]);
+  return fds[1] >= 0;
+}
+
+int LoopbackListener(int* port) {
+  int fd = socket(AF_INET, SOCK_STREAM, 0);
+  if (fd < 0) return -1;
+  sockaddr_in addr = LoopbackAddr(*port);
+  socklen_t len = sizeof addr;
+  if (bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0 ||
+      listen(fd, 8) != 0 ||
+      getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) != 0) {
+    close(fd);
+    return -1;
   }
-  return ok;
+  *port = ntohs(addr.sin_port);
+  return fd;
 }
 
 std::string ReadFile(const std::string& path) {
@@ -200,18 +266,9 @@ bool WriteFile(const std::string& path, const std::string& data) {
 }
 
 int FreeLoopbackPort() {
-  int fd = socket(AF_INET, SOCK_STREAM, 0);
+  int port = 0;
+  int fd = LoopbackListener(&port);
   if (fd < 0) return -1;
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  addr.sin_port = 0;
-  socklen_t len = sizeof addr;
-  int port = -1;
-  if (bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0 &&
-      getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) == 0) {
-    port = ntohs(addr.sin_port);
-  }
   close(fd);
   return port;
 }
@@ -242,46 +299,22 @@ bool RsyncDaemon::Start(const std::vector<RsyncModule>& modules,
 bool RsyncDaemon::StartWithConfig(const std::string& conf) {
   Stop();
   std::string log = dir_ + "/rsyncd.log";
-  // The free port may be taken between the probe and the daemon's bind.
-  for (int attempt = 0; attempt < 5; ++attempt) {
-    int port = FreeLoopbackPort();
-    std::string port_arg = "--port=" + std::to_string(port);
-    std::string conf_arg = "--config=" + conf;
-    std::string log_arg = "--log-file=" + log;
-    pid_t pid = fork();
-    if (pid < 0) return false;
-    if (pid == 0) {
-      int fd = open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0600);
-      if (fd >= 0) {
-        dup2(fd, 1);
-        dup2(fd, 2);
-      }
-      execlp("rsync", "rsync", "--daemon", "--no-detach", "--address=127.0.0.1",
-             port_arg.c_str(), conf_arg.c_str(), log_arg.c_str(),
-             static_cast<char*>(nullptr));
-      _exit(127);
-    }
-    for (int waited = 0; waited < 5000; waited += 5) {
-      if (Accepts(port)) {
-        pid_ = pid;
-        port_ = port;
-        return true;
-      }
-      if (waitpid(pid, nullptr, WNOHANG) == pid) break;
-      timespec ts = {0, 5 * 1000 * 1000};
-      nanosleep(&ts, nullptr);
-    }
-    kill(pid, SIGKILL);
-    waitpid(pid, nullptr, 0);
-  }
-  return false;
+  pid_ = SpawnListening(
+      [&](int port) -> std::vector<std::string> {
+        return {"rsync",
+                "--daemon",
+                "--no-detach",
+                "--address=127.0.0.1",
+                "--port=" + std::to_string(port),
+                "--config=" + conf,
+                "--log-file=" + log};
+      },
+      log, &port_);
+  return pid_ > 0;
 }
 
 void RsyncDaemon::Stop() {
-  if (pid_ <= 0) return;
-  kill(pid_, SIGTERM);
-  waitpid(pid_, nullptr, 0);
-  pid_ = -1;
+  StopChild(&pid_);
   port_ = -1;
 }
 
@@ -313,23 +346,12 @@ ScopedTZ::~ScopedTZ() {
 }
 
 bool RunQuiet(const std::vector<std::string>& args) {
-  pid_t pid = fork();
-  if (pid < 0) return false;
-  if (pid == 0) {
-    int fd = open("/dev/null", O_RDWR);
-    dup2(fd, 0);
-    dup2(fd, 1);
-    dup2(fd, 2);
-    std::vector<char*> argv;
-    for (const std::string& a : args)
-      argv.push_back(const_cast<char*>(a.c_str()));
-    argv.push_back(nullptr);
-    execvp(argv[0], argv.data());
-    _exit(127);
-  }
+  int fd = open("/dev/null", O_RDWR | O_CLOEXEC);
+  pid_t pid = Exec(args, fd, fd);
+  close(fd);
   int status = 0;
-  waitpid(pid, &status, 0);
-  return WIFEXITED(status) && WEXITSTATUS(status) == 0;
+  return pid > 0 && waitpid(pid, &status, 0) == pid && WIFEXITED(status) &&
+         WEXITSTATUS(status) == 0;
 }
 
 PipedProcess::~PipedProcess() { Stop(); }
@@ -337,25 +359,13 @@ PipedProcess::~PipedProcess() { Stop(); }
 bool PipedProcess::Start(std::vector<std::string> args) {
   Stop();
   int in[2], out[2];
-  if (pipe(in) != 0) return false;
-  if (pipe(out) != 0) {
+  if (pipe2(in, O_CLOEXEC) != 0) return false;
+  if (pipe2(out, O_CLOEXEC) != 0) {
     close(in[0]);
     close(in[1]);
     return false;
   }
-  pid_ = fork();
-  if (pid_ == 0) {
-    dup2(in[0], 0);
-    dup2(out[1], 1);
-    dup2(out[1], 2);
-    close(in[1]);
-    close(out[0]);
-    std::vector<char*> argv;
-    for (std::string& a : args) argv.push_back(&a[0]);
-    argv.push_back(nullptr);
-    execvp(argv[0], argv.data());
-    _exit(127);
-  }
+  pid_ = Exec(args, in[0], out[1]);
   close(in[0]);
   close(out[1]);
   in_ = in[1];
@@ -387,11 +397,7 @@ bool PipedProcess::Send(const std::string& data) {
 }
 
 void PipedProcess::Stop() {
-  if (pid_ > 0) {
-    kill(pid_, SIGTERM);
-    waitpid(pid_, nullptr, 0);
-    pid_ = -1;
-  }
+  StopChild(&pid_);
   if (in_ >= 0) close(in_);
   if (out_ >= 0) close(out_);
   in_ = out_ = -1;
@@ -421,46 +427,28 @@ bool SshServer::Start(const std::string& forced_command,
   }
   // sshd insists on its privilege separation directory.
   mkdir("/run/sshd", 0755);
-  for (int attempt = 0; attempt < 5; ++attempt) {
-    int port = FreeLoopbackPort();
-    std::string conf = dir_ + "/sshd_config";
-    WriteFile(conf, "Port " + std::to_string(port) +
-                        "\nListenAddress 127.0.0.1\nHostKey " + host_key +
-                        "\nAuthorizedKeysFile " + authorized +
-                        "\nStrictModes no\nUsePAM no\nPasswordAuthentication no"
-                        "\nKbdInteractiveAuthentication no"
-                        "\nPermitRootLogin prohibit-password\nPidFile none\n");
-    std::string log = dir_ + "/sshd.log";
-    pid_t pid = fork();
-    if (pid < 0) return false;
-    if (pid == 0) {
-      execl("/usr/sbin/sshd", "/usr/sbin/sshd", "-D", "-f", conf.c_str(), "-E",
-            log.c_str(), static_cast<char*>(nullptr));
-      _exit(127);
-    }
-    for (int waited = 0; waited < 5000; waited += 5) {
-      if (Accepts(port)) {
-        pid_ = pid;
-        port_ = port;
-        std::string pub = ReadFile(host_key + ".pub");
-        return WriteFile(known_hosts,
-                         "[127.0.0.1]:" + std::to_string(port) + " " + pub);
-      }
-      if (waitpid(pid, nullptr, WNOHANG) == pid) break;
-      timespec ts = {0, 5 * 1000 * 1000};
-      nanosleep(&ts, nullptr);
-    }
-    kill(pid, SIGKILL);
-    waitpid(pid, nullptr, 0);
-  }
-  return false;
+  std::string conf = dir_ + "/sshd_config";
+  pid_ = SpawnListening(
+      [&](int port) -> std::vector<std::string> {
+        if (!WriteFile(conf, "Port " + std::to_string(port) +
+                                 "\nListenAddress 127.0.0.1\nHostKey " +
+                                 host_key + "\nAuthorizedKeysFile " +
+                                 authorized +
+                                 "\nStrictModes no\nUsePAM no"
+                                 "\nPasswordAuthentication no"
+                                 "\nKbdInteractiveAuthentication no"
+                                 "\nPermitRootLogin prohibit-password"
+                                 "\nPidFile none\n")) {
+          return {};
+        }
+        return {"/usr/sbin/sshd", "-D", "-f", conf, "-E", dir_ + "/sshd.log"};
+      },
+      "/dev/null", &port_);
+  return pid_ > 0 &&
+         WriteFile(known_hosts, "[127.0.0.1]:" + std::to_string(port_) + " " +
+                                    ReadFile(host_key + ".pub"));
 }
 
-void SshServer::Stop() {
-  if (pid_ <= 0) return;
-  kill(pid_, SIGTERM);
-  waitpid(pid_, nullptr, 0);
-  pid_ = -1;
-}
+void SshServer::Stop() { StopChild(&pid_); }
 
 }  // namespace s2s_test

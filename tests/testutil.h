@@ -82,6 +82,10 @@ std::string ReadFile(const std::string& path);
 bool WriteFile(const std::string& path, const std::string& data);
 // A TCP port on 127.0.0.1 that was free a moment ago.
 int FreeLoopbackPort();
+// A socket listening on 127.0.0.1 at *port (0: any free port, which is then
+// stored there); -1 on failure. The kernel completes connections to it
+// whether or not they are accepted.
+int LoopbackListener(int* port);
 
 // One module of a test daemon: name, directory, and further rsyncd.conf
 // lines ("key = value") for it.
