@@ -1,9 +1,6 @@
 #include "S2S/ipc.h"
 
-#include <arpa/inet.h>
 #include <gtest/gtest.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
 #include <unistd.h>
 
 #include <thread>
@@ -19,13 +16,6 @@ using s2s_test::LogCapture;
 using s2s_test::TempDir;
 
 bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
-
-timeval Seconds(int s) {
-  timeval tv;
-  tv.tv_sec = s;
-  tv.tv_usec = 0;
-  return tv;
-}
 
 // Serves `clients` connections one after another: each request map comes
 // back with "echo" set to its "n" plus one.
@@ -128,7 +118,7 @@ TEST(IPCTest, RefusedPathsAndIdleListener) {
   EXPECT_EQ(sender.assign(-1), -1);
 
   ASSERT_EQ(listener.prepare(dir.Sub("idle.sock")), 0);
-  listener.setTimeout(Seconds(0));
+  listener.setTimeout(timeval{0, 0});
   EXPECT_EQ(listener.isReady(), 0);
 }
 

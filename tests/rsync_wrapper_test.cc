@@ -6,8 +6,6 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -16,8 +14,8 @@
 #include <mutex>
 #include <thread>
 
+#include "appliances.h"
 #include "gtest/gtest.h"
-#include "testutil.h"
 
 namespace {
 
@@ -37,52 +35,19 @@ void CaptureLog(int, const char* message) {
   log_text += "\n";
 }
 
-// Early exec spools the command, pre-xfer answers "status=<N>" (N from the
-// command's own `status="N"` line) followed by the command as received.
-const char kHook[] = R"SH(#!/bin/sh
-dir=$(dirname "$0")
-case "$1" in
-early) cat > "$dir/spool/$RSYNC_PID" ;;
-pre)
-  id=${RSYNC_REQUEST#s2scmd/}
-  case "$id" in *[!0-9a-f]*|'') exit 1 ;; esac
-  cmd="$dir/spool/$RSYNC_PID"
-  [ -s "$cmd" ] || cmd="$dir/upload/$id"
-  n=$(sed -n 's/^status="\([0-9]*\)"$/\1/p' "$cmd")
-  { echo "status=${n:-0}"; cat "$cmd"; } > "$dir/reply/$id" ;;
-esac
-)SH";
-
 class RsyncWrapperTest : public ::testing::Test {
  protected:
   void SetUp() override {
     RsyncWrapper::setLogHandler(&CaptureLog);
     log_text.clear();
-    for (const char* d : {"spool", "upload", "reply", "data", "src", "root"}) {
+    for (const char* d : {"data", "src", "root"}) {
       mkdir(tmp_.Sub(d).c_str(), 0700);
     }
-    std::string hook = tmp_.Sub("hook.sh");
-    ASSERT_TRUE(WriteFile(hook, kHook));
-    chmod(hook.c_str(), 0700);
-    std::vector<s2s_test::RsyncModule> modules = {
-        {"s2scmd",
-         tmp_.Sub("reply"),
-         {"read only = yes", "early exec = " + hook + " early",
-          "pre-xfer exec = " + hook + " pre"}},
-        {"s2sspool",
-         tmp_.Sub("upload"),
-         {"read only = no", "write only = yes"}},
-        {"share", tmp_.Sub("data"), {"read only = no"}},
-    };
-    ASSERT_TRUE(daemon_.Start(modules, kUser, kPassword)) << daemon_.Log();
+    ASSERT_TRUE(server_.Start(
+        kUser, kPassword, {{"share", tmp_.Sub("data"), {"read only = no"}}}))
+        << server_.daemon().Log();
   }
   void TearDown() override { RsyncWrapper::setLogHandler(nullptr); }
-
-  // Points the wrapper at the test daemon.
-  s2s_test::ScopedEnv PortEnv() {
-    return s2s_test::ScopedEnv("S2S_RSYNC_PORT",
-                               std::to_string(daemon_.port()));
-  }
 
   void Configure(RsyncWrapper& w, const std::string& module,
                  const std::string& password = kPassword) {
@@ -93,50 +58,42 @@ class RsyncWrapperTest : public ::testing::Test {
 
   s2s_test::TempDir tmp_;
   s2s_test::ScopedEnv root_{"S2S_ROOT", tmp_.Sub("root")};
-  s2s_test::RsyncDaemon daemon_{tmp_.path()};
+  // The command modules, and a data module "share".
+  s2s_test::ScriptedServer server_{tmp_.Sub("server")};
 };
 
 TEST_F(RsyncWrapperTest, CommandReturnsServerStatusAndWritesAnswer) {
-  auto port = PortEnv();
   std::string out = tmp_.Sub("answer");
+  server_.Answer("S2S_PairingMultiSrc", 214, "conflicts=\"docs\"\n");
   RsyncWrapper w;
   Configure(w, "");
   w.setDebugLog(true);
-  w.setKaroCustCmdRule({"command=\"S2S_PairingMultiSrc\"", "status=\"214\"",
+  w.setKaroCustCmdRule({"command=\"S2S_PairingMultiSrc\"", "dryRun=\"no\"",
                         "outfile=\"" + out + "\""});
   EXPECT_EQ(214, w.execute(boost::function<bool()>()));
-  std::string answer = ReadFile(out);
-  EXPECT_EQ(0u,
-            answer.find("command=\"S2S_PairingMultiSrc\"\nstatus=\"214\"\n"))
-      << answer;
-  EXPECT_NE(std::string::npos, answer.find("requestID=\""));
+  EXPECT_EQ("conflicts=\"docs\"\n", ReadFile(out));
+  std::string request = server_.LastRequest("S2S_PairingMultiSrc");
+  EXPECT_EQ(0u, request.find("command=\"S2S_PairingMultiSrc\"\ndryRun=\"no\"\n"
+                             "outfile=\"" +
+                             out + "\"\nrequestID=\""))
+      << request;
   EXPECT_EQ(std::string::npos, log_text.find(kPassword));
   // Nothing of the exchange stays behind in the temporary directory.
-  std::filesystem::path scratch = tmp_.Sub("root") + "/tmp/S2S";
-  EXPECT_TRUE(std::filesystem::is_empty(scratch));
-}
+  EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("root") + "/tmp/S2S"));
 
-TEST_F(RsyncWrapperTest, CommandTooLargeForEarlyInputTravelsInTwoConnections) {
-  auto port = PortEnv();
-  std::string out = tmp_.Sub("answer");
+  // Too large to travel with the request: spooled in a connection of its own.
   std::string big(6000, 'x');
-  RsyncWrapper w;
-  Configure(w, "");
-  w.setKaroCustCmdRule({"command=\"S2S_SyncStart\"",
-                        "shareName=\"" + big + "\"",
-                        "outfile=\"" + out + "\""});
+  w.setKaroCustCmdRule(
+      {"command=\"S2S_SyncStart\"", "shareName=\"" + big + "\""});
   EXPECT_EQ(0, w.execute(boost::function<bool()>()));
-  EXPECT_NE(std::string::npos, ReadFile(out).find(big));
+  EXPECT_NE(std::string::npos, server_.LastRequest("S2S_SyncStart").find(big));
 }
 
 TEST_F(RsyncWrapperTest, ConnectionFailuresReturnRsyncExitCodes) {
   RsyncWrapper wrong;
   Configure(wrong, "", "not-the-password");
   wrong.setKaroCustCmdRule({"command=\"S2S_Pairing\""});
-  {
-    auto port = PortEnv();
-    EXPECT_EQ(5, wrong.execute(boost::function<bool()>()));
-  }
+  EXPECT_EQ(5, wrong.execute(boost::function<bool()>()));
   RsyncWrapper refused;
   Configure(refused, "");
   refused.setKaroCustCmdRule({"command=\"S2S_Pairing\""});
@@ -158,16 +115,10 @@ TEST_F(RsyncWrapperTest, IncompleteSettingsAreRefusedWithoutRunningRsync) {
 }
 
 TEST_F(RsyncWrapperTest, PeerThatAcceptsAndStaysSilentTimesOut) {
-  int fd = socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t len = sizeof addr;
-  ASSERT_EQ(0, bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr));
-  ASSERT_EQ(0, listen(fd, 4));  // the kernel accepts; nobody ever speaks
-  getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len);
-  s2s_test::ScopedEnv port("S2S_RSYNC_PORT",
-                           std::to_string(ntohs(addr.sin_port)));
+  int silent = 0;
+  int fd = s2s_test::LoopbackListener(&silent);  // nobody ever speaks
+  ASSERT_GE(fd, 0);
+  s2s_test::ScopedEnv port("S2S_RSYNC_PORT", std::to_string(silent));
   RsyncWrapper w;
   Configure(w, "");
   w.setTimeout(1);
@@ -181,7 +132,6 @@ TEST_F(RsyncWrapperTest, PeerThatAcceptsAndStaysSilentTimesOut) {
 }
 
 TEST_F(RsyncWrapperTest, DataPushHonoursSwitches) {
-  auto port = PortEnv();
   std::string src = tmp_.Sub("src");
   std::string data = tmp_.Sub("data");
   mkdir((src + "/dir").c_str(), 0755);
@@ -238,7 +188,6 @@ bool HasTempFile(const std::string& dir) {
 }
 
 TEST_F(RsyncWrapperTest, CancelStopsLargeTransferAndPasswordStaysOffCmdline) {
-  auto port = PortEnv();
   std::string big = tmp_.Sub("src") + "/big";
   int fd = open(big.c_str(), O_CREAT | O_WRONLY, 0600);
   ASSERT_EQ(0, ftruncate(fd, 4LL << 30));  // sparse: costs no disk here

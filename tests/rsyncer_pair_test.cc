@@ -78,6 +78,9 @@ TEST_F(RsyncerPairTest, OldServerGetsTheSingleRequestAndThePlainSyncStart) {
   EXPECT_TRUE(conflicts.empty());
   EXPECT_EQ("CLIENT-A", app_.ServerRegistry("PairedClientInfo", "clientID"));
   EXPECT_EQ("client-a", app_.ServerRegistry("PairedClientInfo", "serverName"));
+  // Asked again, the server names this client as the paired one.
+  ASSERT_EQ(0, r.DoSinglePairing(true, status));
+  EXPECT_EQ(207, status);
 
   // Attributes refused (202), then the plain form is taken.
   LogCapture log;

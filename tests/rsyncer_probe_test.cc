@@ -1,7 +1,5 @@
 // Probing a server: which address answers, what version it speaks, and how
 // the probe ends when nothing answers in time.
-#include <netinet/in.h>
-#include <sys/socket.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -106,17 +104,10 @@ bool PastDeadline() {
 
 TEST_F(RsyncerProbeTest, SilentPeerEndsWhenTheOwnerGivesUp) {
   // Accepts connections (the kernel's backlog does) and never says a word.
-  int fd = socket(AF_INET, SOCK_STREAM, 0);
+  int silent = 0;
+  int fd = s2s_test::LoopbackListener(&silent);
   ASSERT_GE(fd, 0);
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t len = sizeof addr;
-  ASSERT_EQ(0, bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr));
-  ASSERT_EQ(0, listen(fd, 4));
-  ASSERT_EQ(0, getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len));
-  s2s_test::ScopedEnv port("S2S_RSYNC_PORT",
-                           std::to_string(ntohs(addr.sin_port)));
+  s2s_test::ScopedEnv port("S2S_RSYNC_PORT", std::to_string(silent));
 
   Rsyncer r;
   r.SetCancelChecker(&PastDeadline);

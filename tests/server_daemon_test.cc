@@ -24,7 +24,7 @@ const char kPassword[] = "daemon-Secret-91";
 
 class ServerDaemonTest : public ::testing::Test {
  protected:
-  void StartServer(bool old_server) {
+  void StartServer() {
     std::filesystem::create_directories(tmp_.Sub("etc/s2s"));
     std::filesystem::create_directories(tmp_.Sub("share1"));
     std::filesystem::create_directories(tmp_.Sub("src"));
@@ -37,7 +37,6 @@ class ServerDaemonTest : public ::testing::Test {
     config.password = kPassword;
     config.uid = geteuid();
     config.gid = getegid();
-    config.old_server = old_server;
     ASSERT_EQ(0, WriteDaemonConfig(config));
     struct stat st;
     ASSERT_EQ(0, stat(DaemonSecretsPath().c_str(), &st));
@@ -81,7 +80,7 @@ class ServerDaemonTest : public ::testing::Test {
 };
 
 TEST_F(ServerDaemonTest, SyncRunAndDataModuleGuard) {
-  StartServer(false);
+  StartServer();
   std::string answer;
   EXPECT_EQ(0, Command("clientA", "S2S_GetProtocolVer", {}, &answer));
   EXPECT_EQ("1\n", answer);
@@ -99,14 +98,7 @@ TEST_F(ServerDaemonTest, SyncRunAndDataModuleGuard) {
                   "isWinShare=\"0\"", "lenEncKey=\"0\""}));
   EXPECT_EQ(0, Push());
   EXPECT_EQ("payload", ReadFile(tmp_.Sub("share1/file")));
-  // Another client cannot pair a share that clientA feeds.
-  EXPECT_EQ(kConflicts,
-            Command("clientB", "S2S_PairingMultiSrc",
-                    {"serverName=\"srv2\"", "syncShares=\"share1\"",
-                     "dryRun=\"yes\"", "requireEncryptionShareSupport=\"no\""},
-                    &answer));
-  EXPECT_EQ("share1\n", answer);
-  EXPECT_EQ(0, Command("clientA", "S2S_UpdateTaskStatus", {"taskName=\"t1\""}));
+  // Only the client that holds the sync may finish it.
   EXPECT_EQ(kNotSyncing, Command("clientB", "S2S_SyncFinish",
                                  {"finishType=\"share\"", "name=\"share1\""}));
   EXPECT_EQ(0, Command("clientA", "S2S_SyncFinish",
@@ -116,27 +108,8 @@ TEST_F(ServerDaemonTest, SyncRunAndDataModuleGuard) {
   EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("var/spool/s2s/reply")));
 }
 
-TEST_F(ServerDaemonTest, OldServerSwitchDropsNewCommandsAndAttributes) {
-  StartServer(true);
-  EXPECT_EQ(kUnknownCommand, Command("c1", "S2S_GetProtocolVer", {}));
-  EXPECT_EQ(0, Command("c1", "S2S_Pairing",
-                       {"dryRun=\"yes\"", "serverName=\"srv\""}));
-  EXPECT_EQ(
-      0, Command("c1", "S2S_Pairing", {"dryRun=\"no\"", "serverName=\"srv\""}));
-  EXPECT_EQ(kAlreadyPaired, Command("c1", "S2S_Pairing",
-                                    {"dryRun=\"yes\"", "serverName=\"srv\""}));
-  EXPECT_EQ(
-      kAttributesRefused,
-      Command("c1", "S2S_SyncStart",
-              {"volumeName=\"v\"", "shareName=\"share1\"", "isEncrypt=\"0\"",
-               "isAutomount=\"0\"", "isEnableACL=\"0\"", "isWinShare=\"0\"",
-               "lenEncKey=\"0\""}));
-  EXPECT_EQ(0, Command("c1", "S2S_SyncStart",
-                       {"volumeName=\"v\"", "shareName=\"share1\""}));
-}
-
 TEST_F(ServerDaemonTest, OversizedCommandIsRefusedWithStatus) {
-  StartServer(false);
+  StartServer();
   std::string big(kMaxCommandFile, 'x');
   EXPECT_EQ(kMalformed, Command("c1", "S2S_UpdateTaskStatus",
                                 {"taskName=\"" + big + "\""}));
