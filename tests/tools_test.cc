@@ -161,20 +161,13 @@ class ToolsTest : public ::testing::Test {
                                   const std::string& share,
                                   const std::vector<std::string>& more = {}) {
     std::vector<std::string> argv = {S2S_CLIENT_PROGRAM,
-                                     "--root",
-                                     root,
-                                     "--server-ip",
-                                     "127.0.0.1",
-                                     "--port",
-                                     port_,
-                                     "--user",
-                                     "s2s",
-                                     "--task",
-                                     "t1",
-                                     "--share",
-                                     share,
-                                     "--password-file",
-                                     pw_file_};
+                                     "--root=" + root,
+                                     "--server-ip=127.0.0.1",
+                                     "--port=" + port_,
+                                     "--user=s2s",
+                                     "--task=t1",
+                                     "--share=" + share,
+                                     "--password-file=" + pw_file_};
     argv.insert(argv.end(), more.begin(), more.end());
     return argv;
   }
@@ -282,7 +275,7 @@ TEST_F(ToolsTest, PasswordNeverOnACommandLineOrInTheLogs) {
   std::string client = MakeClient("client", "CLIENT-A");
   // From the environment this time, with every log line switched on.
   std::vector<std::string> argv = Client(client, "docs", {"-v", "-v"});
-  argv.erase(argv.end() - 4, argv.end() - 2);  // --password-file FILE
+  argv.erase(argv.end() - 3);  // --password-file=FILE
   Child c =
       Spawn(tmp_.path(), argv, {std::string("S2S_PASSWORD=") + kPassword});
   int rsync_seen = 0;
