@@ -89,14 +89,18 @@ int Logger::Rotate() {
   RotatedName(to, log_path, n - 1);
   remove(to);
 
-  FILE* fp = log_fp.exchange(nullptr);
+  // The closed stream stays in log_fp until the new one is open: writers
+  // that test log_fp without the lock meanwhile must wait for the lock and
+  // find the new file, not drop their message as if the log were silent.
+  // Only under the lock is the stream used, and it is replaced before the
+  // lock is released.
+  FILE* fp = log_fp.load();
   if (fp != nullptr) fclose(fp);
   RotatedName(to, log_path, 0);
-  if (rename(log_path.c_str(), to) != 0) return -1;
-  fp = fopen64(log_path.c_str(), "a");
-  if (fp == nullptr) return -1;
-  log_fp = fp;
-  return 0;
+  fp = rename(log_path.c_str(), to) == 0 ? fopen64(log_path.c_str(), "a")
+                                         : nullptr;
+  log_fp = fp;  // null: silent until the next Initialize
+  return fp != nullptr ? 0 : -1;
 }
 
 void Logger::LogMsg(Level level, const char* format, ...) {
