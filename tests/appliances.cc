@@ -200,8 +200,8 @@ esac
 ScriptedServer::ScriptedServer(const std::string& dir)
     : dir_(dir), daemon_(dir) {}
 
-bool ScriptedServer::Start(const std::string& user, const std::string& password,
-                           const std::vector<RsyncModule>& more) {
+bool ScriptedServer::Start(const std::string& user,
+                           const std::string& password) {
   for (const char* d :
        {"spool", "upload", "reply", "last", "status", "answer"}) {
     if (!MakeDirs(dir_ + "/" + d)) return false;
@@ -215,7 +215,6 @@ bool ScriptedServer::Start(const std::string& user, const std::string& password,
         "pre-xfer exec = " + hook + " pre"}},
       {"s2sspool", dir_ + "/upload", {"read only = no", "write only = yes"}},
   };
-  modules.insert(modules.end(), more.begin(), more.end());
   if (!daemon_.Start(modules, user, password)) return false;
   port_env_.reset();
   port_env_.reset(

@@ -98,10 +98,9 @@ class ScriptedServer {
   ScriptedServer(const ScriptedServer&) = delete;
   ScriptedServer& operator=(const ScriptedServer&) = delete;
 
-  // Starts the daemon for `user` with `password`, with `more` modules beside
-  // the command ones; S2S_RSYNC_PORT names its port while the object lives.
-  bool Start(const std::string& user, const std::string& password,
-             const std::vector<RsyncModule>& more = {});
+  // Starts the daemon for `user` with `password`; S2S_RSYNC_PORT names its
+  // port while the object lives.
+  bool Start(const std::string& user, const std::string& password);
   // From now on `command` is answered with `status` and `answer` (the
   // default is status 0 and an empty answer).
   void Answer(const std::string& command, int status,

@@ -58,9 +58,6 @@ TEST_F(RsyncerCmdTest, PairingVersionBeaconAndFinishLines) {
   ASSERT_EQ(0, r_.GenServerVersionCmd("/tmp/S2S/temp.1", out));
   EXPECT_EQ(out, (Lines{"command=\"S2S_GetProtocolVer\"", "clientID=\"SN-9\"",
                         "outfile=\"/tmp/S2S/temp.1\""}));
-  out.clear();
-  ASSERT_EQ(0, r_.GenServerVersionCmd("", out));
-  EXPECT_EQ("outfile=\"\"", out.back());
 
   out.clear();
   ASSERT_EQ(0, r_.GenSendBeaconCmd("nightly run", out));

@@ -200,6 +200,20 @@ TEST_F(RsyncerSyncTest, SyncStartFallsBackOnlyAfter202) {
   EXPECT_FALSE(Has(plain, "isEncrypt"));
 }
 
+// The /proc entries of the processes whose parent is this test.
+std::vector<std::string> ChildProcs() {
+  std::vector<std::string> procs;
+  for (const auto& e : fs::directory_iterator("/proc")) {
+    std::string stat = ReadFile(e.path().string() + "/stat");
+    size_t paren = stat.rfind(')');
+    if (paren != std::string::npos &&
+        atoi(stat.c_str() + paren + 4) == getpid()) {
+      procs.push_back(e.path().string());
+    }
+  }
+  return procs;
+}
+
 // Set by the watcher thread, read by the cancel checker on the run's thread.
 std::atomic<bool> stop_run{false};
 bool StopRun() { return stop_run.load(); }
@@ -220,10 +234,15 @@ TEST_F(RsyncerSyncTest, CancelStopsALargeTransferPromptly) {
             0);
   stop_run = false;
   std::chrono::steady_clock::time_point stopped;
+  std::string cmdlines, environs;
   std::thread watcher([&] {
     char buf[4096];
     pollfd p = {in, POLLIN, 0};
     if (poll(&p, 1, 20000) == 1 && read(in, buf, sizeof buf) > 0) {
+      for (const std::string& proc : ChildProcs()) {
+        cmdlines += ReadFile(proc + "/cmdline");
+        environs += ReadFile(proc + "/environ");
+      }
       stopped = std::chrono::steady_clock::now();
       stop_run = true;
     }
@@ -237,7 +256,16 @@ TEST_F(RsyncerSyncTest, CancelStopsALargeTransferPromptly) {
   ASSERT_TRUE(stop_run.load()) << "no data reached the server";
   EXPECT_EQ(Rsyncer::RsyncTask::kCancelled, status);
   EXPECT_LT(ended - stopped, std::chrono::milliseconds(1200));
-  EXPECT_FALSE(fs::exists(app_.ServerShare("docs") + "/big"));
+  // The password reaches the client's rsync by its environment only.
+  const std::string password = app_.Info().GetPassword();
+  EXPECT_TRUE(Has(cmdlines, "rsync"));
+  EXPECT_FALSE(Has(cmdlines, password));
+  EXPECT_TRUE(Has(environs, "RSYNC_PASSWORD=" + password));
+  // The daemon's receiver drops its temporary file once the link is gone.
+  for (int i = 0; i < 300 && !fs::is_empty(app_.ServerShare("docs")); ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  EXPECT_TRUE(fs::is_empty(app_.ServerShare("docs")));
 }
 
 }  // namespace

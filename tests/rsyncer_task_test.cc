@@ -15,10 +15,6 @@ TEST(RsyncerTaskTest, DefaultsAndTheInvertedTestSwitch) {
   EXPECT_TRUE(task.getKaroAuthUse());
   EXPECT_TRUE(task.getKaroAuthRequire());
   EXPECT_TRUE(task.getKaroPseudoRoot());
-  // Everything else stays at the wrapper's own defaults.
-  EXPECT_FALSE(task.getDebugLog());
-  EXPECT_FALSE(task.getSsh());
-  EXPECT_EQ(0u, task.getPort());
   // Block-level sync is rsync's delta transfer, not its compression.
   task.SetBlockLevelSync(true);
   EXPECT_TRUE(task.getDeltaCopy());
