@@ -1,6 +1,7 @@
 // An encrypted share's key file travels to the server's key directory, and
 // always over SSH, against a real sshd whose forced command serves the
 // server's daemon configuration.
+#include <chrono>
 #include <filesystem>
 
 #include "S2S/rsyncer.h"
@@ -67,6 +68,14 @@ TEST_F(RsyncerKeyTest, KeyFilesTravelOverSshEvenWithSshOff) {
   EXPECT_EQ(0, r_.SyncEncryptKey("nokey"));
   EXPECT_FALSE(fs::exists(app_.ServerKeyDir() + "/docs"));
   EXPECT_FALSE(fs::exists(app_.ServerKeyDir() + "/nokey"));
+  // An unknown server key fails the copy at once instead of prompting.
+  std::string known = app_.client_root() + "/etc/s2s/ssh/known_hosts";
+  std::string hosts = ReadFile(known);
+  ASSERT_TRUE(WriteFile(known, ""));
+  auto start = std::chrono::steady_clock::now();
+  EXPECT_NE(0, r_.SyncEncryptKey("vault"));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
+  ASSERT_TRUE(WriteFile(known, hosts));
   // The daemon's own port would not do: without sshd the copy fails.
   sshd_.Stop();
   EXPECT_NE(0, r_.SyncEncryptKey("vault"));
