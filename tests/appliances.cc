@@ -35,6 +35,7 @@ Appliances::Appliances(const std::string& handler)
       password_("appliance-Pw-5e1d"),
       daemon_(dir_.path()) {
   WriteClient(client_root_, "CLIENT-A", "client-a");
+  clients_.push_back(client_root_);
   MakeDirs(server_root_ + "/etc/s2s");
   WriteFile(server_root_ + "/etc/s2s/platform.conf",
             "[Platform]\n\tserial=\"SERVER-1\"\n\thostname=\"server\"\n");
@@ -70,7 +71,7 @@ std::string Appliances::ShareConf(const std::string& root) const {
 
 bool Appliances::AddShare(const std::string& name, bool encrypted) {
   shares_.push_back({name, encrypted});
-  std::string dir = encrypted ? "/data/@" + name + "@" : "/data/" + name;
+  std::string dir = ShareDir("", name);
   bool ok =
       MakeDirs(server_root_ + dir) &&
       WriteFile(server_root_ + "/etc/s2s/shares.conf", ShareConf(server_root_));
@@ -78,10 +79,7 @@ bool Appliances::AddShare(const std::string& name, bool encrypted) {
     ok = ok && MakeDirs(root + dir) && MakeDirs(root + "/data/" + name) &&
          WriteFile(root + "/etc/s2s/shares.conf", ShareConf(root));
   }
-  return ok && MakeDirs(client_root_ + dir) &&
-         MakeDirs(client_root_ + "/data/" + name) &&
-         WriteFile(client_root_ + "/etc/s2s/shares.conf",
-                   ShareConf(client_root_));
+  return ok;
 }
 
 bool Appliances::StartServer(bool old_server) {

@@ -81,7 +81,7 @@ class Appliances {
   std::string user_;
   std::string password_;
   std::vector<Share> shares_;
-  std::vector<std::string> clients_;
+  std::vector<std::string> clients_;  // client_root_ included
   std::unique_ptr<ScopedEnv> root_env_;
   std::unique_ptr<ScopedEnv> port_env_;
   RsyncDaemon daemon_;
