@@ -23,10 +23,7 @@ namespace {
 using S2S::Channel;
 using s2s_test::LogCapture;
 using Clock = std::chrono::steady_clock;
-
-double SecondsSince(Clock::time_point t) {
-  return std::chrono::duration<double>(Clock::now() - t).count();
-}
+using s2s_test::SecondsSince;
 
 bool Has(const LogCapture& log, const std::string& text) {
   return log.Text().find(text) != std::string::npos;

@@ -39,10 +39,7 @@ namespace {
 using S2S::Channel;
 using s2s_test::LogCapture;
 using Clock = std::chrono::steady_clock;
-
-double SecondsSince(Clock::time_point t) {
-  return std::chrono::duration<double>(Clock::now() - t).count();
-}
+using s2s_test::SecondsSince;
 
 // Two channels joined by a socket pair of the given kind.
 struct ChannelPair {

@@ -13,13 +13,10 @@
 namespace {
 
 using S2S::Rsyncer;
+using s2s_test::Has;
 using s2s_test::LogCapture;
 using s2s_test::ReadFile;
 using s2s_test::WriteFile;
-
-bool Has(const std::string& text, const std::string& what) {
-  return text.find(what) != std::string::npos;
-}
 
 class RsyncerProbeTest : public ::testing::Test {
  protected:

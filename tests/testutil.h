@@ -6,6 +6,7 @@
 
 #include <sys/types.h>
 
+#include <chrono>
 #include <memory>
 #include <string>
 #include <vector>
@@ -75,6 +76,16 @@ class LogCapture : public SyslogCapture {
 // connection over 127.0.0.1. Both ends blocking; false on failure.
 bool UnixSocketPair(int fds[2]);
 bool TcpSocketPair(int fds[2]);
+
+// Whether `text` holds `what`.
+inline bool Has(const std::string& text, const std::string& what) {
+  return text.find(what) != std::string::npos;
+}
+// Seconds of the steady clock since `start`.
+inline double SecondsSince(std::chrono::steady_clock::time_point start) {
+  return std::chrono::duration<double>(std::chrono::steady_clock::now() - start)
+      .count();
+}
 
 // Reads a whole file; "" when it cannot be read.
 std::string ReadFile(const std::string& path);
