@@ -4,12 +4,13 @@
 #include <sys/stat.h>
 
 #include <string>
+#include <thread>
 #include <vector>
 
-#include "cancel.h"
 #include "client_options.h"
 #include "gtest/gtest.h"
 #include "secret.h"
+#include "service/cancel.h"
 #include "task_file.h"
 #include "testutil.h"
 
@@ -129,7 +130,9 @@ TEST(Secret, FirstLineOfTheFileAndEnvironmentIsConsumed) {
 int g_beacons = 0;
 
 TEST(CancelChecker, BeaconsFromThePollNeverNest) {
-  SetCancelRequested(false);
+  using namespace s2s_service;
+  CancelFlag flag;
+  BindCancelFlag(&flag);
   g_beacons = 0;
   // The hook polls the checker itself, as a beacon's own rsync run does.
   SetBeaconHook(
@@ -146,9 +149,14 @@ TEST(CancelChecker, BeaconsFromThePollNeverNest) {
   EXPECT_FALSE(CancelChecker());
   EXPECT_EQ(2, g_beacons);  // not due yet
 
-  SetCancelRequested(true);
+  flag.Set();
   EXPECT_TRUE(CancelChecker());
-  SetCancelRequested(false);
+  // Another thread's runs have flags of their own.
+  bool other = true;
+  std::thread([&other] { other = CancelChecker(); }).join();
+  EXPECT_FALSE(other);
+  BindCancelFlag(nullptr);
+  EXPECT_FALSE(CancelChecker());
   SetBeaconHook(nullptr, 0);
 }
 

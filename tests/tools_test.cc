@@ -18,15 +18,15 @@
 
 #include "S2S/is_syncedshare.h"
 #include "S2S/s2s_host.h"
-#include "exit_codes.h"
 #include "gtest/gtest.h"
+#include "service/exit_codes.h"
 #include "testutil.h"
 
 namespace {
 
 using s2s_test::ReadFile;
 using s2s_test::WriteFile;
-using namespace s2s_tools;
+using namespace s2s_service;
 
 const char kPassword[] = "pw-Tq83-never-shown";
 

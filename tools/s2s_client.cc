@@ -5,7 +5,7 @@
 //
 // Progress goes to standard output, one line per step, then a summary; the
 // library's log goes to standard error. The exit code says what failed
-// (exit_codes.h).
+// (service/exit_codes.h).
 #include <errno.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -18,15 +18,16 @@
 #include "S2S/logger.h"
 #include "cancel.h"
 #include "client_options.h"
-#include "exit_codes.h"
 #include "karo/rsync_wrapper.h"
 #include "karo_root.h"
 #include "secret.h"
-#include "task_runner.h"
+#include "service/exit_codes.h"
+#include "service/task_runner.h"
 
 namespace {
 
 using namespace s2s_tools;
+using namespace s2s_service;
 
 int g_verbose = 0;
 

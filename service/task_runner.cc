@@ -1,14 +1,14 @@
-#include "task_runner.h"
+#include "service/task_runner.h"
 
 #include <stdio.h>
 #include <time.h>
 
 #include "S2S/rsyncer.h"
 #include "S2S/s2s_share.h"
-#include "cancel.h"
-#include "exit_codes.h"
+#include "service/cancel.h"
+#include "service/exit_codes.h"
 
-namespace s2s_tools {
+namespace s2s_service {
 
 namespace {
 
@@ -302,4 +302,4 @@ TaskOutcome RunTask(const S2S::SyncTask& task,
   return run.outcome();
 }
 
-}  // namespace s2s_tools
+}  // namespace s2s_service

@@ -1,4 +1,4 @@
-// One sync task end to end, as the client program runs it.
+// One sync task end to end, as the one-shot client and the service run it.
 //
 // RunTask probes the server (Initialize), pairs the task's shares, then for
 // each share announces the sync, pushes the data, carries an encrypted
@@ -7,8 +7,13 @@
 // checker's poll; the task's end is reported last. Each step is reported as
 // one line through the caller's reporter. A share that fails does not stop
 // the others; a failed probe or pairing, or a cancel, stops the task.
-#ifndef S2S_TOOLS_TASK_RUNNER_H_
-#define S2S_TOOLS_TASK_RUNNER_H_
+//
+// RunTask runs on the calling thread with its own Rsyncer; a cancel comes
+// through the flag bound to that thread (service/cancel.h), and its beacons
+// are the thread's own, so several tasks may run at once on threads of
+// their own.
+#ifndef S2S_SERVICE_TASK_RUNNER_H_
+#define S2S_SERVICE_TASK_RUNNER_H_
 
 #include <functional>
 #include <list>
@@ -17,7 +22,7 @@
 
 #include "S2S/sync_obj_task.h"
 
-namespace s2s_tools {
+namespace s2s_service {
 
 struct ShareOutcome {
   std::string name;
@@ -50,6 +55,6 @@ TaskOutcome RunTask(const S2S::SyncTask& task,
 // What a status from the rsync wrapper or the server means, for people.
 std::string StatusText(int status);
 
-}  // namespace s2s_tools
+}  // namespace s2s_service
 
-#endif  // S2S_TOOLS_TASK_RUNNER_H_
+#endif  // S2S_SERVICE_TASK_RUNNER_H_

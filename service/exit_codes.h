@@ -1,8 +1,9 @@
-// Exit codes of s2s-client: each says which stage of a task failed.
-#ifndef S2S_TOOLS_EXIT_CODES_H_
-#define S2S_TOOLS_EXIT_CODES_H_
+// How a task run ended: each code says which stage failed. s2s-client exits
+// with it; the service keeps it in the run's history.
+#ifndef S2S_SERVICE_EXIT_CODES_H_
+#define S2S_SERVICE_EXIT_CODES_H_
 
-namespace s2s_tools {
+namespace s2s_service {
 
 enum ExitCode : int {
   kExitOk = 0,
@@ -11,9 +12,9 @@ enum ExitCode : int {
   kExitUnreachable = 3,  // no address of the server answered, or no version
   kExitPairing = 4,      // pairing refused, or shares fed by another client
   kExitShare = 5,        // a share failed to start, transfer or finish
-  kExitCancelled = 6,    // SIGINT or SIGTERM stopped the task
+  kExitCancelled = 6,    // cancelled (a signal, or the service)
 };
 
-}  // namespace s2s_tools
+}  // namespace s2s_service
 
-#endif  // S2S_TOOLS_EXIT_CODES_H_
+#endif  // S2S_SERVICE_EXIT_CODES_H_
