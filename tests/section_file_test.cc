@@ -128,6 +128,22 @@ TEST_F(SectionFileTest, ReadsWhatAPersonTypes) {
   EXPECT_EQ(KLIBCFileEnumSection(file_.c_str(), names), 2);
   KLIBCSzListFree(names);
 
+  // A section of many keys, given again after another section: a repeated
+  // key keeps its first place and takes the last value, before and after
+  // the section holds enough keys to be indexed.
+  std::string many = "[M]\nk0=\"a\"\n";
+  for (int i = 1; i < 30; ++i) many += "k" + std::to_string(i) + "=\"x\"\n";
+  many += "[N]\nk0=\"n\"\n[M]\nk0=\"b\"\nk29=\"c\"\nk30=\"d\"\n";
+  ASSERT_TRUE(WriteFile(file_, many));
+  Hash got(KLIBCSzHashAlloc(64));
+  ASSERT_EQ(KLIBCFileGetSection(file_.c_str(), "M", got.get()), 1);
+  ASSERT_EQ(KLIBCSzHashCount(got.get()), 31);
+  EXPECT_STREQ(KLIBCSzHashKeyAt(got.get(), 0), "k0");
+  EXPECT_STREQ(KLIBCSzHashValueAt(got.get(), 0), "b");
+  EXPECT_STREQ(KLIBCSzHashValueAt(got.get(), 29), "c");
+  EXPECT_STREQ(KLIBCSzHashKeyAt(got.get(), 30), "k30");
+  EXPECT_EQ(Value(file_, "N", "k0"), "n");
+
   for (const char* bad : {"k=\"v\"\n", "[A]\nno equals\n", "[A]\n=v\n", "[A\n",
                           "[]\n", "[A]\nk=\"open\n"}) {
     ASSERT_TRUE(WriteFile(file_, bad));

@@ -1,0 +1,280 @@
+// A section file in memory: one pass over the text to read it, one rendering
+// and an atomic replace to write it.
+#include "section_doc.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <memory>
+#include <string_view>
+
+#include "karo_err.h"
+
+namespace karo_detail {
+
+namespace {
+
+const char kBlanks[] = " \t\r";
+
+std::string_view Trim(std::string_view s) {
+  size_t b = s.find_first_not_of(kBlanks);
+  if (b == std::string_view::npos) return {};
+  size_t e = s.find_last_not_of(kBlanks);
+  return s.substr(b, e - b + 1);
+}
+
+bool HasOuterBlanks(const char* s) {
+  size_t n = strlen(s);
+  return n > 0 && (strchr(kBlanks, s[0]) != nullptr ||
+                   strchr(kBlanks, s[n - 1]) != nullptr);
+}
+
+// A name or key is refused when reading it back would give something else:
+// a line break ends the line, brackets make a section line, '=' ends a key,
+// quotes would be taken for the value, blanks are trimmed and '#' starts a
+// comment.
+bool NameHoldable(const char* s, const char* forbidden) {
+  return s[0] != '\0' && s[0] != '#' && !HasOuterBlanks(s) &&
+         strpbrk(s, forbidden) == nullptr;
+}
+
+// A section's keys are looked up by scanning its pairs up to this many;
+// beyond, through an index of its own, so that a section of many keys does
+// not make reading quadratic.
+const size_t kScanLimit = 16;
+
+using KeyIndex = std::unordered_map<std::string, size_t>;
+
+// Sets `key` in `pairs` while loading; `index` is the section's key index,
+// made once it outgrows kScanLimit.
+void LoadPair(SectionPairs* pairs, std::unique_ptr<KeyIndex>* index,
+              std::string_view key, std::string_view value) {
+  long at = -1;
+  if (*index) {
+    auto it = (*index)->find(std::string(key));
+    if (it != (*index)->end()) at = static_cast<long>(it->second);
+  } else {
+    for (size_t i = 0; i < pairs->size() && at < 0; ++i) {
+      if ((*pairs)[i].first == key) at = static_cast<long>(i);
+    }
+  }
+  // Of a key given twice, the last value wins, in the first one's place.
+  if (at >= 0) {
+    (*pairs)[static_cast<size_t>(at)].second.assign(value);
+    return;
+  }
+  pairs->emplace_back(std::string(key), std::string(value));
+  if (*index) {
+    (*index)->emplace(pairs->back().first, pairs->size() - 1);
+  } else if (pairs->size() > kScanLimit) {
+    index->reset(new KeyIndex);
+    for (size_t i = 0; i < pairs->size(); ++i) {
+      (*index)->emplace((*pairs)[i].first, i);
+    }
+  }
+}
+
+bool WriteAll(int fd, const std::string& text) {
+  size_t done = 0;
+  while (done < text.size()) {
+    ssize_t n = write(fd, text.data() + done, text.size() - done);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return false;
+    done += static_cast<size_t>(n);
+  }
+  return true;
+}
+
+bool ReadAll(const char* file, std::string* text) {
+  FILE* f = fopen(file, "re");
+  if (f == nullptr) {
+    KLIBCErrSet(errno == ENOENT ? KERR_FILE_NOT_FOUND : KERR_SYSTEM);
+    return false;
+  }
+  struct stat st;
+  if (fstat(fileno(f), &st) == 0 && st.st_size > 0) {
+    text->reserve(static_cast<size_t>(st.st_size));
+  }
+  char buf[65536];
+  size_t n;
+  while ((n = fread(buf, 1, sizeof buf, f)) > 0) text->append(buf, n);
+  bool failed = ferror(f) != 0;
+  fclose(f);
+  if (failed) {
+    KLIBCErrSet(KERR_SYSTEM);
+    return false;
+  }
+  return true;
+}
+
+}  // namespace
+
+bool SectionNameHoldable(const char* s) { return NameHoldable(s, "\r\n[]"); }
+
+bool SectionKeyHoldable(const char* s) { return NameHoldable(s, "\r\n=[]\""); }
+
+// Values sit between quotes, so blanks and quotes survive; only a line break
+// cannot.
+bool SectionValueHoldable(const char* s) {
+  return strpbrk(s, "\r\n") == nullptr;
+}
+
+int SectionDoc::Load(const char* file) {
+  sections_.clear();
+  index_.clear();
+  std::string text;
+  if (!ReadAll(file, &text)) return -1;
+  if (text.find('\0') != std::string::npos) {
+    KLIBCErrSet(KERR_FILE_FORMAT);
+    return -1;
+  }
+  const std::string_view all(text);
+  // Most sections take a few lines of some 20 bytes: reserving for that
+  // spares the index its rehashes.
+  index_.reserve(text.size() / 128);
+  std::vector<std::unique_ptr<KeyIndex>> keys;  // per section, when large
+  long current = -1;
+  for (size_t pos = 0; pos < all.size();) {
+    size_t end = all.find('\n', pos);
+    if (end == std::string_view::npos) end = all.size();
+    std::string_view line = Trim(all.substr(pos, end - pos));
+    pos = end + 1;
+    if (line.empty() || line[0] == '#') continue;
+    if (!ParseLine(line, &keys, &current)) {
+      sections_.clear();
+      index_.clear();
+      KLIBCErrSet(KERR_FILE_FORMAT);
+      return -1;
+    }
+  }
+  return 0;
+}
+
+// One trimmed, non-blank, non-comment line; `current` is the section that
+// pairs go to (-1 before the first one).
+bool SectionDoc::ParseLine(std::string_view line,
+                           std::vector<std::unique_ptr<KeyIndex>>* keys,
+                           long* current) {
+  if (line[0] == '[') {
+    if (line.back() != ']') return false;
+    std::string_view name = Trim(line.substr(1, line.size() - 2));
+    if (name.empty()) return false;
+    // A section named twice is read as one.
+    auto it = index_.emplace(std::string(name), sections_.size());
+    if (it.second) {
+      sections_.push_back(Section{it.first->first, {}});
+      sections_.back().pairs.reserve(8);
+      keys->emplace_back();
+    }
+    *current = static_cast<long>(it.first->second);
+    return true;
+  }
+  size_t eq = line.find('=');
+  if (*current < 0 || eq == std::string_view::npos) return false;
+  std::string_view key = Trim(line.substr(0, eq));
+  std::string_view value = Trim(line.substr(eq + 1));
+  if (key.empty()) return false;
+  if (!value.empty() && value[0] == '"') {
+    if (value.size() < 2 || value.back() != '"') return false;
+    value = value.substr(1, value.size() - 2);
+  }
+  const size_t sec = static_cast<size_t>(*current);
+  LoadPair(&sections_[sec].pairs, &(*keys)[sec], key, value);
+  return true;
+}
+
+int SectionDoc::Store(const char* file) const {
+  std::string path(file);
+  size_t slash = path.rfind('/');
+  std::string dir = slash == std::string::npos ? "." : path.substr(0, slash);
+  if (dir.empty()) dir = "/";
+  std::string tmp =
+      (slash == std::string::npos ? std::string() : path.substr(0, slash + 1)) +
+      "." + path.substr(slash + 1) + ".XXXXXX";
+  struct stat st;
+  mode_t mode = stat(file, &st) == 0 ? (st.st_mode & 07777) : 0644;
+  int fd = mkostemp(&tmp[0], O_CLOEXEC);
+  if (fd < 0) {
+    KLIBCErrSet(KERR_SYSTEM);
+    return -1;
+  }
+  bool ok = fchmod(fd, mode) == 0 && WriteAll(fd, Render()) && fsync(fd) == 0;
+  ok = close(fd) == 0 && ok;
+  if (!ok || rename(tmp.c_str(), file) != 0) {
+    int saved = errno;
+    unlink(tmp.c_str());
+    errno = saved;
+    KLIBCErrSet(KERR_SYSTEM);
+    return -1;
+  }
+  // The rename itself must reach the disk for the new content to survive a
+  // power loss.
+  int dfd = open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (dfd >= 0) {
+    fsync(dfd);
+    close(dfd);
+  }
+  return 0;
+}
+
+const SectionPairs* SectionDoc::Find(const std::string& name) const {
+  auto it = index_.find(name);
+  return it == index_.end() ? nullptr : &sections_[it->second].pairs;
+}
+
+SectionPairs* SectionDoc::Find(const std::string& name) {
+  auto it = index_.find(name);
+  return it == index_.end() ? nullptr : &sections_[it->second].pairs;
+}
+
+SectionPairs* SectionDoc::Add(const std::string& name) {
+  auto it = index_.emplace(name, sections_.size());
+  if (it.second) sections_.push_back(Section{name, {}});
+  return &sections_[it.first->second].pairs;
+}
+
+const std::string* SectionDoc::Value(const std::string& name,
+                                     const std::string& key) const {
+  const SectionPairs* pairs = Find(name);
+  if (pairs == nullptr) return nullptr;
+  for (const auto& p : *pairs) {
+    if (p.first == key) return &p.second;
+  }
+  return nullptr;
+}
+
+void SectionDoc::Set(SectionPairs* pairs, const std::string& key,
+                     const std::string& value) {
+  for (auto& p : *pairs) {
+    if (p.first == key) {
+      p.second = value;
+      return;
+    }
+  }
+  pairs->emplace_back(key, value);
+}
+
+std::string SectionDoc::Render() const {
+  size_t size = 0;
+  for (const auto& s : sections_) {
+    size += s.name.size() + 3;
+    for (const auto& p : s.pairs) size += p.first.size() + p.second.size() + 5;
+  }
+  std::string text;
+  text.reserve(size);
+  for (const auto& s : sections_) {
+    text.append("[").append(s.name).append("]\n");
+    for (const auto& p : s.pairs) {
+      text.append("\t").append(p.first).append("=\"");
+      text.append(p.second).append("\"\n");
+    }
+  }
+  return text;
+}
+
+}  // namespace karo_detail
