@@ -1,20 +1,25 @@
 // What a sync task costs through the Rsyncer against bare rsync to the same
 // daemon in the same run:
 //   - one command round trip (a beacon, which writes the server's registry,
-//     and a version query, which does not) against the smallest bare push;
+//     and a version query, which does not) against the floor of a pull: a
+//     bare pull of one tiny file with the same transport options and an
+//     early input of a command's size, from a module of the same daemon
+//     without hooks; BM_CommandVsFloor runs the two in turn and reports
+//     their ratio. A tiny bare push to that module is the push floor;
 //   - a full task cycle (probe, pair, start, RunSync, finish share and task)
-//     on a tree of about 200 MB in 3000 files against
-//     `rsync -a --delete --numeric-ids` of the same tree, for a first sync
-//     into an empty share and for a re-sync without changes;
-//   - RunSync alone on the re-sync, which separates the transfer's own
-//     options from the commands around it.
-// The bare pushes go to a second share whose sync the client holds open, so
-// that both pass the daemon's same guard hook.
+//     on a tree of about 200 MB in 3000 files against bare rsync with the
+//     transfer's own options (-a -H -A -X --delete --numeric-ids
+//     --whole-file and the transport options), for a first sync into an
+//     empty share and for a re-sync without changes;
+//   - RunSync alone on the re-sync.
+// The bare pushes of the tree go to a second share whose sync the client
+// holds open, so that both pass the daemon's same guard hook.
 #include <benchmark/benchmark.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <memory>
@@ -73,22 +78,57 @@ void Empty(const std::string& dir) {
   }
 }
 
+// The options every rsync of the wrapper carries (the transport options of
+// a daemon connection).
+const std::vector<std::string> kTransport = {"--timeout=600", "--contimeout=60",
+                                             "--sockopts=TCP_NODELAY"};
+
 struct Bench {
   s2s_test::Appliances app{S2S_CMD_HANDLER};
-  std::string url;  // the bare pushes' destination
+  std::string base;   // rsync://user@127.0.0.1:port/
+  std::string url;    // the bare pushes' destination
+  std::string floor;  // the module without hooks
+  std::string early;  // an early input of a command's size
   bool ok = false;
 
   Bench() {
     KARO::Backup::RsyncWrapper::setLogHandler(QuietLog);
     ok = app.AddShare("cycle") && app.AddShare("bare") && app.StartServer() &&
-         MakeTree(app.ClientShare("cycle"));
-    url = "rsync://" + app.user() +
-          "@127.0.0.1:" + std::to_string(app.daemon().port()) + "/bare/";
+         MakeTree(app.ClientShare("cycle")) && AddFloorModule();
+    base = "rsync://" + app.user() +
+           "@127.0.0.1:" + std::to_string(app.daemon().port()) + "/";
+    url = base + "bare/";
     // The client holds the bare share's sync, so the guard lets it in.
     S2S::Rsyncer r;
     int status = -1;
     ok = ok && r.Initialize(app.Info()) == 0 &&
          r.StartSyncShare("bare", status) == 0 && status == 0;
+  }
+
+  // A module of the same daemon with the same users and no hooks, holding
+  // one tiny file. The daemon reads its configuration for every connection.
+  bool AddFloorModule() {
+    std::string dir = app.server_root() + "/floor";
+    early = app.client_root() + "/early";
+    std::filesystem::create_directories(dir);
+    std::ofstream(dir + "/tiny") << "status=0\n";
+    std::ofstream(early) << "command=\"S2S_UpdateTaskStatus\"\n"
+                            "clientID=\"0011AABBCCDD-client-a\"\n"
+                            "taskName=\"bench\"\n"
+                            "requestID=\"0123456789abcdef0123456789abcdef\"\n";
+    const std::string path = app.server_root() + "/etc/s2s/rsyncd.conf";
+    std::string conf;
+    {
+      std::ifstream in(path);
+      conf.assign(std::istreambuf_iterator<char>(in), {});
+    }
+    size_t auth = conf.find("\tauth users");
+    size_t end = conf.find("\n", conf.find("\tsecrets file", auth));
+    if (auth == std::string::npos || end == std::string::npos) return false;
+    std::ofstream out(path, std::ios::app);
+    out << "[floor]\n\tpath = " << dir << "\n\tread only = no\n\tlist = no\n"
+        << conf.substr(auth, end + 1 - auth);
+    return static_cast<bool>(out);
   }
 
   // Runs rsync with `args` and the password in its environment only.
@@ -128,13 +168,24 @@ struct Bench {
            r.FinishSync("task", "bench", status) == 0 && status == 0;
   }
 
-  // `nodelay` adds the socket option the wrapper always sets: without it
-  // the client's small writes wait for acknowledgements (Nagle).
-  bool Bare(bool nodelay) {
-    std::vector<std::string> args = {"-a", "--delete", "--numeric-ids"};
-    if (nodelay) args.push_back("--sockopts=TCP_NODELAY");
+  // The transfer's own options, as the wrapper gives them to RunSync.
+  bool Bare() {
+    std::vector<std::string> args = {
+        "-a", "-H", "-A", "-X", "--delete", "--numeric-ids", "--whole-file"};
+    args.insert(args.end(), kTransport.begin(), kTransport.end());
     args.push_back(app.ClientShare("cycle") + "/");
     args.push_back(url);
+    return Rsync(args) == 0;
+  }
+
+  // A command's pull without the command: one tiny file from the module
+  // without hooks, with an early input, into a fresh place.
+  bool FloorPull() {
+    std::string dest = app.client_root() + "/pulled";
+    std::filesystem::remove_all(dest);
+    std::vector<std::string> args = kTransport;
+    args.insert(args.end(),
+                {"--early-input=" + early, "--", base + "floor/tiny", dest});
     return Rsync(args) == 0;
   }
 };
@@ -171,16 +222,51 @@ void BM_VersionRoundTrip(benchmark::State& state) {
   }
 }
 
+void BM_BarePullFloor(benchmark::State& state) {
+  Bench& b = TheBench();
+  if (!b.ok) return state.SkipWithError("no server");
+  for (auto _ : state) {
+    if (!b.FloorPull()) return state.SkipWithError("pull failed");
+  }
+}
+
 void BM_BareTinyPush(benchmark::State& state) {
   Bench& b = TheBench();
   if (!b.ok) return state.SkipWithError("no server");
   std::string tiny = b.app.client_root() + "/tiny";
   std::ofstream(tiny) << "x";
+  std::vector<std::string> args = kTransport;
+  args.insert(args.end(), {"--", tiny, b.base + "floor/pushed"});
   for (auto _ : state) {
-    if (b.Rsync({"--sockopts=TCP_NODELAY", tiny, b.url + "tiny"}) != 0) {
-      return state.SkipWithError("push failed");
-    }
+    if (b.Rsync(args) != 0) return state.SkipWithError("push failed");
   }
+}
+
+// A beacon and a floor pull in turn: the time is the beacon's, "floor_ms"
+// the pull's, "ratio" the one over the other, so that both see the same
+// load.
+void BM_CommandVsFloor(benchmark::State& state) {
+  using Clock = std::chrono::steady_clock;
+  Bench& b = TheBench();
+  if (!b.ok) return state.SkipWithError("no server");
+  S2S::Rsyncer r;
+  if (r.Initialize(b.app.Info()) != 0) return state.SkipWithError("probe");
+  double command = 0, floor = 0;
+  for (auto _ : state) {
+    auto t0 = Clock::now();
+    if (!b.FloorPull()) return state.SkipWithError("pull failed");
+    auto t1 = Clock::now();
+    int status = -1;
+    if (r.SendBeacon("bench", status) != 0 || status != 0) {
+      return state.SkipWithError("beacon failed");
+    }
+    auto t2 = Clock::now();
+    floor += std::chrono::duration<double>(t1 - t0).count();
+    command += std::chrono::duration<double>(t2 - t1).count();
+    state.SetIterationTime(std::chrono::duration<double>(t2 - t1).count());
+  }
+  state.counters["floor_ms"] = floor * 1e3 / state.iterations();
+  state.counters["ratio"] = command / floor;
 }
 
 // state.range(0): 1 for a first sync into an empty share, 0 for a re-sync.
@@ -198,19 +284,17 @@ void BM_FullCycle(benchmark::State& state) {
   }
 }
 
-// state.range(1): 1 adds --sockopts=TCP_NODELAY.
 void BM_BareRsync(benchmark::State& state) {
   Bench& b = TheBench();
   if (!b.ok) return state.SkipWithError("no server");
-  bool nodelay = state.range(1) == 1;
-  if (!b.Bare(nodelay)) return state.SkipWithError("rsync failed");
+  if (!b.Bare()) return state.SkipWithError("rsync failed");
   for (auto _ : state) {
     if (state.range(0) == 1) {
       state.PauseTiming();
       Empty(b.app.ServerShare("bare"));
       state.ResumeTiming();
     }
-    if (!b.Bare(nodelay)) return state.SkipWithError("rsync failed");
+    if (!b.Bare()) return state.SkipWithError("rsync failed");
   }
 }
 
@@ -248,8 +332,20 @@ BENCHMARK(BM_VersionRoundTrip)
     ->Iterations(1)
     ->Repetitions(30)
     ->ReportAggregatesOnly(true);
+BENCHMARK(BM_BarePullFloor)
+    ->UseRealTime()
+    ->Unit(benchmark::kMillisecond)
+    ->Iterations(1)
+    ->Repetitions(30)
+    ->ReportAggregatesOnly(true);
 BENCHMARK(BM_BareTinyPush)
     ->UseRealTime()
+    ->Unit(benchmark::kMillisecond)
+    ->Iterations(1)
+    ->Repetitions(30)
+    ->ReportAggregatesOnly(true);
+BENCHMARK(BM_CommandVsFloor)
+    ->UseManualTime()
     ->Unit(benchmark::kMillisecond)
     ->Iterations(1)
     ->Repetitions(30)
@@ -261,8 +357,7 @@ BENCHMARK(BM_FullCycle)
     ->Unit(benchmark::kMillisecond)
     ->Iterations(3);
 BENCHMARK(BM_BareRsync)
-    ->Args({1, 0})
-    ->Args({1, 1})
+    ->Arg(1)
     ->UseRealTime()
     ->Unit(benchmark::kMillisecond)
     ->Iterations(3);
@@ -272,8 +367,7 @@ BENCHMARK(BM_FullCycle)
     ->Unit(benchmark::kMillisecond)
     ->Iterations(10);
 BENCHMARK(BM_BareRsync)
-    ->Args({0, 0})
-    ->Args({0, 1})
+    ->Arg(0)
     ->UseRealTime()
     ->Unit(benchmark::kMillisecond)
     ->Iterations(10);
