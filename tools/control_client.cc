@@ -1,0 +1,85 @@
+#include "control_client.h"
+
+#include <errno.h>
+#include <string.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include "S2S/ipc.h"
+#include "karo_root.h"
+
+namespace s2s_tools {
+
+const char kControlSocket[] = "/run/s2s/s2sd.sock";
+
+namespace {
+
+// Connects a Unix-domain stream socket to `path` itself rather than through
+// the sender, so that the reason of a failure (errno) reaches the person.
+int ConnectUnix(const std::string& path, int& err) {
+  sockaddr_un addr;
+  memset(&addr, 0, sizeof addr);
+  if (path.empty() || path.size() >= sizeof addr.sun_path) {
+    err = ENAMETOOLONG;
+    return -1;
+  }
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0) {
+    err = errno;
+    return -1;
+  }
+  addr.sun_family = AF_UNIX;
+  memcpy(addr.sun_path, path.data(), path.size());
+  int rc;
+  do {
+    rc = connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+  } while (rc != 0 && errno == EINTR);
+  if (rc != 0) {
+    err = errno;
+    close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+}  // namespace
+
+ControlClient::ControlClient(const std::string& socket_path)
+    : path_(socket_path.empty() ? KaroRootPath(kControlSocket) : socket_path) {}
+
+ControlClient::Status ControlClient::Call(const S2S::PObject& request,
+                                          S2S::PObject& reply,
+                                          std::string& error) const {
+  int err = 0;
+  int fd = ConnectUnix(path_, err);
+  if (fd < 0) {
+    error = "cannot connect to " + path_ + ": " + strerror(err);
+    if (err == EACCES || err == EPERM) {
+      error += " (the control socket is for root)";
+      return kRefused;
+    }
+    if (err == ENOENT || err == ECONNREFUSED) error += " (is s2sd running?)";
+    return kUnreachable;
+  }
+  S2S::IPCSender sender;
+  if (sender.assign(fd) != 0) {
+    close(fd);
+    error = "cannot use the connection to " + path_;
+    return kBroken;
+  }
+  sender.channel().SetTimeout(timeout_);
+  reply = S2S::PObject();
+  if (sender.send(request, true, reply) != 0) {
+    error = "s2sd closed the connection without a reply";
+    return kBroken;
+  }
+  if (!reply.isMap() || !reply["result"].isInteger() ||
+      !reply["message"].isString()) {
+    error = "s2sd answered with something other than a reply";
+    return kBroken;
+  }
+  return kReplied;
+}
+
+}  // namespace s2s_tools
