@@ -5,7 +5,7 @@
  * "<program> --daemon" in a session of its own, with standard input and
  * output on /dev/null, and the pid file /var/run/s2s_daemon.pid under the
  * root. The program is "daemon_program" of the platform configuration, else
- * "s2s-client" in the directory of the binary that holds this layer. The
+ * "s2s-client" as KaroProgramFind finds it (karo_programs.h). The
  * program must stay in the foreground: the pid file names the process that
  * was started.
  *

@@ -112,7 +112,8 @@ int KAROShareIsInSharebin(const char* name);
 /* Fills `out` with the volume of the share at `path`: the share's "volume"
  * and "volume_type" (type 1 when not given) when the configuration has a
  * share at that path naming its volume, else the mount point that holds
- * `path` (type 1 for a mount of a /dev block device, else 2). Returns 0, or
+ * `path` as "/NAME", NAME being the mount point's last component or "root"
+ * for / (type 1 for a mount of a /dev block device, else 2). Returns 0, or
  * -1: KERR_INVALID_ARG (not an absolute path), KERR_NOT_FOUND (no mount
  * holds it), KERR_BUFFER_TOO_SMALL, KERR_FILE_FORMAT. */
 int VolumePathParseEx(const char* path, KARO_VOLUME* out);

@@ -1,4 +1,3 @@
-#include <dlfcn.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <poll.h>
@@ -13,6 +12,7 @@
 #include "karo_err.h"
 #include "karo_host.h"
 #include "karo_process.h"
+#include "karo_programs.h"
 #include "karo_root.h"
 #include "karo_service.h"
 #include "spawn.h"
@@ -40,16 +40,8 @@ std::string PidFileOf(const char* name) {
 std::string DaemonProgram() {
   char buf[4096];
   if (KaroPlatformConfGet("daemon_program", buf, sizeof buf) > 0) return buf;
-  Dl_info info;
-  if (dladdr(reinterpret_cast<void*>(&KLIBServiceStart), &info) != 0 &&
-      info.dli_fname != nullptr) {
-    std::string self = info.dli_fname;
-    size_t slash = self.rfind('/');
-    if (slash != std::string::npos) {
-      return self.substr(0, slash + 1) + kDaemonProgram;
-    }
-  }
-  return kDaemonProgram;
+  std::string found = KaroProgramPath(kDaemonProgram);
+  return found.empty() ? kDaemonProgram : found;
 }
 
 // Creates every missing directory of `dir`.

@@ -49,7 +49,8 @@ int Fill(const std::string& path, int type, KARO_VOLUME* out) {
   return 0;
 }
 
-// The deepest mount that holds `path`, as in the mount table.
+// The deepest mount that holds `path`, as in the mount table, as the
+// volume "/NAME" with NAME the mount point's last component ("root" for /).
 int FromMountTable(const std::string& path, KARO_VOLUME* out) {
   FILE* table = OpenMountTable();
   if (table == nullptr) {
@@ -73,7 +74,10 @@ int FromMountTable(const std::string& path, KARO_VOLUME* out) {
     KLIBCErrSet(KERR_NOT_FOUND);
     return -1;
   }
-  return Fill(best, best_type, out);
+  // The volume is named after its mount point; the root file system has no
+  // name of its own.
+  std::string name = best == "/" ? "root" : best.substr(best.rfind('/') + 1);
+  return Fill("/" + name, best_type, out);
 }
 
 }  // namespace

@@ -1,6 +1,7 @@
 // s2s-cmd-handler: the program the server's rsync daemon runs from its hooks.
 //
 //   s2s-cmd-handler [--root DIR] [--old-server] early|pre|post|data
+//   s2s-cmd-handler --help | --version
 //
 // --root sets the appliance root (as S2S_ROOT does) for the registry, the
 // share configuration and the spool directories.
@@ -12,10 +13,41 @@
 #include "hooks.h"
 #include "karo_root.h"
 
+namespace {
+
+const char kHelp[] =
+    "usage: s2s-cmd-handler [--root DIR] [--old-server] early|pre|post|data\n"
+    "       s2s-cmd-handler --help | --version\n"
+    "\n"
+    "Run by the server's rsync daemon from the hooks of its configuration\n"
+    "(written by s2s-server), not by hand:\n"
+    "  early  spools the early input of a connection to the command module\n"
+    "  pre    reads the command, carries it out and writes its reply\n"
+    "  post   removes the connection's spool, upload and reply files\n"
+    "  data   lets a push into a share through only from the client that\n"
+    "         holds the share's running sync\n"
+    "\n"
+    "  --root DIR     appliance root (as $S2S_ROOT) of the registry, shares\n"
+    "                 and spool directories\n"
+    "  --old-server   answer as a server of protocol version 0\n"
+    "\n"
+    "Its inputs are the daemon's RSYNC_* variables; it logs to syslog.\n"
+    "Exit codes: 0 lets the transfer go on, 2 usage, anything else refuses.\n";
+
+}  // namespace
+
 int main(int argc, char** argv) {
   bool old_server = false;
   const char* mode = nullptr;
   for (int i = 1; i < argc; ++i) {
+    if (strcmp(argv[i], "--help") == 0) {
+      fputs(kHelp, stdout);
+      return 0;
+    }
+    if (strcmp(argv[i], "--version") == 0) {
+      printf("s2s-cmd-handler %s\n", S2S_VERSION);
+      return 0;
+    }
     if (strcmp(argv[i], "--root") == 0 && i + 1 < argc) {
       setenv(KARO_ROOT_ENV, argv[++i], 1);
     } else if (strcmp(argv[i], "--old-server") == 0) {

@@ -114,8 +114,11 @@ TEST_F(ShareTest, VolumeFallsBackToTheRootsMountTable) {
   EXPECT_STREQ(vol.path, "/volume2");
   EXPECT_EQ(vol.type, KARO_VOLUME_INTERNAL);
   ASSERT_EQ(VolumePathParseEx("/volume2/sec ret/x", &vol), 0);
-  EXPECT_STREQ(vol.path, "/volume2/sec ret");
+  EXPECT_STREQ(vol.path, "/sec ret");
   EXPECT_EQ(vol.type, KARO_VOLUME_OTHER);
+  // The root file system gets a name too.
+  ASSERT_EQ(VolumePathParseEx("/srv/data", &vol), 0);
+  EXPECT_STREQ(vol.path, "/root");
   EXPECT_EQ(VolumePathParseEx("volume2", &vol), -1);
   EXPECT_EQ(KLIBCErrGet(), KERR_INVALID_ARG);
 }

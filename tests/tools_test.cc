@@ -139,19 +139,16 @@ class ToolsTest : public ::testing::Test {
     EXPECT_NE(std::string::npos, stop.out.find("stopped")) << stop.out;
   }
 
-  // A client root with serial `serial` and the share docs holding a tree.
+  // A client root with serial `serial`, made by `s2s-client init` alone,
+  // and the share docs holding a tree.
   std::string MakeClient(const std::string& name, const std::string& serial) {
     std::string root = tmp_.Sub(name);
+    Child init = RunProgram(
+        tmp_.path(), {S2S_CLIENT_PROGRAM, "--root", root, "init", "--serial",
+                      serial, "--share", "docs", "--share", "big"});
+    EXPECT_EQ(0, init.code) << init.out << init.err;
     std::string vol = root + "/volume1";
-    std::filesystem::create_directories(root + "/etc/s2s");
     std::filesystem::create_directories(vol + "/docs/sub/deeper");
-    std::filesystem::create_directories(vol + "/big");
-    WriteFile(root + "/etc/s2s/platform.conf",
-              "[Platform]\n\tserial=\"" + serial + "\"\n\tlookup=\"hosts\"\n");
-    WriteFile(root + "/etc/s2s/shares.conf",
-              "[docs]\n\tpath=\"" + vol + "/docs\"\n\tvolume=\"" + vol +
-                  "\"\n[big]\n\tpath=\"" + vol + "/big\"\n\tvolume=\"" + vol +
-                  "\"\n");
     WriteFile(vol + "/docs/a.txt", "alpha\n");
     WriteFile(vol + "/docs/sub/deeper/b.txt", "bravo from " + serial + "\n");
     return root;
@@ -305,6 +302,66 @@ TEST_F(ToolsTest, PasswordNeverOnACommandLineOrInTheLogs) {
   ASSERT_EQ(0,
             stat((server_ + "/etc/s2s/rsyncd.secrets").c_str(), &st_secrets));
   EXPECT_EQ(0600u, st_secrets.st_mode & 0777);
+}
+
+// What an operator does to a server that runs: a share added is synced at
+// once, a stuck sync and a pairing bound to one client are cleared, and the
+// exit code of status says whether the daemon runs.
+TEST_F(ToolsTest, OperatorCommandsOnARunningServer) {
+  auto server = [&](std::vector<std::string> words) {
+    words.insert(words.begin(), {S2S_SERVER_PROGRAM, "--root", server_});
+    return RunProgram(tmp_.path(), words);
+  };
+  std::string extra = tmp_.Sub("extra");
+  Child add = server({"share", "add", "extra=" + extra});
+  ASSERT_EQ(0, add.code) << add.err;
+  EXPECT_NE(std::string::npos, add.out.find("configuration rewritten"));
+  std::string client = tmp_.Sub("client");
+  ASSERT_EQ(
+      0, RunProgram(tmp_.path(), {S2S_CLIENT_PROGRAM, "--root", client, "init",
+                                  "--serial", "CLIENT-A", "--share",
+                                  "extra=" + tmp_.Sub("on-root-fs/extra")})
+             .code);
+  WriteFile(tmp_.Sub("on-root-fs/extra/new.txt"), "new share\n");
+  Child sync = RunProgram(tmp_.path(), Client(client, "extra"));
+  ASSERT_EQ(kExitOk, sync.code) << sync.out << sync.err;
+  EXPECT_EQ("new share\n", ReadFile(extra + "/new.txt"));
+
+  {
+    s2s_test::ScopedEnv root("S2S_ROOT", server_);
+    KSZHASH* stuck = KLIBCSzHashAlloc(4);
+    KLIBCSzHashSetValue(stuck, "RunningID", "GONE-1");
+    ASSERT_EQ(0, S2SServerUpdateShare("docs", stuck));
+    KLIBCSzHashFree(stuck);
+    ASSERT_EQ(0, KAROUISetS2S(1, "OLD-1", "oldname"));
+  }
+  struct Case {
+    std::vector<std::string> words;
+    int code;
+    std::string says;
+  };
+  const Case cases[] = {
+      {{"release", "docs"}, 0, "released from the sync of client GONE-1"},
+      {{"release", "nosuch"}, 1, "no share nosuch"},
+      {{"status"}, 0, "paired:   client OLD-1"},
+      {{"reset-pairing"}, 0, "client OLD-1 forgotten"},
+      {{"status"}, 0, "paired:   open to several clients"},
+      {{"pairings"}, 0, "clientID=\"(open to several clients)\""},
+      {{"stop"}, 0, "stopped"},
+      {{"status"}, 3, "daemon:   not running"},
+      {{"status", "--json"}, 3, "\"daemon\": {\"running\": false"},
+      {{"pairings", "--json"}, 3, "\"SHARE_extra\": {"},
+      {{"--root", tmp_.Sub("none"), "status"}, 1, "no server root"},
+      {{"start"}, 0, "daemon: pid"},
+  };
+  for (const Case& c : cases) {
+    Child r = server(c.words);
+    EXPECT_EQ(c.code, r.code) << c.words[0] << "\n" << r.out << r.err;
+    EXPECT_NE(std::string::npos, (r.out + r.err).find(c.says))
+        << c.words[0] << "\n"
+        << r.out << r.err;
+  }
+  EXPECT_EQ("", ShareKey("docs", "RunningID"));
 }
 
 TEST_F(ToolsTest, SigtermCancelsARunningTransfer) {

@@ -26,6 +26,7 @@ enum Option {
   kSSHPort,
   kBeacon,
   kDaemon,
+  kVersion,
 };
 
 const struct option kOptions[] = {
@@ -49,12 +50,14 @@ const struct option kOptions[] = {
     {"daemon", no_argument, nullptr, kDaemon},
     {"verbose", no_argument, nullptr, 'v'},
     {"help", no_argument, nullptr, 'h'},
+    {"version", no_argument, nullptr, kVersion},
     {nullptr, 0, nullptr, 0},
 };
 
 const char kUsage[] =
     "usage: s2s-client [options]\n"
     "       s2s-client --daemon\n"
+    "       s2s-client [--root DIR] init --share NAME[=PATH]... (init --help)\n"
     "\n"
     "Runs one sync task: probes the server, pairs the shares, then starts,\n"
     "transfers and finishes each share, with beacons while it runs.\n"
@@ -79,7 +82,7 @@ const char kUsage[] =
     "  --beacon-interval SEC  seconds between beacons during a run (30)\n"
     "  -v, --verbose          log INFO; twice: DEBUG and rsync's output\n"
     "  --daemon               service mode: wait until SIGTERM\n"
-    "  -h, --help             this text\n"
+    "  -h, --help             this text; --version: the version\n"
     "\n"
     "Exit codes:\n"
     "  0  every share synced\n"
@@ -190,6 +193,9 @@ bool ParseClientArgs(int argc, char** argv, ClientOptions& o,
         break;
       case 'h':
         o.help = true;
+        break;
+      case kVersion:
+        o.version = true;
         break;
       default:
         error = std::string("unknown or incomplete option ") +

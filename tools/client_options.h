@@ -15,6 +15,7 @@ struct ClientOptions {
   int verbose = 0;        // -v: library INFO; -vv: DEBUG and rsync's output
   bool daemon = false;    // --daemon: the platform service's mode
   bool help = false;
+  bool version = false;               // --version
   unsigned int beacon_interval = 30;  // seconds between beacons during a run
 };
 

@@ -2,6 +2,7 @@
 //
 //   s2s-client [--root DIR] [--task-file FILE] [options]   (see --help)
 //   s2s-client --daemon
+//   s2s-client [--root DIR] init --share NAME[=PATH]...   (client_root.h)
 //
 // Progress goes to standard output, one line per step, then a summary; the
 // library's log goes to standard error. The exit code says what failed
@@ -18,6 +19,7 @@
 #include "S2S/logger.h"
 #include "cancel.h"
 #include "client_options.h"
+#include "client_root.h"
 #include "karo/rsync_wrapper.h"
 #include "karo_root.h"
 #include "secret.h"
@@ -82,6 +84,7 @@ void PrintSummary(const TaskSpec& spec, const TaskOutcome& out) {
 }  // namespace
 
 int main(int argc, char** argv) {
+  if (IsClientInit(argc, argv)) return RunClientInit(argc, argv);
   ClientOptions o;
   std::string error;
   if (!ParseClientArgs(argc, argv, o, error)) {
@@ -90,6 +93,10 @@ int main(int argc, char** argv) {
   }
   if (o.help) {
     fputs(ClientUsage(), stdout);
+    return kExitOk;
+  }
+  if (o.version) {
+    printf("s2s-client %s\n", S2S_VERSION);
     return kExitOk;
   }
   if (!o.root.empty()) setenv(KARO_ROOT_ENV, o.root.c_str(), 1);

@@ -4,22 +4,30 @@
 //              [--serial SERIAL] [--user USER [--password-file FILE]]
 //   s2s-server [--root DIR] config --user USER [--password-file FILE]
 //   s2s-server [--root DIR] start [--port PORT] [--address ADDR]
-//   s2s-server [--root DIR] stop | status | pairings
+//   s2s-server [--root DIR] stop | status [--json] | pairings [--json]
+//   s2s-server [--root DIR] share add NAME[=PATH] [--encrypted]
+//   s2s-server [--root DIR] share remove NAME | share list
+//   s2s-server [--root DIR] release SHARE | reset-pairing
 //
-// Exit codes: 0 done, 1 failed, 2 usage.
+// Exit codes: 0 done, 1 failed, 2 usage, 3 the daemon is not running
+// (status, pairings).
 #include <getopt.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <unistd.h>
 
 #include <string>
+#include <vector>
 
+#include "S2S/is_syncedshare.h"
 #include "S2S/logger.h"
 #include "karo_root.h"
 #include "secret.h"
 #include "server_daemon.h"
 #include "server_report.h"
 #include "server_root.h"
+#include "server_shares.h"
 
 namespace {
 
@@ -29,19 +37,30 @@ const char kUsage[] =
     "usage: s2s-server [--root DIR] COMMAND [options]\n"
     "\n"
     "  init     create the root: --share NAME[=PATH] (repeatable; default\n"
-    "           path <root>/volume1/NAME), --hostname NAME, --serial SERIAL;\n"
-    "           with --user also writes the daemon configuration\n"
+    "           path <root>/volume1/NAME) [--encrypted], --hostname NAME,\n"
+    "           --serial SERIAL; with --user also writes the daemon\n"
+    "           configuration, without it rewrites an existing one\n"
     "  config   write the daemon configuration: --user USER, the password\n"
     "           from --password-file FILE (mode 0600) or $S2S_PASSWORD,\n"
     "           [--handler PROGRAM] [--old-server]\n"
     "  start    start the rsync daemon: [--port PORT] (default: a free one)\n"
     "           [--address ADDR] (default 127.0.0.1); prints pid and port\n"
     "  stop     stop the daemon of this root (by its pid file)\n"
-    "  status   service status, daemon, shares and tasks\n"
-    "  pairings the pairing registry, section by section\n"
+    "  status   service status, daemon, shares and tasks [--json]\n"
+    "  pairings the pairing registry, section by section [--json]\n"
+    "  share add NAME[=PATH] [--encrypted] | share remove NAME | share list\n"
+    "           change the shares; the daemon configuration follows\n"
+    "  release SHARE\n"
+    "           clear the share's running sync (a client that stopped\n"
+    "           without finishing it)\n"
+    "  reset-pairing\n"
+    "           forget the client the server is bound to: open to several\n"
+    "           clients again\n"
     "\n"
-    "The root comes from --root or $S2S_ROOT.\n"
-    "Exit codes: 0 done, 1 failed, 2 usage.\n";
+    "The root comes from --root or $S2S_ROOT. --help: this text; --version:\n"
+    "the version.\n"
+    "Exit codes: 0 done, 1 failed, 2 usage, 3 the daemon is not running\n"
+    "(status, pairings).\n";
 
 enum Option {
   kRoot = 256,
@@ -55,6 +74,9 @@ enum Option {
   kOldServer,
   kPort,
   kAddress,
+  kVersion,
+  kJson,
+  kEncrypted,
 };
 
 const struct option kOptions[] = {
@@ -70,11 +92,15 @@ const struct option kOptions[] = {
     {"port", required_argument, nullptr, kPort},
     {"address", required_argument, nullptr, kAddress},
     {"help", no_argument, nullptr, 'h'},
+    {"version", no_argument, nullptr, kVersion},
+    {"json", no_argument, nullptr, kJson},
+    {"encrypted", no_argument, nullptr, kEncrypted},
     {nullptr, 0, nullptr, 0},
 };
 
 struct Args {
   std::string command;
+  std::vector<std::string> words;  // what follows the command
   std::string root;
   RootSpec spec;
   std::string user;
@@ -83,6 +109,7 @@ struct Args {
   bool old_server = false;
   int port = 0;
   std::string address = "127.0.0.1";
+  bool json = false;
 };
 
 int Usage(const std::string& error) {
@@ -108,18 +135,71 @@ int Config(const Args& a) {
   return 0;
 }
 
+// After a change of the shares: the daemon configuration follows.
+int Regenerate() {
+  std::string error;
+  int rc = RegenerateServerConfig(error);
+  if (rc < 0) return Fail(error);
+  if (rc > 0) {
+    printf(
+        "config: daemon configuration rewritten; the daemon serves it "
+        "from its next connection\n");
+  }
+  return 0;
+}
+
+int AddShares(const Args& a) {
+  std::string error;
+  if (!InitServerRoot(a.spec, error)) return Fail(error);
+  for (const ShareSpec& s : a.spec.shares) {
+    printf("share: %s added%s\n", s.name.c_str(),
+           s.encrypted ? " (encrypted)" : "");
+  }
+  return Regenerate();
+}
+
+// The commands that read an existing root refuse a missing one.
+bool RootReady() {
+  std::string registry = KaroRootPath("/usr/karo/etc/karoS2S.info");
+  return access(registry.c_str(), F_OK) == 0;
+}
+
+int Share(const Args& a) {
+  const std::vector<std::string>& w = a.words;
+  std::string error;
+  if (w.size() == 2 && w[0] == "add") {
+    Args add = a;
+    add.spec.shares.clear();
+    ShareSpec s;
+    if (!ParseShareSpec(w[1], s)) return Usage("bad share " + w[1]);
+    s.encrypted = a.spec.encrypted;
+    add.spec.shares.push_back(s);
+    return AddShares(add);
+  }
+  if (w.size() == 2 && w[0] == "remove") {
+    if (!RemoveServerShare(w[1], error)) return Fail(error);
+    printf("share: %s removed (its data stays)\n", w[1].c_str());
+    return Regenerate();
+  }
+  if (w.size() == 1 && w[0] == "list") {
+    return PrintShares(stdout) == 0 ? 0 : Fail("cannot read the shares");
+  }
+  return Usage("share add NAME[=PATH] | share remove NAME | share list");
+}
+
 int Run(const Args& a) {
   std::string error;
-  if (a.command == "init") {
+  bool has_words = !a.words.empty();
+  if (a.command == "init" && !has_words) {
     if (!InitServerRoot(a.spec, error)) return Fail(error);
     for (const ShareSpec& s : a.spec.shares) {
       printf("init: share %s\n", s.name.c_str());
     }
     printf("init: root %s ready\n", KaroRootPrefix());
-    return a.user.empty() ? 0 : Config(a);
+    return a.user.empty() ? Regenerate() : Config(a);
   }
-  if (a.command == "config") return Config(a);
-  if (a.command == "start") {
+  if (a.command == "config" && !has_words) return Config(a);
+  if (a.command == "start" && !has_words) {
     pid_t pid = -1;
     int port = 0;
     if (!StartServerDaemon(a.address, a.port, pid, port, error)) {
@@ -128,17 +208,61 @@ int Run(const Args& a) {
     printf("daemon: pid %ld, port %d\n", static_cast<long>(pid), port);
     return 0;
   }
-  if (a.command == "stop") {
+  if (a.command == "stop" && !has_words) {
     int rc = StopServerDaemon(error);
     if (rc < 0) return Fail(error);
     printf("daemon: %s\n", rc == 1 ? "stopped" : "was not running");
     return 0;
   }
-  if (a.command == "status") return PrintStatus(stdout) == 0 ? 0 : 1;
-  if (a.command == "pairings") {
-    return PrintPairings(stdout) == 0 ? 0 : Fail("cannot read the registry");
+  bool reads_root = a.command == "status" || a.command == "pairings" ||
+                    a.command == "share" || a.command == "release" ||
+                    a.command == "reset-pairing";
+  if (!reads_root) return Usage("unknown command " + a.command);
+  if (!RootReady()) {
+    return Fail(std::string("no server root at ") + KaroRootPrefix() +
+                " (run s2s-server init)");
   }
-  return Usage("unknown command " + a.command);
+  if (a.command == "share") return Share(a);
+  if (has_words != (a.command == "release") || a.words.size() > 1) {
+    return Usage("unexpected arguments to " + a.command);
+  }
+  if (a.command == "status") return PrintStatus(stdout, a.json) == 0 ? 0 : 3;
+  if (a.command == "pairings") {
+    if (PrintPairings(stdout, a.json) != 0) {
+      return Fail("cannot read the registry");
+    }
+    pid_t pid;
+    int port;
+    return ServerDaemonRunning(pid, port) ? 0 : 3;
+  }
+  if (a.command == "release") {
+    std::string was;
+    if (!ReleaseShare(a.words[0], was, error)) return Fail(error);
+    if (was.empty()) {
+      printf("release: share %s had no running sync\n", a.words[0].c_str());
+    } else {
+      printf("release: share %s released from the sync of client %s\n",
+             a.words[0].c_str(), was.c_str());
+    }
+    return 0;
+  }
+  // Only a server bound to one client has a pairing to forget.
+  int bound = S2SServerIfOldClientPaired();
+  if (bound < 0) return Fail("cannot read the registry");
+  if (bound == 0) {
+    printf(
+        "reset-pairing: not bound to one client; open to several "
+        "clients\n");
+    return 0;
+  }
+  S2S_SVR_STATUS st = {};
+  s2s_svr_get_status(&st);
+  std::string was = st.clientID != nullptr ? st.clientID : "";
+  s2s_svr_put_status(&st);
+  if (s2s_svr_reset_pair() != 0) return Fail("cannot reset the pairing");
+  printf("reset-pairing: client %s forgotten; open to several clients\n",
+         was.c_str());
+  return 0;
 }
 
 }  // namespace
@@ -193,13 +317,24 @@ int main(int argc, char** argv) {
       case 'h':
         fputs(kUsage, stdout);
         return 0;
+      case kVersion:
+        printf("s2s-server %s\n", S2S_VERSION);
+        return 0;
+      case kJson:
+        a.json = true;
+        break;
+      case kEncrypted:
+        a.spec.encrypted = true;
+        break;
       default:
         return Usage(std::string("unknown or incomplete option ") +
                      argv[optind - 1]);
     }
   }
-  if (optind + 1 != argc) return Usage("give exactly one command");
+  if (optind >= argc) return Usage("give a command");
   a.command = argv[optind];
+  a.words.assign(argv + optind + 1, argv + argc);
+  for (ShareSpec& s : a.spec.shares) s.encrypted = a.spec.encrypted;
   if (!a.root.empty()) setenv(KARO_ROOT_ENV, a.root.c_str(), 1);
   const char* root = getenv(KARO_ROOT_ENV);
   if (root == nullptr || *root == '\0') {

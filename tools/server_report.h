@@ -1,5 +1,6 @@
 // What the server admin program shows: the service status and the pairing
-// registry, read through the library's registry functions.
+// registry, read through the library's registry functions, as text or as
+// JSON.
 #ifndef S2S_TOOLS_SERVER_REPORT_H_
 #define S2S_TOOLS_SERVER_REPORT_H_
 
@@ -7,14 +8,15 @@
 
 namespace s2s_tools {
 
-// The service status (running, busy, paired client), the daemon's pid and
-// port, each configured share's running and completed sync, and each
-// task's status. Returns 0.
-int PrintStatus(FILE* out);
+// The service status (running, busy, the paired client or "open to several
+// clients"), the daemon's pid and port, each configured share's running and
+// completed sync, and each task's status. Returns 0 when the daemon runs,
+// 1 when it does not (the status is printed all the same).
+int PrintStatus(FILE* out, bool json);
 
 // Every section of the registry with its pairs, in file order. Returns 0,
 // or -1 when the registry cannot be read.
-int PrintPairings(FILE* out);
+int PrintPairings(FILE* out, bool json);
 
 }  // namespace s2s_tools
 

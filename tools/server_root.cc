@@ -1,6 +1,5 @@
 #include "server_root.h"
 
-#include <limits.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -9,45 +8,18 @@
 #include "S2S/is_syncedshare.h"
 #include "daemon_config.h"
 #include "karo_host.h"
+#include "karo_programs.h"
 #include "karo_root.h"
 #include "karo_section.h"
 #include "karo_share.h"
+#include "root_files.h"
 
 namespace s2s_tools {
 
 namespace {
 
-struct HashFree {
-  void operator()(KSZHASH* h) const { KLIBCSzHashFree(h); }
-};
-using Hash = std::unique_ptr<KSZHASH, HashFree>;
-
 const char kVolume[] = "/volume1";
 const char kPlatformConf[] = "/etc/s2s/platform.conf";
-
-bool MakeDirs(const std::string& dir, std::string& error) {
-  std::error_code ec;
-  std::filesystem::create_directories(dir, ec);
-  if (ec) error = "cannot create " + dir + ": " + ec.message();
-  return !ec;
-}
-
-bool AddSection(const std::string& file, const std::string& section,
-                const std::vector<std::pair<std::string, std::string>>& kv,
-                std::string& error) {
-  Hash h(KLIBCSzHashAlloc(16));
-  bool ok = h != nullptr;
-  for (const auto& p : kv) {
-    ok = ok &&
-         KLIBCSzHashSetValue(h.get(), p.first.c_str(), p.second.c_str()) == 0;
-  }
-  if (!ok || KLIBCFileAddSection(file.c_str(), section.c_str(), h.get(),
-                                 nullptr) < 0) {
-    error = "cannot write section [" + section + "] of " + file;
-    return false;
-  }
-  return true;
-}
 
 }  // namespace
 
@@ -55,6 +27,7 @@ bool ParseShareSpec(const std::string& text, ShareSpec& out) {
   size_t eq = text.find('=');
   out.name = text.substr(0, eq);
   out.path = eq == std::string::npos ? "" : text.substr(eq + 1);
+  while (out.path.size() > 1 && out.path.back() == '/') out.path.pop_back();
   if (KaroShareNameValid(out.name.c_str()) != 1 ||
       out.name.find(':') != std::string::npos) {
     return false;
@@ -72,18 +45,24 @@ bool InitServerRoot(const RootSpec& spec, std::string& error) {
   for (const ShareSpec& s : spec.shares) {
     std::string path = s.path.empty() ? volume + "/" + s.name : s.path;
     if (!MakeDirs(path, error)) return false;
-    std::vector<std::pair<std::string, std::string>> kv = {{"path", path}};
+    Pairs kv = {{"path", path}};
+    if (s.encrypted) {
+      std::string lower = path.substr(0, path.rfind('/') + 1) + "@" +
+                          path.substr(path.rfind('/') + 1) + "@";
+      if (!MakeDirs(lower, error)) return false;
+      kv.emplace_back("encrypted", "yes");
+      kv.emplace_back("enc_path", lower);
+    }
     // Shares under the root's volume directory count as internal.
     if (path.compare(0, volume.size() + 1, volume + "/") == 0) {
       kv.emplace_back("volume", volume);
     }
     if (!AddSection(shares_conf, s.name, kv, error)) return false;
   }
-  std::vector<std::pair<std::string, std::string>> platform = {
-      {"lookup", "hosts"}};
+  Pairs platform = {{"lookup", "hosts"}};
   if (!spec.hostname.empty()) platform.emplace_back("hostname", spec.hostname);
   if (!spec.serial.empty()) platform.emplace_back("serial", spec.serial);
-  if (!AddSection(KaroRootPath(kPlatformConf), "Platform", platform, error)) {
+  if (!MergeSection(KaroRootPath(kPlatformConf), "Platform", platform, error)) {
     return false;
   }
   if (S2SCheckServerInfo() != 0 || KAROUISetS2S(1, nullptr, nullptr) != 0) {
@@ -110,14 +89,6 @@ bool WriteServerConfig(const std::string& handler, const std::string& user,
   return true;
 }
 
-std::string DefaultHandler() {
-  char self[PATH_MAX];
-  ssize_t n = readlink("/proc/self/exe", self, sizeof self - 1);
-  if (n <= 0) return "";
-  std::string dir(self, static_cast<size_t>(n));
-  dir = dir.substr(0, dir.rfind('/'));
-  std::string handler = dir + "/s2s-cmd-handler";
-  return access(handler.c_str(), X_OK) == 0 ? handler : "";
-}
+std::string DefaultHandler() { return KaroProgramPath("s2s-cmd-handler"); }
 
 }  // namespace s2s_tools

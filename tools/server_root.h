@@ -12,12 +12,16 @@ namespace s2s_tools {
 struct ShareSpec {
   std::string name;
   std::string path;  // "" for <root>/volume1/<name>
+  // Its data lies encrypted in the directory "@<name>@" beside the share's,
+  // which the daemon exports as the module "@<name>@".
+  bool encrypted = false;
 };
 
 struct RootSpec {
   std::vector<ShareSpec> shares;
-  std::string hostname;  // "" keeps the machine's
-  std::string serial;    // "" keeps the machine's
+  std::string hostname;    // "" keeps the machine's
+  std::string serial;      // "" keeps the machine's
+  bool encrypted = false;  // --encrypted: every share given is encrypted
 };
 
 // Parses "NAME" or "NAME=PATH". False when the name is not a valid share
@@ -25,7 +29,8 @@ struct RootSpec {
 bool ParseShareSpec(const std::string& text, ShareSpec& out);
 
 // Adds the shares to /etc/s2s/shares.conf (a share already there is
-// replaced), creates their directories, writes the identity to
+// replaced), creates their directories (for an encrypted share its
+// encrypted directory too), merges the identity into
 // /etc/s2s/platform.conf (names looked up in the root's hosts file only),
 // creates the registry with the service switched on, and the directories
 // the programs use. True, or false with `error`.
@@ -37,7 +42,8 @@ bool WriteServerConfig(const std::string& handler, const std::string& user,
                        const std::string& password, bool old_server,
                        std::string& error);
 
-// The command handler beside this program, or "" when there is none.
+// The command handler beside this program or where it was installed, or ""
+// when there is none.
 std::string DefaultHandler();
 
 }  // namespace s2s_tools

@@ -2,8 +2,17 @@
 #include <S2S/S2S.h>
 
 #include <cstdio>
+#include <cstring>
 
-int main() {
+int main(int argc, char** argv) {
+  // "service": the platform's client service, started from the programs of
+  // the prefix this library was installed to.
+  if (argc == 2 && std::strcmp(argv[1], "service") == 0) {
+    if (S2S::StartDaemon() != 0 || !S2S::IsDaemonRunning()) return 1;
+    if (S2S::StopDaemon() != 0 || S2S::IsDaemonRunning()) return 1;
+    std::puts("consumer service ok");
+    return 0;
+  }
   S2S::PObject msg;
   msg["name"] = "task";
   msg["id"] = 7u;

@@ -1,5 +1,6 @@
-# Installs the built library into a scratch prefix, builds the consumer
-# project against it and runs both consumer programs.
+# Installs the built library and programs into a scratch prefix, builds the
+# consumer project against it and runs both consumer programs and every
+# installed program, with no LD_LIBRARY_PATH: the run paths must suffice.
 file(REMOVE_RECURSE ${WORK_DIR})
 set(prefix ${WORK_DIR}/prefix)
 
@@ -11,10 +12,17 @@ function(run)
 endfunction()
 
 run(${CMAKE_COMMAND} --install ${S2S_BINARY_DIR} --prefix ${prefix})
-set(ENV{PKG_CONFIG_PATH} ${prefix}/lib/pkgconfig)
+set(ENV{PKG_CONFIG_PATH} ${prefix}/${LIBDIR}/pkgconfig)
 run(${CMAKE_COMMAND} -S ${S2S_CONSUMER_DIR} -B ${WORK_DIR}/build
     -G ${GENERATOR} -DCMAKE_PREFIX_PATH=${prefix})
 run(${CMAKE_COMMAND} --build ${WORK_DIR}/build)
-set(ENV{LD_LIBRARY_PATH} ${prefix}/lib)
+unset(ENV{LD_LIBRARY_PATH})
 run(${WORK_DIR}/build/consumer_cmake)
 run(${WORK_DIR}/build/consumer_pkgconfig)
+file(GLOB programs ${prefix}/bin/* ${prefix}/sbin/*)
+foreach(program ${programs})
+  run(${program} --version)
+endforeach()
+# The library starts the client service from the prefix's programs.
+set(ENV{S2S_ROOT} ${WORK_DIR}/root)
+run(${WORK_DIR}/build/consumer_cmake service)
