@@ -74,6 +74,7 @@ const struct option kOptions[] = {
     {"disabled", no_argument, nullptr, kDisabled},
     {"verbose", no_argument, nullptr, 'v'},
     {"help", no_argument, nullptr, 'h'},
+    {"version", no_argument, nullptr, 'V'},
     {nullptr, 0, nullptr, 0},
 };
 
@@ -101,7 +102,7 @@ const char kUsage[] =
     "                         ROOT/run/s2s/s2sd.sock)\n"
     "  --json                 print the daemon's reply as JSON\n"
     "  -v, --verbose          the library's log on standard error\n"
-    "  -h, --help             this text\n"
+    "  -h, --help             this text; --version: the version\n"
     "\n"
     "Task options (task add, task edit):\n"
     "  --task-file FILE       the [Task] file of s2s-client; the options\n"
@@ -389,6 +390,9 @@ bool ParseCtlArgs(int argc, char** argv, CtlOptions& o, std::string& error) {
       case 'h':
         o.help = true;
         break;
+      case 'V':
+        o.version = true;
+        break;
       case '?':
       case ':':
         return Fail(error,
@@ -400,7 +404,7 @@ bool ParseCtlArgs(int argc, char** argv, CtlOptions& o, std::string& error) {
         }
     }
   }
-  if (o.help) return true;
+  if (o.help || o.version) return true;
   std::vector<std::string> words(argv + optind, argv + argc);
   size_t used = 0;
   if (words.empty()) return Fail(error, "no command");

@@ -33,6 +33,7 @@ struct CtlOptions {
   bool json = false;   // --json: the reply as JSON
   int verbose = 0;     // -v: the library's log on standard error
   bool help = false;
+  bool version = false;  // --version
 
   std::string command;  // "task add", "task list", "run", "status", ...
   std::string target;   // TASK: an id or a name

@@ -158,6 +158,10 @@ int main(int argc, char** argv) {
     fputs(CtlUsage(), stdout);
     return kCtlOk;
   }
+  if (o.version) {
+    printf("s2sctl %s\n", S2S_VERSION);
+    return kCtlOk;
+  }
   if (!o.root.empty()) setenv(KARO_ROOT_ENV, o.root.c_str(), 1);
   // The library's own messages only when asked for: what went wrong reaches
   // the person as one line of s2sctl's.

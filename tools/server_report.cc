@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "S2S/is_syncedshare.h"
+#include "json_writer.h"
 #include "karo_root.h"
 #include "karo_section.h"
 #include "karo_share.h"
@@ -30,23 +31,6 @@ std::string ShareValue(const std::string& share, const char* key) {
 
 std::string Str(const char* s) { return s != nullptr ? s : ""; }
 std::string OrDash(const std::string& s) { return s.empty() ? "-" : s; }
-
-std::string Json(const std::string& s) {
-  std::string out = "\"";
-  for (unsigned char c : s) {
-    if (c == '"' || c == '\\') {
-      out += '\\';
-      out += static_cast<char>(c);
-    } else if (c < 0x20) {
-      char esc[8];
-      snprintf(esc, sizeof esc, "\\u%04x", c);
-      out += esc;
-    } else {
-      out += static_cast<char>(c);
-    }
-  }
-  return out + "\"";
-}
 
 // The task's state in words, or its seconds since the last activity.
 std::string TaskStatus(const std::string& status, long long* active_ago) {
@@ -109,19 +93,21 @@ int PrintStatus(FILE* out, bool json) {
             " \"daemon\": {\"running\": %s, \"pid\": %ld, \"port\": %d},\n"
             " \"shares\": [",
             running ? "true" : "false", busy ? "true" : "false",
-            several ? "true" : "false", Json(several ? "" : client).c_str(),
-            Json(server_name).c_str(), daemon ? "true" : "false",
-            daemon ? static_cast<long>(pid) : 0L, daemon ? port : 0);
+            several ? "true" : "false",
+            JsonString(several ? "" : client).c_str(),
+            JsonString(several ? "" : server_name).c_str(),
+            daemon ? "true" : "false", daemon ? static_cast<long>(pid) : 0L,
+            daemon ? port : 0);
     for (size_t i = 0; i < shares.size(); ++i) {
       fprintf(out, "%s{\"name\": %s, \"running\": %s, \"completed_by\": %s}",
-              i ? ", " : "", Json(shares[i].name).c_str(),
-              Json(shares[i].running).c_str(),
-              Json(shares[i].complete).c_str());
+              i ? ", " : "", JsonString(shares[i].name).c_str(),
+              JsonString(shares[i].running).c_str(),
+              JsonString(shares[i].complete).c_str());
     }
     fprintf(out, "],\n \"tasks\": [");
     for (size_t i = 0; i < tasks.size(); ++i) {
       fprintf(out, "%s{\"name\": %s, \"active\": %s, \"seconds_ago\": %lld}",
-              i ? ", " : "", Json(tasks[i].name).c_str(),
+              i ? ", " : "", JsonString(tasks[i].name).c_str(),
               tasks[i].active_ago >= 0 ? "true" : "false", tasks[i].active_ago);
     }
     fprintf(out, "]}\n");
@@ -163,7 +149,7 @@ int PrintPairings(FILE* out, bool json) {
     Hash h(KLIBCSzHashAlloc(256));
     if (!h || S2SGetServerInfo(section, h.get()) < 0) return -1;
     if (json) {
-      fprintf(out, "%s%s: {", i ? ",\n " : "", Json(section).c_str());
+      fprintf(out, "%s%s: {", i ? ",\n " : "", JsonString(section).c_str());
     } else {
       fprintf(out, "[%s]\n", section);
     }
@@ -175,8 +161,8 @@ int PrintPairings(FILE* out, bool json) {
         value = "(open to several clients)";
       }
       if (json) {
-        fprintf(out, "%s%s: %s", k ? ", " : "", Json(key).c_str(),
-                Json(value).c_str());
+        fprintf(out, "%s%s: %s", k ? ", " : "", JsonString(key).c_str(),
+                JsonString(value).c_str());
       } else {
         fprintf(out, "\t%s=\"%s\"\n", key.c_str(), value.c_str());
       }
