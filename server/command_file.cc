@@ -94,13 +94,21 @@ bool IsValidRequestId(const std::string& id) {
   return !id.empty() && id.size() <= 64 && AllOf(id, "_-");
 }
 
+const char kShareNameRule[] =
+    "1-255 printable characters, none of / \\ [ ] \" = @ :, no blank at "
+    "either end, not . or ..";
+const char kTaskNameRule[] =
+    "1-128 printable characters, none of / \\ [ ] \", no blank at either "
+    "end, not . or ..";
+
 bool IsValidShareName(const std::string& name) {
-  return name.find(':') == std::string::npos &&
+  return name.find_first_of(std::string(":\0", 2)) == std::string::npos &&
          KaroShareNameValid(name.c_str()) == 1;
 }
 
 bool IsValidTaskName(const std::string& name) {
   return !name.empty() && name.size() <= 128 && name != "." && name != ".." &&
+         name.front() != ' ' && name.back() != ' ' &&
          Printable(name, "/\\[]\"");
 }
 

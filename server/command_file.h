@@ -31,10 +31,16 @@ int ParseCommandFile(const std::string& text, CommandFile* out,
 bool IsValidClientId(const std::string& id);
 // 1-64 of [A-Za-z0-9_-]: names a file in the spool and reply directories.
 bool IsValidRequestId(const std::string& id);
-// A share name the platform accepts, without ':' (the list separator).
+// A share name the platform accepts, without ':' (the list separator) and
+// without a NUL, which would cut the name short at the platform's C calls.
 bool IsValidShareName(const std::string& name);
-// A task name: 1-128 printable bytes without '/', '\\', '[', ']' or '"'.
+// A task name: 1-128 printable bytes without '/', '\\', '[', ']' or '"',
+// no blank at either end (the registry's section names are trimmed).
 bool IsValidTaskName(const std::string& name);
+// The two rules above in words, for messages to people. The client applies
+// the same functions before it sends anything.
+extern const char kShareNameRule[];
+extern const char kTaskNameRule[];
 // A free-text value the registry can hold: 1-255 printable bytes, no '"'.
 bool IsValidText(const std::string& text);
 

@@ -95,6 +95,35 @@ TEST(ClientOptions, RefusesBadInputsWithoutEchoingSecrets) {
   }
 }
 
+// Names the server would refuse fail here, before anything is sent.
+TEST(ClientOptions, TaskSpecAppliesTheServersNameRules) {
+  struct Case {
+    std::string task;
+    std::string share;
+    const char* says;
+  };
+  const Case cases[] = {
+      {"t1 ", "docs", "task name 't1 '"},
+      {" t1", "docs", "task name ' t1'"},
+      {"a/b", "docs", "task name"},
+      {"t1", std::string("do\0cs", 5), "share name"},
+      {"t1", "docs ", "share name 'docs '"},
+      {"t1", "a=b", "share name"},
+  };
+  for (const Case& c : cases) {
+    TaskSpec spec;
+    spec.name = c.task;
+    spec.shares = {c.share};
+    spec.server_ip = "127.0.0.1";
+    spec.user = "s2s";
+    std::string error;
+    EXPECT_FALSE(CheckTaskSpec(spec, error)) << c.says;
+    EXPECT_TRUE(s2s_test::Has(error, c.says)) << error;
+    EXPECT_TRUE(s2s_test::Has(error, "would be refused by the server"))
+        << error;
+  }
+}
+
 TEST(ClientOptions, SplitListDropsEmptyPieces) {
   EXPECT_EQ((std::list<std::string>{"a", "b"}), SplitList(":a::b:"));
   EXPECT_TRUE(SplitList("").empty());

@@ -5,6 +5,7 @@
 #include <memory>
 
 #include "S2S/s2s_share.h"
+#include "command_file.h"
 #include "karo_section.h"
 
 namespace s2s_tools {
@@ -122,6 +123,9 @@ bool LoadTaskFile(const std::string& path, TaskSpec& spec, std::string& error) {
 bool CheckTaskSpec(const TaskSpec& spec, std::string& error) {
   if (spec.name.empty()) {
     error = "no task name (--task)";
+  } else if (!S2S::server::IsValidTaskName(spec.name)) {
+    error = "task name '" + spec.name + "' would be refused by the server (" +
+            S2S::server::kTaskNameRule + ")";
   } else if (spec.shares.empty()) {
     error = "no share to sync (--share)";
   } else if (spec.server_ip.empty() && spec.server_name.empty()) {
@@ -132,7 +136,10 @@ bool CheckTaskSpec(const TaskSpec& spec, std::string& error) {
     for (const std::string& share : spec.shares) {
       S2S::ShareInfo info;
       bool valid = false;
-      if (S2S::GetShareInfo(share, info) != 0) {
+      if (!S2S::server::IsValidShareName(share)) {
+        error = "share name '" + share + "' would be refused by the server (" +
+                S2S::server::kShareNameRule + ")";
+      } else if (S2S::GetShareInfo(share, info) != 0) {
         error = "no local share '" + share + "'";
       } else if (S2S::IsValidShare(share, valid) != 0 || !valid) {
         error = "share '" + share +

@@ -58,8 +58,9 @@ bool ParseNumber(const std::string& text, unsigned long long max,
 // Splits at ':' dropping empty pieces.
 std::list<std::string> SplitList(const std::string& text);
 
-// Checks that the task is complete (name, shares, server, user) and that
-// every share is known locally and may be synced. Returns true, or false
+// Checks that the task is complete (name, shares, server, user), that its
+// name and share names pass the server's name rules, and that every share is
+// known locally and may be synced. Returns true, or false
 // with `error`.
 bool CheckTaskSpec(const TaskSpec& spec, std::string& error);
 
