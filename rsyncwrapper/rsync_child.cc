@@ -5,6 +5,8 @@
 #include <poll.h>
 #include <signal.h>
 #include <string.h>
+#include <sys/prctl.h>
+#include <sys/resource.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <time.h>
@@ -49,15 +51,42 @@ std::vector<char*> Pointers(std::vector<std::string>& strings) {
   return out;
 }
 
-// Only async-signal-safe calls between fork and exec.
-[[noreturn]] void ExecChild(int out_fd, char* const* argv, char* const* envp) {
-  setsid();
+// Only async-signal-safe calls between fork and exec. rsync gets a session
+// of its own here and nowhere else (a setpgid from the parent would race
+// with it and could make setsid fail), and SIGTERM when its parent dies,
+// so that a killed client never leaves rsync pushing on. `report_fd` is
+// close-on-exec: its end of file tells the parent that all this is done.
+[[noreturn]] void ExecChild(int out_fd, int report_fd, pid_t parent,
+                            unsigned long long max_file_size, char* const* argv,
+                            char* const* envp) {
+  if (setsid() < 0) _exit(127);
+  // The parent may have died before the death signal was armed.
+  if (prctl(PR_SET_PDEATHSIG, SIGTERM) != 0 || getppid() != parent) {
+    _exit(127);
+  }
+  if (max_file_size > 0) {
+    rlimit limit = {max_file_size, max_file_size};
+    if (setrlimit(RLIMIT_FSIZE, &limit) != 0) _exit(127);
+  }
   int null_fd = open("/dev/null", O_RDONLY);
   if (null_fd >= 0) dup2(null_fd, 0);
   dup2(out_fd, 1);
   dup2(out_fd, 2);
   execvpe(argv[0], argv, envp);
+  int err = errno;
+  ssize_t ignored = write(report_fd, &err, sizeof err);
+  (void)ignored;
   _exit(127);
+}
+
+// Waits until the child has exec'd (end of file on the report pipe) or
+// failed to (an errno in it). Returns false on failure.
+bool ChildStarted(int report_fd) {
+  int err = 0;
+  ssize_t n;
+  while ((n = read(report_fd, &err, sizeof err)) < 0 && errno == EINTR) {
+  }
+  return n == 0;
 }
 
 int PidFd(pid_t pid) {
@@ -95,7 +124,8 @@ bool Exited(pid_t pid) {
 
 ChildOutcome RunRsync(const std::vector<std::string>& args,
                       const std::string& password,
-                      const boost::function<bool()>& cancel) {
+                      const boost::function<bool()>& cancel,
+                      unsigned long long max_file_size) {
   ChildOutcome outcome;
   std::vector<std::string> arg_strings = args;
   std::vector<std::string> env_strings = ChildEnvironment(password);
@@ -103,23 +133,37 @@ ChildOutcome RunRsync(const std::vector<std::string>& args,
   std::vector<char*> envp = Pointers(env_strings);
 
   int pipe_fds[2];
+  int report[2];
   if (pipe2(pipe_fds, O_CLOEXEC) != 0) {
     Log(LOG_ERR, "cannot make a pipe for rsync: %s", strerror(errno));
     outcome.status = RsyncWrapper::kStartFailed;
     return outcome;
   }
-  pid_t pid = fork();
-  if (pid == 0) ExecChild(pipe_fds[1], argv.data(), envp.data());
-  close(pipe_fds[1]);
-  if (pid < 0) {
-    Log(LOG_ERR, "cannot start rsync: %s", strerror(errno));
+  if (pipe2(report, O_CLOEXEC) != 0) {
+    Log(LOG_ERR, "cannot make a pipe for rsync: %s", strerror(errno));
     close(pipe_fds[0]);
+    close(pipe_fds[1]);
     outcome.status = RsyncWrapper::kStartFailed;
     return outcome;
   }
-  // The child may not have called setsid() yet; doing it here too closes
-  // the race with an early SIGTERM to the group.
-  setpgid(pid, pid);
+  pid_t parent = getpid();
+  pid_t pid = fork();
+  if (pid == 0) {
+    ExecChild(pipe_fds[1], report[1], parent, max_file_size, argv.data(),
+              envp.data());
+  }
+  close(pipe_fds[1]);
+  close(report[1]);
+  if (pid < 0) {
+    Log(LOG_ERR, "cannot start rsync: %s", strerror(errno));
+    close(pipe_fds[0]);
+    close(report[0]);
+    outcome.status = RsyncWrapper::kStartFailed;
+    return outcome;
+  }
+  // Once exec'd, rsync leads its own group: a cancel reaches all of it.
+  bool started = ChildStarted(report[0]);
+  close(report[0]);
   int out_fd = pipe_fds[0];
   fcntl(out_fd, F_SETFL, fcntl(out_fd, F_GETFL) | O_NONBLOCK);
   int pid_fd = PidFd(pid);
@@ -159,7 +203,7 @@ ChildOutcome RunRsync(const std::vector<std::string>& args,
 
   if (outcome.cancelled) {
     outcome.status = RsyncWrapper::kCancelled;
-  } else if (WIFEXITED(wstatus) && WEXITSTATUS(wstatus) == 127) {
+  } else if (!started || (WIFEXITED(wstatus) && WEXITSTATUS(wstatus) == 127)) {
     Log(LOG_ERR, "cannot run %s", args[0].c_str());
     outcome.status = RsyncWrapper::kStartFailed;
   } else if (WIFEXITED(wstatus)) {
@@ -172,8 +216,10 @@ ChildOutcome RunRsync(const std::vector<std::string>& args,
 }
 
 int RunAndLog(const std::vector<std::string>& args, const RsyncSettings& s,
-              const boost::function<bool()>& cancel, const char* what) {
-  ChildOutcome outcome = RunRsync(args, s.password, cancel);
+              const boost::function<bool()>& cancel, const char* what,
+              std::string* output, unsigned long long max_file_size) {
+  ChildOutcome outcome = RunRsync(args, s.password, cancel, max_file_size);
+  if (output != nullptr) *output = outcome.output;
   std::string last;
   size_t start = 0;
   while (start < outcome.output.size()) {

@@ -2,9 +2,11 @@
 // checker.
 //
 // rsync runs in a session of its own (no controlling terminal, so neither
-// rsync nor ssh can prompt), with standard input on /dev/null and its output
-// collected through a pipe. The password reaches it only as RSYNC_PASSWORD in
-// its environment.
+// rsync nor ssh can prompt) and gets SIGTERM when the process that started
+// it dies, with standard input on /dev/null and its output collected
+// through a pipe. The death signal follows the thread that forked: the
+// caller's thread must outlive the run, which a waiting caller does. The
+// password reaches it only as RSYNC_PASSWORD in its environment.
 #ifndef KARO_RSYNC_CHILD_H_
 #define KARO_RSYNC_CHILD_H_
 
@@ -24,17 +26,22 @@ struct ChildOutcome {
   std::string output;      // what rsync printed (the first 64 KiB)
 };
 
-// Runs `args` (args[0] is looked up in PATH). `cancel` may be empty. Returns
-// the outcome; a child that cannot be started gives kStartFailed.
+// Runs `args` (args[0] is looked up in PATH). `cancel` may be empty.
+// `max_file_size` (0: none) caps every file rsync writes (RLIMIT_FSIZE).
+// Returns the outcome; a child that cannot be started gives kStartFailed.
 ChildOutcome RunRsync(const std::vector<std::string>& args,
                       const std::string& password,
-                      const boost::function<bool()>& cancel);
+                      const boost::function<bool()>& cancel,
+                      unsigned long long max_file_size = 0);
 
 // RunRsync with the settings' password, logging rsync's output line by line
 // at debug level when the debug log is on, and a failure once at error level
-// naming `what`. Returns the outcome's status.
+// naming `what`. Returns the outcome's status; rsync's output goes to
+// `output` when it is not null.
 int RunAndLog(const std::vector<std::string>& args, const RsyncSettings& s,
-              const boost::function<bool()>& cancel, const char* what);
+              const boost::function<bool()>& cancel, const char* what,
+              std::string* output = nullptr,
+              unsigned long long max_file_size = 0);
 
 // How long a cancelled rsync gets between SIGTERM and SIGKILL.
 extern const int kKillGraceMs;

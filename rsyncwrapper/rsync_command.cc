@@ -1,15 +1,15 @@
 #include "rsync_command.h"
 
+#include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <string.h>
+#include <sys/file.h>
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 
 #include "karo/rsync_wrapper.h"
 #include "karo_root.h"
@@ -25,31 +25,82 @@ namespace {
 const char kTempBase[] = "/tmp/S2S";
 const char kCommandFile[] = "cmd";
 
+const char kScratchPrefix[] = "rsync.";
+
+void LockFd(int fd, int how) {
+  while (flock(fd, how) != 0 && errno == EINTR) {
+  }
+}
+
+// Removes the scratch directories of runs that were killed: a live run
+// holds an flock on its directory, so one whose lock is free is left over.
+// REQUIRES: the caller holds the base directory's exclusive lock, which no
+// run takes between creating its directory and locking it.
+void SweepLeftovers(int base_fd, const std::string& base) {
+  DIR* d = fdopendir(dup(base_fd));
+  if (d == nullptr) return;
+  std::vector<std::string> stale;
+  while (dirent* e = readdir(d)) {
+    if (strncmp(e->d_name, kScratchPrefix, strlen(kScratchPrefix)) != 0) {
+      continue;
+    }
+    int fd = openat(base_fd, e->d_name,
+                    O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    if (fd < 0) continue;
+    if (flock(fd, LOCK_EX | LOCK_NB) == 0) stale.push_back(e->d_name);
+    close(fd);
+  }
+  closedir(d);
+  for (const std::string& name : stale) {
+    std::error_code ec;
+    std::filesystem::remove_all(base + "/" + name, ec);
+    if (ec) {
+      Log(LOG_WARNING, "cannot remove %s/%s: %s", base.c_str(), name.c_str(),
+          ec.message().c_str());
+    }
+  }
+}
+
 // A private directory for the command file and the pulled reply, removed
-// with its contents when the command is over.
+// with its contents when the command is over, or by a later command when
+// this process is killed first.
 class ScratchDir {
  public:
   ScratchDir() {
     std::string base = KaroRootPath(kTempBase);
     std::error_code ec;
     std::filesystem::create_directories(base, ec);
-    if (ec) {
-      Log(LOG_ERR, "cannot create %s: %s", base.c_str(), ec.message().c_str());
+    int base_fd =
+        ec ? -1 : open(base.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (base_fd < 0) {
+      Log(LOG_ERR, "cannot create %s: %s", base.c_str(),
+          ec ? ec.message().c_str() : strerror(errno));
       return;
     }
-    std::string tmpl = base + "/rsync.XXXXXX";
+    // Sweeping is best effort: another run sweeping or creating now
+    // leaves it to the next command.
+    if (flock(base_fd, LOCK_EX | LOCK_NB) == 0) {
+      SweepLeftovers(base_fd, base);
+      LockFd(base_fd, LOCK_UN);
+    }
+    LockFd(base_fd, LOCK_SH);
+    std::string tmpl = base + "/" + kScratchPrefix + "XXXXXX";
     if (mkdtemp(&tmpl[0]) == nullptr) {
       Log(LOG_ERR, "cannot create a directory in %s: %s", base.c_str(),
           strerror(errno));
-      return;
+    } else {
+      lock_fd_ = open(tmpl.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+      if (lock_fd_ >= 0) LockFd(lock_fd_, LOCK_EX);
+      path_ = tmpl;
     }
-    path_ = tmpl;
+    close(base_fd);  // drops the shared lock
   }
   ~ScratchDir() {
     for (const std::string& f : files_) unlink((path_ + "/" + f).c_str());
     if (!path_.empty()) rmdir(path_.c_str());
+    if (lock_fd_ >= 0) close(lock_fd_);
   }
-  bool ok() const { return !path_.empty(); }
+  bool ok() const { return !path_.empty() && lock_fd_ >= 0; }
   std::string File(const std::string& name) {
     files_.push_back(name);
     return path_ + "/" + name;
@@ -58,6 +109,7 @@ class ScratchDir {
 
  private:
   std::string path_;
+  int lock_fd_ = -1;
   std::vector<std::string> files_;
 };
 
@@ -74,13 +126,30 @@ bool WriteWhole(const std::string& path, const std::string& data, int mode) {
   return close(fd) == 0 && done == data.size();
 }
 
-bool ReadWhole(const std::string& path, std::string* data) {
-  std::ifstream in(path, std::ios::binary);
-  if (!in) return false;
-  std::ostringstream out;
-  out << in.rdbuf();
-  *data = out.str();
-  return true;
+// Reads the pulled reply: a regular file of at most kMaxReply bytes.
+// Returns kOk, kBadReply when there is none, or kReplyTooLarge.
+int ReadReply(const std::string& path, std::string* data) {
+  int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK);
+  if (fd < 0) return RsyncWrapper::kBadReply;
+  struct stat st;
+  int status = RsyncWrapper::kOk;
+  if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+    status = RsyncWrapper::kBadReply;
+  } else if (st.st_size > static_cast<off_t>(kMaxReply)) {
+    status = RsyncWrapper::kReplyTooLarge;
+  } else {
+    data->resize(static_cast<size_t>(st.st_size));
+    size_t done = 0;
+    while (done < data->size()) {
+      ssize_t n = read(fd, &(*data)[done], data->size() - done);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) break;
+      done += static_cast<size_t>(n);
+    }
+    data->resize(done);
+  }
+  close(fd);
+  return status;
 }
 
 // The local path of the `outfile="..."` line, or "".
@@ -158,14 +227,26 @@ int RunCommand(const RsyncSettings& s, const boost::function<bool()>& cancel) {
     if (status != 0) return status;
   }
   std::string reply_file = dir.File(id);
+  // A server may answer with anything: rsync skips a reply over the cap
+  // (and says so), and no file it writes may grow past it.
   pull.insert(pull.end(),
-              {"--", RemoteSpec(s, kCommandModule, id), dir.path() + "/"});
-  int status = RunAndLog(pull, s, cancel, "command");
-  if (status != 0) return status;
-
+              {"--max-size=" + std::to_string(kMaxReply), "--info=skip1", "--",
+               RemoteSpec(s, kCommandModule, id), dir.path() + "/"});
+  std::string output;
+  int status = RunAndLog(pull, s, cancel, "command", &output, kMaxReply);
+  if (status == 0 && output.find(" is over max-size") != std::string::npos) {
+    status = RsyncWrapper::kReplyTooLarge;
+  }
   std::string reply;
   std::string answer;
-  if (!ReadWhole(reply_file, &reply) || !ParseReply(reply, &status, &answer)) {
+  if (status == 0) status = ReadReply(reply_file, &reply);
+  if (status == RsyncWrapper::kReplyTooLarge) {
+    Log(LOG_ERR, "command to %s: reply larger than %zu bytes, refused",
+        s.host.c_str(), kMaxReply);
+    return status;
+  }
+  if (status != 0) return status;
+  if (!ParseReply(reply, &status, &answer)) {
     Log(LOG_ERR, "command to %s: no valid reply", s.host.c_str());
     return RsyncWrapper::kBadReply;
   }

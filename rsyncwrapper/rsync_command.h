@@ -16,9 +16,13 @@ namespace detail {
 
 // The most --early-input carries.
 const size_t kMaxEarlyInput = 5120;
+// The largest reply taken from a server; a larger one fails with
+// kReplyTooLarge and is neither kept on disk nor read.
+const size_t kMaxReply = 1 << 20;
 
 // Runs the command in `s.command_lines`. Returns the server's status, rsync's
-// exit code when a connection failed, or kStartFailed/kBadReply. The answer
+// exit code when a connection failed, or kStartFailed, kBadReply or
+// kReplyTooLarge. The answer
 // goes to the `outfile="..."` line's path when there is one.
 int RunCommand(const RsyncSettings& s, const boost::function<bool()>& cancel);
 

@@ -281,6 +281,9 @@ std::string StatusText(int status) {
     case 252:
       text = "incomplete settings";
       break;
+    case 253:
+      text = "reply from the server too large";
+      break;
     case 300:
       text = "share record unreadable";
       break;

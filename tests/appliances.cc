@@ -173,7 +173,8 @@ S2S::SyncInfo Appliances::Info() const {
 namespace {
 
 // early: spool the command; pre: answer it from status/<name> and
-// answer/<name>, keep it in last/<name> and count it in log.
+// answer/<name> (grown with a hole to the size in pad/<name>), keep it in
+// last/<name> and count it in log.
 const char kScriptedHook[] = R"SH(
 dir=$(dirname "$0")
 case "$1" in
@@ -189,7 +190,9 @@ pre)
   echo "$name" >> "$dir/log"
   status=$(cat "$dir/status/$name" 2>/dev/null || echo 0)
   { echo "status=$status"; cat "$dir/answer/$name" 2>/dev/null || :; } \
-    > "$dir/reply/$id" ;;
+    > "$dir/reply/$id"
+  [ ! -s "$dir/pad/$name" ] || truncate -s "$(cat "$dir/pad/$name")" \
+    "$dir/reply/$id" ;;
 esac
 )SH";
 
@@ -201,7 +204,7 @@ ScriptedServer::ScriptedServer(const std::string& dir)
 bool ScriptedServer::Start(const std::string& user,
                            const std::string& password) {
   for (const char* d :
-       {"spool", "upload", "reply", "last", "status", "answer"}) {
+       {"spool", "upload", "reply", "last", "status", "answer", "pad"}) {
     if (!MakeDirs(dir_ + "/" + d)) return false;
   }
   std::string hook = dir_ + "/hook.sh";
@@ -224,6 +227,11 @@ void ScriptedServer::Answer(const std::string& command, int status,
                             const std::string& answer) {
   WriteFile(dir_ + "/status/" + command, std::to_string(status) + "\n");
   WriteFile(dir_ + "/answer/" + command, answer);
+}
+
+void ScriptedServer::PadReply(const std::string& command,
+                              unsigned long long size) {
+  WriteFile(dir_ + "/pad/" + command, std::to_string(size) + "\n");
 }
 
 std::string ScriptedServer::LastRequest(const std::string& command) const {

@@ -105,6 +105,9 @@ class ScriptedServer {
   // default is status 0 and an empty answer).
   void Answer(const std::string& command, int status,
               const std::string& answer = "");
+  // From now on the reply to `command` is grown to `size` bytes (a sparse
+  // hole after the answer), as a hostile server would flood a client.
+  void PadReply(const std::string& command, unsigned long long size);
   // The lines of the last `command` received, requestID line included; ""
   // when none came.
   std::string LastRequest(const std::string& command) const;

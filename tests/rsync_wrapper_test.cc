@@ -104,6 +104,25 @@ TEST_F(RsyncWrapperTest, IncompleteSettingsAreRefusedWithoutRunningRsync) {
             no_password.execute(boost::function<bool()>()));
 }
 
+// A hostile server answering the version query with 64 MiB: refused with
+// its own status, and nothing of it comes to the client's disk.
+TEST_F(RsyncWrapperTest, ReplyOverTheCapIsRefusedWithoutKeepingIt) {
+  std::string out = tmp_.Sub("answer");
+  server_.PadReply("S2S_GetProtocolVer", 64ull << 20);
+  RsyncWrapper w;
+  Configure(w);
+  w.setKaroCustCmdRule(
+      {"command=\"S2S_GetProtocolVer\"", "outfile=\"" + out + "\""});
+  EXPECT_EQ(RsyncWrapper::kReplyTooLarge, w.execute(boost::function<bool()>()));
+  EXPECT_TRUE(s2s_test::Has(log_text, "reply larger than")) << log_text;
+  EXPECT_FALSE(std::filesystem::exists(out));
+  EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("root") + "/tmp/S2S"));
+  // Within the cap, the same server is heard as usual.
+  server_.PadReply("S2S_GetProtocolVer", 4096);
+  EXPECT_EQ(0, w.execute(boost::function<bool()>()));
+  EXPECT_EQ(4096u - 9, std::filesystem::file_size(out));
+}
+
 TEST_F(RsyncWrapperTest, PeerThatAcceptsAndStaysSilentTimesOut) {
   int silent = 0;
   int fd = s2s_test::LoopbackListener(&silent);  // nobody ever speaks

@@ -68,10 +68,11 @@ class KARO_RSYNC_EXPORT RsyncWrapper {
   // rsync's exit code (1-35) or, for a command, the server's status.
   enum Status : int {
     kOk = 0,
-    kCancelled = 20,     // the cancel checker stopped the run
-    kStartFailed = 250,  // temporary files or the child could not be made
-    kBadReply = 251,     // a command ran but its reply was missing/garbled
-    kBadSettings = 252,  // destination, command lines or auth incomplete
+    kCancelled = 20,       // the cancel checker stopped the run
+    kStartFailed = 250,    // temporary files or the child could not be made
+    kBadReply = 251,       // a command ran but its reply was missing/garbled
+    kBadSettings = 252,    // destination, command lines or auth incomplete
+    kReplyTooLarge = 253,  // a command's reply exceeded the wrapper's cap
   };
 
   // Where the wrapper's log lines go; `priority` is a syslog priority. The
