@@ -13,6 +13,7 @@ enum ExitCode : int {
   kExitPairing = 4,      // pairing refused, or shares fed by another client
   kExitShare = 5,        // a share failed to start, transfer or finish
   kExitCancelled = 6,    // cancelled (a signal, or the service)
+  kExitBusy = 7,         // another run of the task holds its lock
 };
 
 }  // namespace s2s_service

@@ -3,10 +3,13 @@
 // checked is what a person sees: exit codes, the copied files, the
 // registry, and that the password shows nowhere.
 #include <dirent.h>
+#include <errno.h>
 #include <fcntl.h>
+#include <poll.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
@@ -36,8 +39,16 @@ struct Child {
   std::string out, err;
   int code = -1;
 
-  // Waits for the child; its exit code, or 128 + signal.
-  int Wait() {
+  // Waits for the child, at most `seconds` (then it is killed); its exit
+  // code, or 128 + signal.
+  int Wait(int seconds = 60) {
+    int pid_fd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+    pollfd exited = {pid_fd, POLLIN, 0};
+    if (pid_fd < 0 || poll(&exited, 1, seconds * 1000) != 1) {
+      ADD_FAILURE() << "still running after " << seconds << " s";
+      kill(pid, SIGKILL);
+    }
+    if (pid_fd >= 0) close(pid_fd);
     int st = 0;
     waitpid(pid, &st, 0);
     code = WIFEXITED(st) ? WEXITSTATUS(st) : 128 + WTERMSIG(st);
@@ -96,6 +107,38 @@ std::vector<std::string> AllCommandLines() {
   }
   closedir(d);
   return out;
+}
+
+// The rsync processes whose parent is `parent`.
+std::vector<pid_t> RsyncChildren(pid_t parent) {
+  std::vector<pid_t> out;
+  DIR* d = opendir("/proc");
+  if (d == nullptr) return out;
+  while (dirent* e = readdir(d)) {
+    if (e->d_name[0] < '0' || e->d_name[0] > '9') continue;
+    std::string stat = ReadFile(std::string("/proc/") + e->d_name + "/stat");
+    size_t close_paren = stat.rfind(')');
+    if (stat.find("(rsync)") == std::string::npos ||
+        close_paren == std::string::npos) {
+      continue;
+    }
+    // "pid (comm) state ppid ..."
+    if (atoi(stat.c_str() + close_paren + 4) == parent) {
+      out.push_back(atoi(e->d_name));
+    }
+  }
+  closedir(d);
+  return out;
+}
+
+// Whether process `pid` (not necessarily ours) ends within `seconds`.
+bool EndsWithin(pid_t pid, int seconds) {
+  int fd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+  if (fd < 0) return errno == ESRCH;
+  pollfd ended = {fd, POLLIN, 0};
+  bool ok = poll(&ended, 1, seconds * 1000) == 1;
+  close(fd);
+  return ok;
 }
 
 // A file of `mb` megabytes that is not all one byte.
@@ -233,6 +276,8 @@ TEST_F(ToolsTest, ExitCodesNameTheFailedStage) {
   std::string open_pw = tmp_.Sub("open");
   WriteFile(open_pw, std::string(kPassword) + "\n");
   chmod(open_pw.c_str(), 0644);
+  std::string fifo_pw = tmp_.Sub("fifo");
+  ASSERT_EQ(0, mkfifo(fifo_pw.c_str(), 0600));
 
   ASSERT_EQ(kExitOk, RunProgram(tmp_.path(), Client(client, "docs")).code);
   struct Case {
@@ -251,9 +296,17 @@ TEST_F(ToolsTest, ExitCodesNameTheFailedStage) {
       {"pairing conflict", Client(other, "docs"), kExitPairing,
        "shares fed by another client: docs"},
       {"unknown share", Client(client, "nosuch"), kExitUsage, "no local share"},
+      // Refused before any data moves, in the server's own words.
+      {"task name the server refuses",
+       Client(client, "docs", {"--task", "t1 "}), kExitUsage,
+       "would be refused by the server"},
       {"readable password file",
        Client(client, "docs", {"--password-file", open_pw}), kExitUsage,
        "0600"},
+      // Refused at once: no writer ever opens it.
+      {"password file is a FIFO",
+       Client(client, "docs", {"--password-file", fifo_pw}), kExitUsage,
+       "not a regular file"},
   };
   for (const Case& c : cases) {
     Child r = RunProgram(tmp_.path(), c.argv);
@@ -276,16 +329,23 @@ TEST_F(ToolsTest, PasswordNeverOnACommandLineOrInTheLogs) {
   Child c =
       Spawn(tmp_.path(), argv, {std::string("S2S_PASSWORD=") + kPassword});
   int rsync_seen = 0;
+  bool environ_clean = true;
   int st = 0;
+  std::string environ_path = "/proc/" + std::to_string(c.pid) + "/environ";
   while (waitpid(c.pid, &st, WNOHANG) == 0) {
     for (const std::string& cmd : AllCommandLines()) {
       EXPECT_EQ(std::string::npos, cmd.find(kPassword)) << cmd;
       if (cmd.find("rsync") == 0 &&
           cmd.find(":" + port_) != std::string::npos) {
         ++rsync_seen;
+        // Past reading the password, the client's own environment block
+        // no longer holds it.
+        environ_clean = environ_clean &&
+                        !s2s_test::Has(ReadFile(environ_path), kPassword);
       }
     }
   }
+  EXPECT_TRUE(environ_clean) << "the password stayed in " << environ_path;
   c.out = ReadFile(c.out_path);
   c.err = ReadFile(c.err_path);
   ASSERT_TRUE(WIFEXITED(st) && WEXITSTATUS(st) == kExitOk) << c.out << c.err;
@@ -387,6 +447,40 @@ TEST_F(ToolsTest, SigtermCancelsARunningTransfer) {
   // The task is recorded as idle again; the share's sync stays unfinished.
   EXPECT_NE(std::string::npos, c.out.find("task t1: finished")) << c.out;
   EXPECT_EQ("CLIENT-A", ShareKey("big", "RunningID"));
+}
+
+// kill -9 of the client while it transfers and a beacon's command is in
+// flight: a second run of the task is refused while the first holds the
+// task's lock, the killed client's rsync runs end with it (the server gets
+// no file), and the next run clears what the killed one left behind.
+TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  WriteBlob(client + "/volume1/big/blob", 400);
+  Child c =
+      Spawn(tmp_.path(), Client(client, "big", {"--beacon-interval", "0"}));
+  std::vector<pid_t> rsyncs;
+  for (int waited = 0; waited < 20000 && rsyncs.size() < 2; waited += 2) {
+    rsyncs = RsyncChildren(c.pid);
+    SleepMs(2);
+  }
+  ASSERT_EQ(2u, rsyncs.size()) << "no transfer with a beacon beside it";
+
+  Child again = RunProgram(tmp_.path(), Client(client, "docs"));
+  EXPECT_EQ(kExitBusy, again.code) << again.out << again.err;
+  EXPECT_TRUE(s2s_test::Has(again.err, "is running already")) << again.err;
+
+  kill(c.pid, SIGKILL);
+  EXPECT_EQ(128 + SIGKILL, c.Wait());
+  for (pid_t pid : rsyncs) EXPECT_TRUE(EndsWithin(pid, 30)) << pid;
+  EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/big/blob"));
+  std::string tmp = client + "/tmp/S2S";
+  ASSERT_FALSE(std::filesystem::is_empty(tmp)) << "no command was running";
+
+  Child next = RunProgram(tmp_.path(), Client(client, "docs"));
+  EXPECT_EQ(kExitOk, next.code) << next.out << next.err;
+  for (const auto& e : std::filesystem::directory_iterator(tmp)) {
+    ADD_FAILURE() << "left behind: " << e.path();
+  }
 }
 
 // The platform's service "s2s_daemon" runs `s2s-client --daemon`, which

@@ -19,7 +19,9 @@ bool InstallCancelSignals() {
   struct sigaction sa = {};
   sa.sa_handler = OnSignal;
   sigemptyset(&sa.sa_mask);
-  sa.sa_flags = SA_RESTART;
+  // No SA_RESTART: a blocking call returns EINTR, so that every wait ends
+  // and its loop gets to look at the flag.
+  sa.sa_flags = 0;
   return sigaction(SIGINT, &sa, nullptr) == 0 &&
          sigaction(SIGTERM, &sa, nullptr) == 0;
 }

@@ -92,7 +92,8 @@ const char kUsage[] =
     "  3  server unreachable: no address answered, or no protocol version\n"
     "  4  pairing refused, or shares fed by another client\n"
     "  5  a share failed to start, transfer or finish\n"
-    "  6  cancelled by SIGINT or SIGTERM\n";
+    "  6  cancelled by SIGINT or SIGTERM\n"
+    "  7  another run of the task (or an rsync it left) is still running\n";
 
 bool Number(const char* name, const char* text, unsigned long long max,
             unsigned long long& out, std::string& error) {

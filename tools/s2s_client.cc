@@ -25,6 +25,7 @@
 #include "secret.h"
 #include "service/exit_codes.h"
 #include "service/task_runner.h"
+#include "task_lock.h"
 
 namespace {
 
@@ -125,6 +126,12 @@ int main(int argc, char** argv) {
   if (!ReadPassword(o.spec.password_file, password, error)) {
     fprintf(stderr, "s2s-client: %s\n", error.c_str());
     return kExitUsage;
+  }
+  TaskLock lock;
+  bool busy = false;
+  if (!lock.Take(o.spec.id, busy, error)) {
+    fprintf(stderr, "s2s-client: %s\n", error.c_str());
+    return busy ? kExitBusy : kExitLocal;
   }
   if (!MakeTempDir(error)) {
     fprintf(stderr, "s2s-client: %s\n", error.c_str());

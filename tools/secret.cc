@@ -7,6 +7,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+extern char** environ;
+
 namespace s2s_tools {
 
 const char kPasswordEnv[] = "S2S_PASSWORD";
@@ -17,7 +19,9 @@ const size_t kMaxPassword = 1024;
 
 bool ReadFile(const std::string& path, std::string& password,
               std::string& error) {
-  int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+  // O_NONBLOCK: opening a FIFO (or a device) must not wait for a writer;
+  // anything but a regular file is refused below, before it is read.
+  int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK);
   if (fd < 0) {
     error = "cannot open password file " + path + ": " + strerror(errno);
     return false;
@@ -55,6 +59,20 @@ bool ReadFile(const std::string& path, std::string& password,
   return true;
 }
 
+// Overwrites the value of every kPasswordEnv entry where it lies. unsetenv
+// only drops the pointer: the bytes of the block the program started with
+// stay readable in /proc/PID/environ for the whole run.
+void WipeFromEnvironment() {
+  const size_t name_len = strlen(kPasswordEnv);
+  for (char** e = environ; e != nullptr && *e != nullptr; ++e) {
+    if (strncmp(*e, kPasswordEnv, name_len) == 0 && (*e)[name_len] == '=') {
+      char* value = *e + name_len + 1;
+      explicit_bzero(value, strlen(value));
+    }
+  }
+  unsetenv(kPasswordEnv);
+}
+
 }  // namespace
 
 bool ReadPassword(const std::string& path, std::string& password,
@@ -62,7 +80,7 @@ bool ReadPassword(const std::string& path, std::string& password,
   std::string value;
   const char* env = getenv(kPasswordEnv);
   if (path.empty() && env != nullptr) value = env;
-  unsetenv(kPasswordEnv);
+  WipeFromEnvironment();
   if (!path.empty() && !ReadFile(path, value, error)) return false;
   if (value.empty()) {
     error = path.empty() ? std::string(

@@ -15,8 +15,10 @@ namespace s2s_tools {
 extern const char kPasswordEnv[];
 
 // Reads the password from `path` when it is not empty, else from the
-// variable kPasswordEnv, which is then removed from the environment so that
-// child processes do not inherit it. Returns true with `password` set, or
+// variable kPasswordEnv, whose value is then overwritten in place and the
+// variable removed, so that neither child processes nor /proc/PID/environ
+// show it. A path naming anything but a regular file (a FIFO, a device) is
+// refused without waiting on it. Returns true with `password` set, or
 // false with `error` saying why (the password itself is never in it).
 bool ReadPassword(const std::string& path, std::string& password,
                   std::string& error);
