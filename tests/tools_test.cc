@@ -7,7 +7,9 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
+#include <stdio.h>
 #include <stdlib.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -109,9 +111,10 @@ std::vector<std::string> AllCommandLines() {
   return out;
 }
 
-// The rsync processes whose parent is `parent`.
-std::vector<pid_t> RsyncChildren(pid_t parent) {
-  std::vector<pid_t> out;
+// The rsync processes whose parent is `parent`, with the session each is
+// in.
+std::vector<std::pair<pid_t, pid_t>> RsyncChildren(pid_t parent) {
+  std::vector<std::pair<pid_t, pid_t>> out;
   DIR* d = opendir("/proc");
   if (d == nullptr) return out;
   while (dirent* e = readdir(d)) {
@@ -122,9 +125,13 @@ std::vector<pid_t> RsyncChildren(pid_t parent) {
         close_paren == std::string::npos) {
       continue;
     }
-    // "pid (comm) state ppid ..."
-    if (atoi(stat.c_str() + close_paren + 4) == parent) {
-      out.push_back(atoi(e->d_name));
+    // "pid (comm) state ppid pgrp session ..."
+    char state;
+    int ppid, pgrp, session;
+    if (sscanf(stat.c_str() + close_paren + 1, " %c %d %d %d", &state, &ppid,
+               &pgrp, &session) == 4 &&
+        ppid == parent) {
+      out.emplace_back(atoi(e->d_name), session);
     }
   }
   closedir(d);
@@ -154,6 +161,21 @@ void WriteBlob(const std::string& path, int mb) {
 void SleepMs(int ms) {
   timespec ts = {ms / 1000, (ms % 1000) * 1000000L};
   nanosleep(&ts, nullptr);
+}
+
+// Whether the lock file `path` can be taken within `seconds`, that is,
+// every process holding it (inherited descriptors too) is gone. It is
+// released again before returning.
+bool LockFreedWithin(const std::string& path, int seconds) {
+  int fd = open(path.c_str(), O_RDWR | O_CLOEXEC);
+  bool free = false;
+  for (int waited = 0; fd >= 0 && !free && waited < seconds * 1000;
+       waited += 10) {
+    free = flock(fd, LOCK_EX | LOCK_NB) == 0;
+    if (!free) SleepMs(10);
+  }
+  if (fd >= 0) close(fd);
+  return free;
 }
 
 class ToolsTest : public ::testing::Test {
@@ -340,8 +362,8 @@ TEST_F(ToolsTest, PasswordNeverOnACommandLineOrInTheLogs) {
         ++rsync_seen;
         // Past reading the password, the client's own environment block
         // no longer holds it.
-        environ_clean = environ_clean &&
-                        !s2s_test::Has(ReadFile(environ_path), kPassword);
+        environ_clean =
+            environ_clean && !s2s_test::Has(ReadFile(environ_path), kPassword);
       }
     }
   }
@@ -458,12 +480,15 @@ TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
   WriteBlob(client + "/volume1/big/blob", 400);
   Child c =
       Spawn(tmp_.path(), Client(client, "big", {"--beacon-interval", "0"}));
-  std::vector<pid_t> rsyncs;
+  std::vector<std::pair<pid_t, pid_t>> rsyncs;
   for (int waited = 0; waited < 20000 && rsyncs.size() < 2; waited += 2) {
     rsyncs = RsyncChildren(c.pid);
     SleepMs(2);
   }
   ASSERT_EQ(2u, rsyncs.size()) << "no transfer with a beacon beside it";
+  for (const auto& r : rsyncs) {
+    EXPECT_EQ(r.first, r.second) << "rsync is not in a session of its own";
+  }
 
   Child again = RunProgram(tmp_.path(), Client(client, "docs"));
   EXPECT_EQ(kExitBusy, again.code) << again.out << again.err;
@@ -471,7 +496,10 @@ TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
 
   kill(c.pid, SIGKILL);
   EXPECT_EQ(128 + SIGKILL, c.Wait());
-  for (pid_t pid : rsyncs) EXPECT_TRUE(EndsWithin(pid, 30)) << pid;
+  for (const auto& r : rsyncs) EXPECT_TRUE(EndsWithin(r.first, 30));
+  // Whatever else the killed run started (the next beacon, rsync's own
+  // helpers) inherited the task's lock and dies with it too.
+  EXPECT_TRUE(LockFreedWithin(client + "/run/lock/s2s-task-1.lock", 30));
   EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/big/blob"));
   std::string tmp = client + "/tmp/S2S";
   ASSERT_FALSE(std::filesystem::is_empty(tmp)) << "no command was running";
