@@ -30,7 +30,9 @@ extern "C" {
  * between. */
 FILE* KLIBCPopen(const char* prog, const char* mode, ...);
 
-/* Closes a stream from KLIBCPopen and waits for its child. Returns the
+/* Closes a stream from KLIBCPopen and waits for its child; a child whose
+ * stream saw a read error (a signal interrupted the reader), or whose wait a
+ * signal interrupts, gets SIGTERM first. Returns the
  * child's exit status (0-255, or 128 + the signal that ended it), or -1 with
  * KERR_INVALID_ARG for a stream that KLIBCPopen did not return. */
 int KLIBCPclose(FILE* stream);

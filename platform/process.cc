@@ -88,10 +88,17 @@ extern "C" int KLIBCPclose(FILE* stream) {
     pid = it->second;
     Children().erase(it);
   }
+  // A stream that saw a read error was interrupted by a signal: the caller
+  // gave up on the program, which is ended rather than waited for (a name
+  // lookup may wait seconds for an answer). So is one whose wait a signal
+  // interrupts.
+  bool interrupted = ferror(stream) != 0;
   fclose(stream);
+  if (interrupted) kill(pid, SIGTERM);
   int status = 0;
   pid_t got;
   while ((got = waitpid(pid, &status, 0)) < 0 && errno == EINTR) {
+    kill(pid, SIGTERM);
   }
   if (got < 0) {
     KLIBCErrSet(KERR_SYSTEM);

@@ -1,9 +1,12 @@
 #include <gtest/gtest.h>
+#include <pthread.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <string>
+#include <thread>
 
 #include "karo_err.h"
 #include "karo_process.h"
@@ -45,6 +48,33 @@ TEST(PopenTest, ExitStatusAndWriting) {
   fputs("to the child", f);
   EXPECT_EQ(KLIBCPclose(f), 0);
   EXPECT_EQ(ReadFile(out), "to the child");
+}
+
+void Interrupt(int) {}
+
+// A signal that interrupts the reader (handled without SA_RESTART, as the
+// client does) ends the program too, instead of waiting out its run.
+TEST(PopenTest, SignalDuringTheReadEndsTheProgram) {
+  struct sigaction sa = {}, old_sa;
+  sa.sa_handler = Interrupt;
+  ASSERT_EQ(0, sigaction(SIGUSR1, &sa, &old_sa));
+  FILE* f = KLIBCPopen("sleep", "r", "60", static_cast<const char*>(nullptr));
+  ASSERT_NE(f, nullptr);
+  // Signals until one lands while fgets waits.
+  std::atomic<bool> read_over{false};
+  pthread_t reader = pthread_self();
+  std::thread signaller([&] {
+    while (!read_over) {
+      pthread_kill(reader, SIGUSR1);
+      usleep(10000);
+    }
+  });
+  char line[16];
+  EXPECT_EQ(nullptr, fgets(line, sizeof line, f));
+  read_over = true;
+  signaller.join();
+  EXPECT_EQ(128 + SIGTERM, KLIBCPclose(f));
+  sigaction(SIGUSR1, &old_sa, nullptr);
 }
 
 TEST(PopenTest, RefusesWhatItCannotRun) {
