@@ -22,6 +22,7 @@ packages=(
   libssl-dev openssl libboost-dev
   libgtest-dev libgmock-dev libbenchmark-dev
   rsync openssh-server openssh-client samba-common-bin acl tzdata
+  scdoc man-db lintian
 )
 
 install_missing() {

@@ -6,13 +6,22 @@
 # stopped by its own pid file and the directory is removed, also on failure.
 #
 #   tools/demo.sh [BUILD_DIR]     (default: build/ beside tools/)
+#   tools/demo.sh --installed     the installed programs, found along PATH
 set -euo pipefail
 
 top=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
-bin=$(cd "${1:-${S2S_BUILD_DIR:-$top/build}}" && pwd)
-client_bin=$bin/s2s-client
-server_bin=$bin/s2s-server
-for p in "$client_bin" "$server_bin" "$bin/s2s-cmd-handler"; do
+if [ "${1:-}" = --installed ]; then
+  PATH=$PATH:/usr/sbin:/sbin
+  client_bin=$(command -v s2s-client || echo "s2s-client (installed)")
+  server_bin=$(command -v s2s-server || echo "s2s-server (installed)")
+  handler_bin=$(command -v s2s-cmd-handler || echo "s2s-cmd-handler")
+else
+  bin=$(cd "${1:-${S2S_BUILD_DIR:-$top/build}}" && pwd)
+  client_bin=$bin/s2s-client
+  server_bin=$bin/s2s-server
+  handler_bin=$bin/s2s-cmd-handler
+fi
+for p in "$client_bin" "$server_bin" "$handler_bin"; do
   [ -x "$p" ] || { echo "demo: $p is missing; build first" >&2; exit 1; }
 done
 
@@ -41,22 +50,8 @@ port=$(sed -n 's/^daemon: pid [0-9]*, port \([0-9]*\)$/\1/p' <<<"$started")
 [ -n "$port" ] || { echo "demo: no daemon port" >&2; exit 1; }
 
 step "client appliance in $client"
-mkdir -p "$client/etc/s2s" "$client/volume1"
-cat >"$client/etc/s2s/platform.conf" <<CONF
-[Platform]
-	serial="DEMO-CLIENT-1"
-	hostname="office1"
-	lookup="hosts"
-CONF
-: >"$client/etc/s2s/shares.conf"
-for share in docs photos projects; do
-  mkdir -p "$client/volume1/$share"
-  cat >>"$client/etc/s2s/shares.conf" <<CONF
-[$share]
-	path="$client/volume1/$share"
-	volume="$client/volume1"
-CONF
-done
+"$client_bin" --root "$client" init --serial DEMO-CLIENT-1 --hostname office1 \
+  --share docs --share photos --share projects
 # Sample data: small trees with text, binary data, an empty directory, a
 # symbolic link and a hard link.
 d=$client/volume1
@@ -104,7 +99,7 @@ verify() {
 }
 
 step "first sync: s2s-client --root $client --task-file $task"
-"$bin/s2s-client" --root "$client" --task-file "$task"
+"$client_bin" --root "$client" --task-file "$task"
 
 step "server status"
 "$server_bin" --root "$server" status
@@ -116,7 +111,7 @@ step "change the client's data and sync again"
 rm "$d/photos/trip/img_2.raw"
 echo "Quarterly report 6" >"$d/docs/reports/2026/q6.txt"
 echo "int main(void) { return 0; }" >"$d/projects/s2s/src/main.c"
-"$bin/s2s-client" --root "$client" --task-file "$task"
+"$client_bin" --root "$client" --task-file "$task"
 verify
 
 step "pairing registry of the server"

@@ -1,0 +1,22 @@
+#!/bin/sh
+# Renders each manual page with man -l and fails on any warning of the
+# formatter or a page without its NAME section.
+#   check-man.sh DIR PAGE...
+set -u
+dir=$1
+shift
+status=0
+for page in "$@"; do
+  out=$(LC_ALL=C.UTF-8 MANWIDTH=80 man --warnings -l "$dir/$page" 2>&1 >/dev/null)
+  text=$(LC_ALL=C.UTF-8 MANWIDTH=80 man -l "$dir/$page" 2>/dev/null)
+  if [ -n "$out" ]; then
+    echo "$page: $out" >&2
+    status=1
+  elif ! printf '%s\n' "$text" | grep -q '^NAME'; then
+    echo "$page: no NAME section" >&2
+    status=1
+  else
+    echo "$page: renders ($(printf '%s\n' "$text" | wc -l) lines)"
+  fi
+done
+exit $status
