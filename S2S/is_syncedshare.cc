@@ -4,10 +4,16 @@
 
 #include <errno.h>
 #include <fcntl.h>
+#include <limits.h>
+#include <stdint.h>
+#include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
+
+#include <memory>
+#include <vector>
 
 #include "S2S/is_syncedshare_detail.h"
 #include "S2S/syslog_sink.h"
@@ -47,15 +53,53 @@ bool ReadTolerant(const std::string& file, const char* section, const char* key,
 
 std::string RegistryPath() { return KaroRootPath(kRegistryFile); }
 
-RegistryLock::RegistryLock() {
-  handle_ = KLIBCSemOpen(kRegistrySemKey);
-  if (handle_ < 0) return;
-  locked_ = KLIBCSemLock(handle_) == 0;
+int RegistrySemKey() {
+  std::string root = KaroRootPrefix();
+  if (root.empty()) return kRegistrySemKey;
+  // One root named by two paths must still share its lock.
+  char real[PATH_MAX];
+  if (realpath(root.c_str(), real) != nullptr) root = real;
+  if (root == "/") return kRegistrySemKey;
+  uint32_t h = 2166136261u;  // FNV-1a
+  for (unsigned char c : root) {
+    h ^= c;
+    h *= 16777619u;
+  }
+  // Positive, never IPC_PRIVATE (0), never the real root's key.
+  int key = static_cast<int>((h & 0x7ffffffeu) | 0x40000000u);
+  return key == kRegistrySemKey ? key + 2 : key;
+}
+
+namespace {
+// The lock as this thread holds it: the semaphore's handle and how many
+// RegistryLock objects of the thread share it.
+thread_local int held_handle = -1;
+thread_local int held_depth = 0;
+}  // namespace
+
+RegistryLock::RegistryLock(int timeout_ms) {
+  if (held_depth > 0) {
+    ++held_depth;
+    locked_ = true;
+    return;
+  }
+  int handle = KLIBCSemOpen(RegistrySemKey());
+  if (handle < 0) return;
+  if (KLIBCSemLockTimed(
+          handle, timeout_ms < 0 ? kRegistryLockWaitMs : timeout_ms) != 0) {
+    KLIBCSemClose(handle);
+    return;
+  }
+  locked_ = true;
+  held_handle = handle;
+  held_depth = 1;
 }
 
 RegistryLock::~RegistryLock() {
-  if (locked_) KLIBCSemUnlock(handle_);
-  if (handle_ >= 0) KLIBCSemClose(handle_);
+  if (!locked_ || --held_depth > 0) return;
+  KLIBCSemUnlock(held_handle);
+  KLIBCSemClose(held_handle);
+  held_handle = -1;
 }
 
 HashPtr LoadPairedClientInfo() {
@@ -148,6 +192,29 @@ using S2S::detail::HashPtr;
 using S2S::detail::kPairedClientInfo;
 using S2S::detail::RegistryLock;
 using S2S::detail::RegistryPath;
+
+namespace {
+// The locks of S2SRegistryLock, innermost last.
+thread_local std::vector<std::unique_ptr<RegistryLock>> explicit_locks;
+}  // namespace
+
+extern "C" int S2SRegistryLock(int timeoutMs) {
+  std::unique_ptr<RegistryLock> lock(new RegistryLock(timeoutMs));
+  if (!lock->Held()) {
+    S2S::detail::Syslog(
+        LOG_ERR, "registry lock not had within %d ms",
+        timeoutMs < 0 ? S2S::detail::kRegistryLockWaitMs : timeoutMs);
+    return -1;
+  }
+  explicit_locks.push_back(std::move(lock));
+  return 0;
+}
+
+extern "C" int S2SRegistryUnlock(void) {
+  if (explicit_locks.empty()) return -1;
+  explicit_locks.pop_back();
+  return 0;
+}
 
 extern "C" int S2SCheckServerInfo(void) {
   const std::string file = RegistryPath();

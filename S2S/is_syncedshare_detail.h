@@ -21,12 +21,19 @@ namespace S2S {
 namespace detail {
 
 const char kRegistryFile[] = "/usr/karo/etc/karoS2S.info";
+// The lock of the real root. A relocated root has a key of its own
+// (RegistrySemKey), so that unrelated roots on one machine never wait for
+// each other.
 const int kRegistrySemKey = 0x2980298;
+// How long a registry function waits for the lock before it fails.
+const int kRegistryLockWaitMs = 30000;
 const char kPairedClientInfo[] = "PairedClientInfo";
 const char kMultiSrcMarker[] = "S2SMULTI-SRC-SUPPORT";
 
 // The registry file resolved under the root.
 std::string RegistryPath();
+// The semaphore key of the current root.
+int RegistrySemKey();
 
 struct HashFree {
   void operator()(KSZHASH* hash) const { KLIBCSzHashFree(hash); }
@@ -39,17 +46,18 @@ struct StrPut {
 using StrPtr = std::unique_ptr<char, StrPut>;
 
 // Holds the registry semaphore for its lifetime. Held() is false when it
-// could not be opened or taken.
+// could not be opened or taken within `timeout_ms` (negative: the default
+// wait). A thread that already holds it takes it again without waiting, so
+// that a caller can hold it across several registry functions.
 class RegistryLock {
  public:
-  RegistryLock();
+  explicit RegistryLock(int timeout_ms = -1);
   ~RegistryLock();
   RegistryLock(const RegistryLock&) = delete;
   RegistryLock& operator=(const RegistryLock&) = delete;
   bool Held() const { return locked_; }
 
  private:
-  int handle_ = -1;
   bool locked_ = false;
 };
 

@@ -145,6 +145,9 @@ int KLIBCSemOpen(int key);
 /* Takes the semaphore, waiting as long as needed; the kernel gives it back if
  * the process dies holding it. 0, or -1 (KERR_LOCK). */
 int KLIBCSemLock(int handle);
+/* KLIBCSemLock waiting at most `timeout_ms` milliseconds (negative: as long
+ * as needed, 0: not at all). 0, or -1 (KERR_LOCK) when the time ran out. */
+int KLIBCSemLockTimed(int handle, int timeout_ms);
 /* Gives it back; only the holder may call it. 0, or -1 (KERR_LOCK). */
 int KLIBCSemUnlock(int handle);
 /* Forgets the handle (the semaphore itself stays for other processes);

@@ -75,6 +75,35 @@ extern "C" int KLIBCSemOpen(int key) {
 
 extern "C" int KLIBCSemLock(int handle) { return Op(handle, -1); }
 
+extern "C" int KLIBCSemLockTimed(int handle, int timeout_ms) {
+  if (timeout_ms < 0) return Op(handle, -1);
+  struct timespec deadline;
+  clock_gettime(CLOCK_MONOTONIC, &deadline);
+  deadline.tv_sec += timeout_ms / 1000;
+  deadline.tv_nsec += (timeout_ms % 1000) * 1000000L;
+  if (deadline.tv_nsec >= 1000000000L) {
+    deadline.tv_sec += 1;
+    deadline.tv_nsec -= 1000000000L;
+  }
+  struct sembuf op = {0, -1, SEM_UNDO};
+  for (;;) {
+    // semtimedop takes a relative wait: what is left after an interruption.
+    struct timespec now, left;
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    left.tv_sec = deadline.tv_sec - now.tv_sec;
+    left.tv_nsec = deadline.tv_nsec - now.tv_nsec;
+    if (left.tv_nsec < 0) {
+      left.tv_sec -= 1;
+      left.tv_nsec += 1000000000L;
+    }
+    if (left.tv_sec < 0) left = {0, 0};
+    if (semtimedop(handle, &op, 1, &left) == 0) return 0;
+    if (errno != EINTR) break;
+  }
+  KLIBCErrSet(KERR_LOCK);
+  return -1;
+}
+
 extern "C" int KLIBCSemUnlock(int handle) { return Op(handle, 1); }
 
 extern "C" int KLIBCSemClose(int handle) {

@@ -107,6 +107,7 @@ bool IsValidShareName(const std::string& name) {
 }
 
 bool IsValidTaskName(const std::string& name) {
+  // The registry's section names lose outer blanks: refused, not trimmed.
   return !name.empty() && name.size() <= 128 && name != "." && name != ".." &&
          name.front() != ' ' && name.back() != ' ' &&
          Printable(name, "/\\[]\"");

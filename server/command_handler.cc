@@ -1,10 +1,15 @@
 #include "command_handler.h"
 
+#include <errno.h>
+#include <fcntl.h>
+#include <string.h>
 #include <time.h>
+#include <unistd.h>
 
 #include <memory>
 
 #include "S2S/is_syncedshare.h"
+#include "karo_root.h"
 #include "karo_share.h"
 #include "protocol.h"
 
@@ -17,6 +22,10 @@ namespace server {
 namespace {
 
 const char kPairSection[] = "PairedClientInfo";
+const char kRegistryFile[] = "/usr/karo/etc/karoS2S.info";
+const char kInitialisedMarker[] = "/usr/karo/etc/karoS2S.initialised";
+// A client id's daemon user: section "CLIENTUSER_<id>", key "user".
+const char kClientUserSection[] = "CLIENTUSER_";
 
 struct HashFree {
   void operator()(KSZHASH* h) const { KLIBCSzHashFree(h); }
@@ -106,6 +115,30 @@ bool ServiceEnabled(int* status) {
     return false;
   }
   return true;
+}
+
+// The daemon user `client` is bound to, "" when unbound; false when the
+// registry cannot be read.
+bool BoundUser(const std::string& client, std::string* user) {
+  Hash h = ReadSection(kClientUserSection + client);
+  if (!h) return false;
+  *user = ValueOr(h.get(), "user");
+  return true;
+}
+
+// Binds an unbound `client` to the peer's daemon user.
+int BindClient(const std::string& client, const HandlerContext& ctx) {
+  std::string user;
+  if (!BoundUser(client, &user)) return kRegistryFailure;
+  if (!user.empty() || ctx.peer_user.empty()) return kOk;
+  Hash h(KLIBCSzHashAlloc(4));
+  std::string section = kClientUserSection + client;
+  if (!h || KLIBCSzHashSetValue(h.get(), "user", ctx.peer_user.c_str()) != 0 ||
+      S2SUpdateServerInfo(section.c_str(), h.get()) != 0) {
+    LOG_ERROR("cannot bind client %s to its daemon user", client.c_str());
+    return kRegistryFailure;
+  }
+  return kOk;
 }
 
 int Pairing(const CommandFile& cmd, std::string* answer) {
@@ -242,18 +275,24 @@ int SyncFinish(const CommandFile& cmd) {
                              {"RunningUser", ""}});
 }
 
-}  // namespace
-
-int HandleCommand(const CommandFile& cmd, const HandlerContext& ctx,
-                  std::string* answer) {
-  answer->clear();
-  if (!IsValidClientId(cmd.client_id)) {
-    LOG_WARNING("refused a command with a malformed client id");
-    return kBadId;
+// Runs a command other than the version query; the caller holds the
+// registry lock.
+int RunLocked(const CommandFile& cmd, const HandlerContext& ctx,
+              std::string* answer) {
+  bool has_registry = access(KaroRootPath(kRegistryFile).c_str(), F_OK) == 0;
+  bool marked = access(KaroRootPath(kInitialisedMarker).c_str(), F_OK) == 0;
+  if (has_registry && !marked) MarkRegistryInitialised();
+  if (!has_registry && marked) {
+    LOG_ERROR("the registry %s is gone; refusing commands until it is back",
+              KaroRootPath(kRegistryFile).c_str());
+    return kRegistryFailure;
   }
-  if (cmd.command == "S2S_GetProtocolVer" && !ctx.old_server) {
-    *answer = std::to_string(kProtocolVersion) + "\n";
-    return kOk;
+  std::string bound;
+  if (!BoundUser(cmd.client_id, &bound)) return kRegistryFailure;
+  if (!bound.empty() && bound != ctx.peer_user) {
+    LOG_WARNING("client %s belongs to another daemon user than %s",
+                cmd.client_id.c_str(), ctx.peer_user.c_str());
+    return kBadId;
   }
   int status;
   if (cmd.command == "S2S_Pairing") {
@@ -268,6 +307,47 @@ int HandleCommand(const CommandFile& cmd, const HandlerContext& ctx,
     status = SyncFinish(cmd);
   } else {
     status = kUnknownCommand;
+  }
+  const std::string* dry = cmd.Get("dryRun");
+  bool binds =
+      cmd.command == "S2S_SyncStart" ||
+      ((cmd.command == "S2S_Pairing" || cmd.command == "S2S_PairingMultiSrc") &&
+       dry != nullptr && *dry == "no");
+  if (status == kOk && binds) status = BindClient(cmd.client_id, ctx);
+  return status;
+}
+
+}  // namespace
+
+int HandleCommand(const CommandFile& cmd, const HandlerContext& ctx,
+                  std::string* answer) {
+  answer->clear();
+  if (!IsValidClientId(cmd.client_id)) {
+    LOG_WARNING("refused a command with a malformed client id");
+    return kBadId;
+  }
+  if (cmd.command == "S2S_GetProtocolVer" && !ctx.old_server) {
+    *answer = std::to_string(kProtocolVersion) + "\n";
+    return kOk;
+  }
+  int wait_ms = -1;
+  if (ctx.deadline != 0) {
+    time_t left = ctx.deadline - time(nullptr);
+    if (left <= 0) {
+      LOG_WARNING("%s from client %s not applied: its client has given up",
+                  cmd.command.c_str(), cmd.client_id.c_str());
+      return kRegistryFailure;
+    }
+    wait_ms = static_cast<int>(left < 3600 ? left * 1000 : 3600 * 1000);
+  }
+  int status;
+  if (S2SRegistryLock(wait_ms) != 0) {
+    LOG_ERROR("%s from client %s not applied: the registry stays locked",
+              cmd.command.c_str(), cmd.client_id.c_str());
+    status = kRegistryFailure;
+  } else {
+    status = RunLocked(cmd, ctx, answer);
+    S2SRegistryUnlock();
   }
   if (status != kOk) {
     LOG_NOTE("%s from client %s answered with status %d", cmd.command.c_str(),
@@ -295,6 +375,17 @@ bool MayPushShare(const std::string& share, const HandlerContext& ctx,
     return false;
   }
   return true;
+}
+
+int MarkRegistryInitialised() {
+  std::string marker = KaroRootPath(kInitialisedMarker);
+  int fd = open(marker.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
+  if (fd < 0) {
+    LOG_ERROR("cannot write %s: %s", marker.c_str(), strerror(errno));
+    return -1;
+  }
+  close(fd);
+  return 0;
 }
 
 }  // namespace server

@@ -8,6 +8,8 @@
 #ifndef S2S_SERVER_COMMAND_HANDLER_H_
 #define S2S_SERVER_COMMAND_HANDLER_H_
 
+#include <time.h>
+
 #include <string>
 
 #include "command_file.h"
@@ -23,10 +25,20 @@ struct HandlerContext {
   // user it logged in as. Recorded at sync start, checked for data pushes.
   std::string peer_address;
   std::string peer_user;
+  // When the client stops waiting for the answer (seconds since the epoch),
+  // or 0 for no limit beyond the registry's own lock wait. A command that
+  // cannot have the registry lock before then is not applied.
+  time_t deadline = 0;
 };
 
 // Runs `cmd`. Returns a protocol status (protocol.h); `answer` receives the
 // text that follows the status line (possibly empty). Failures are logged.
+//
+// Every command but the version query runs under the registry lock, from
+// its checks to its writes. A client id is bound to the daemon user of its
+// first pairing or sync start ("CLIENTUSER_<id>"); a command that names it
+// from another daemon user gets kBadId. A registry that vanished from a root
+// that had one gets kRegistryFailure rather than a fresh, open registry.
 int HandleCommand(const CommandFile& cmd, const HandlerContext& ctx,
                   std::string* answer);
 
@@ -35,6 +47,10 @@ int HandleCommand(const CommandFile& cmd, const HandlerContext& ctx,
 // Returns true when allowed; `why` says why not.
 bool MayPushShare(const std::string& share, const HandlerContext& ctx,
                   std::string* why);
+
+// Records that this root has a registry (a marker beside it), so that its
+// disappearance is noticed. Returns 0, or -1 (logged).
+int MarkRegistryInitialised();
 
 }  // namespace server
 }  // namespace S2S

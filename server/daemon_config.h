@@ -5,13 +5,14 @@
 // encrypted one, whose module is its encrypted lower directory), each
 // guarded by the handler's "data" hook; "s2scmd" (command replies, with the
 // early/pre/post hooks), "s2sspool" (write-only upload of large commands)
-// and "s2skeys" (the key-file directory). All modules require the one daemon
-// user; the daemon keeps owners and modes with `fake super` unless it runs
-// as root.
+// and "s2skeys" (the key-file directory, guarded by the "keys" hook). All
+// modules require the daemon users; each has a connection limit and refuses
+// the options it has no use for (deletes everywhere but the share modules).
 #ifndef S2S_SERVER_DAEMON_CONFIG_H_
 #define S2S_SERVER_DAEMON_CONFIG_H_
 
 #include <sys/types.h>
+#include <unistd.h>
 
 #include <string>
 
@@ -21,12 +22,16 @@ namespace server {
 struct DaemonConfig {
   // Absolute path of the command handler program the hooks run.
   std::string handler;
-  // The one daemon user and its password (goes only to the secrets file).
+  // A daemon user and its password (goes only to the secrets file). Users
+  // already in the secrets file stay; this one is added or replaced.
   std::string user;
   std::string password;
-  // Who the daemon's transfers run as.
+  // Who the daemon's transfers run as, when the daemon is started by root.
   uid_t uid = 0;
   gid_t gid = 0;
+  // Whether root starts the daemon. Otherwise it runs as whoever starts it:
+  // no uid or gid lines (which would need setgroups) and no `fake super`.
+  bool as_root = geteuid() == 0;
   // The handler behaves as an old server (protocol version 0).
   bool old_server = false;
 };
@@ -35,6 +40,7 @@ struct DaemonConfig {
 std::string DaemonConfigPath();   // /etc/s2s/rsyncd.conf
 std::string DaemonSecretsPath();  // /etc/s2s/rsyncd.secrets
 std::string DaemonPidPath();      // /var/run/rsyncd.pid
+std::string DaemonLockPath();     // /var/run/rsyncd.lock (max connections)
 
 // Writes both files (the secrets file with mode 0600) and creates the spool
 // directories. Returns 0, or -1 (logged) when a value cannot be written

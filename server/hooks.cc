@@ -1,14 +1,17 @@
 #include "hooks.h"
 
+#include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
+#include <time.h>
 #include <unistd.h>
 
 #include "command_file.h"
 #include "karo_root.h"
+#include "karo_share.h"
 #include "protocol.h"
 
 #define S2S_LOG_AREA "server"
@@ -31,9 +34,15 @@ bool IsPid(const std::string& s) {
 
 // Reads at most `limit` + 1 bytes, so that an oversized file is noticed
 // without reading all of it. O_NOFOLLOW: spool names are ours, never links.
+// Only regular files: an uploaded FIFO must not block the hook.
 bool ReadLimited(const std::string& path, size_t limit, std::string* out) {
-  int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC);
+  int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
   if (fd < 0) return false;
+  struct stat st;
+  if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+    close(fd);
+    return false;
+  }
   out->clear();
   char buf[8192];
   ssize_t n;
@@ -48,24 +57,65 @@ bool ReadLimited(const std::string& path, size_t limit, std::string* out) {
 
 bool WriteNew(const std::string& path, const std::string& data) {
   int fd = open(path.c_str(),
-                O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644);
+                O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600);
   if (fd < 0) return false;
   bool ok =
       write(fd, data.data(), data.size()) == static_cast<ssize_t>(data.size());
   return close(fd) == 0 && ok;
 }
 
-// The request id of a pull of "s2scmd/<id>", or "".
-std::string RequestId(const std::string& request) {
-  std::string prefix = std::string(kCommandModule) + "/";
+// The path of a request "<module>/<path>" for `module`, or "".
+std::string RequestPath(const std::string& request, const char* module) {
+  std::string prefix = std::string(module) + "/";
   if (request.compare(0, prefix.size(), prefix) != 0) return "";
-  std::string id = request.substr(prefix.size());
+  return request.substr(prefix.size());
+}
+
+// The request id of a transfer of "<module>/<id>", or "".
+std::string RequestId(const std::string& request, const char* module) {
+  std::string id = RequestPath(request, module);
   return IsValidRequestId(id) ? id : "";
 }
 
-// Reads and runs the command; the status and answer for the reply.
+// Calls `fn(path, stat)` for each entry of `dir` but "." and "..".
+template <typename Fn>
+void ForEachEntry(const std::string& dir, Fn fn) {
+  DIR* d = opendir(dir.c_str());
+  if (d == nullptr) return;
+  while (dirent* e = readdir(d)) {
+    std::string name = e->d_name;
+    if (name == "." || name == "..") continue;
+    std::string path = dir + "/" + name;
+    struct stat st;
+    if (lstat(path.c_str(), &st) == 0) fn(path, st);
+  }
+  closedir(d);
+}
+
+// Removes a file, or a directory tree that should never have been there.
+void RemoveEntry(const std::string& path, const struct stat& st) {
+  if (S_ISDIR(st.st_mode)) {
+    ForEachEntry(path, RemoveEntry);
+    rmdir(path.c_str());
+  } else {
+    unlink(path.c_str());
+  }
+}
+
+// Entries of a crashed or abandoned connection: older than any command may
+// take.
+void PruneStale(const std::string& dir) {
+  time_t oldest = time(nullptr) - kSpoolStaleSeconds;
+  ForEachEntry(dir, [oldest](const std::string& path, const struct stat& st) {
+    if (st.st_mtime < oldest) RemoveEntry(path, st);
+  });
+}
+
+// Reads and runs the command, which arrived at `arrival`; the status and
+// answer for the reply.
 int RunCommand(const std::string& text, const std::string& id,
-               const HookEnv& env, bool old_server, std::string* answer) {
+               const HookEnv& env, bool old_server, time_t arrival,
+               std::string* answer) {
   CommandFile cmd;
   std::string why;
   if (ParseCommandFile(text, &cmd, &why) != kOk) {
@@ -86,6 +136,7 @@ int RunCommand(const std::string& text, const std::string& id,
   ctx.old_server = old_server;
   ctx.peer_address = env.host_addr;
   ctx.peer_user = env.user;
+  ctx.deadline = arrival + kCommandBudgetSeconds;
   return HandleCommand(cmd, ctx, answer);
 }
 
@@ -127,15 +178,24 @@ int EarlyHook(const HookEnv& env, FILE* in) {
   return 0;
 }
 
-int PreHook(const HookEnv& env, bool old_server) {
-  std::string id = RequestId(env.request);
+int PreHook(const HookEnv& env, bool old_server, FILE* out) {
+  std::string id = RequestId(env.request, kCommandModule);
   if (!IsPid(env.pid) || id.empty()) {
     LOG_WARNING("refused a command pull from %s: bad request",
                 env.host_addr.c_str());
+    // With a reason the client's rsync reports a refusal (exit 4) rather
+    // than a dropped connection.
+    if (out != nullptr) fprintf(out, "malformed request id\n");
     return 1;
+  }
+  for (const std::string& dir : {EarlyDir(), UploadDir(), ReplyDir()}) {
+    PruneStale(dir);
   }
   std::string text;
   std::string early = EarlyDir() + "/" + env.pid;
+  // The connection began when its early input was spooled.
+  struct stat st;
+  time_t arrival = stat(early.c_str(), &st) == 0 ? st.st_mtime : time(nullptr);
   if (!ReadLimited(early, kMaxCommandFile, &text) || text.empty()) {
     ReadLimited(UploadDir() + "/" + id, kMaxCommandFile, &text);
   }
@@ -144,8 +204,9 @@ int PreHook(const HookEnv& env, bool old_server) {
   unlink(mark.c_str());
   WriteNew(mark, id);
   std::string answer;
-  int status = text.empty() ? kMalformed
-                            : RunCommand(text, id, env, old_server, &answer);
+  int status = text.empty()
+                   ? kMalformed
+                   : RunCommand(text, id, env, old_server, arrival, &answer);
   std::string reply = "status=" + std::to_string(status) + "\n" + answer;
   std::string path = ReplyDir() + "/" + id;
   if (!WriteNew(path, reply)) {
@@ -165,6 +226,74 @@ int PostHook(const HookEnv& env) {
   }
   unlink((early + ".id").c_str());
   unlink(early.c_str());
+  return 0;
+}
+
+int UploadHook(const HookEnv& env, FILE* out) {
+  PruneStale(UploadDir());
+  UploadDoneHook();
+  std::string id = RequestId(env.request, kSpoolModule);
+  const char* why = nullptr;
+  struct stat st;
+  off_t used = 0;
+  ForEachEntry(UploadDir(), [&used](const std::string&, const struct stat& e) {
+    used += e.st_size;
+  });
+  if (id.empty()) {
+    why = "an upload names one file by its request id";
+  } else if (lstat((UploadDir() + "/" + id).c_str(), &st) == 0) {
+    why = "an upload of this request id is already there";
+  } else if (used >= static_cast<off_t>(kMaxSpool)) {
+    why = "the upload spool is full";
+  }
+  if (why != nullptr) {
+    LOG_WARNING("refused an upload from %s: %s", env.host_addr.c_str(), why);
+    fprintf(out, "%s\n", why);
+    return 1;
+  }
+  return 0;
+}
+
+int UploadDoneHook() {
+  ForEachEntry(UploadDir(), [](const std::string& path, const struct stat& st) {
+    if (!S_ISREG(st.st_mode) ||
+        st.st_size > static_cast<off_t>(kMaxCommandFile)) {
+      LOG_WARNING("removed %s from the upload spool: not a command file",
+                  path.c_str());
+      RemoveEntry(path, st);
+    }
+  });
+  return 0;
+}
+
+// A key file is a plain file named after its share; anything else in the
+// key directory was pushed there in spite of the module's filter.
+void RemoveNonKeys() {
+  ForEachEntry(KaroRootPath(KARO_SHARE_KEY_DIR),
+               [](const std::string& path, const struct stat& st) {
+                 if (!S_ISREG(st.st_mode)) RemoveEntry(path, st);
+               });
+}
+
+int KeyHook(const HookEnv& env, FILE* out) {
+  RemoveNonKeys();
+  // The key file of one share, named after it: "s2skeys/<share>".
+  std::string share = RequestPath(env.request, kKeyModule);
+  HandlerContext ctx;
+  ctx.peer_address = env.host_addr;
+  ctx.peer_user = env.user;
+  std::string why;
+  if (!MayPushShare(share, ctx, &why)) {
+    LOG_WARNING("refused a key push into '%s' from %s: %s", env.request.c_str(),
+                env.host_addr.c_str(), why.c_str());
+    fprintf(out, "%s\n", why.c_str());
+    return 1;
+  }
+  return 0;
+}
+
+int KeyDoneHook() {
+  RemoveNonKeys();
   return 0;
 }
 

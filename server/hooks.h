@@ -7,6 +7,16 @@
 //   post   (s2scmd, post-xfer exec) removes the spool, upload and reply
 //   data   (share modules, pre-xfer exec) lets a push through only from the
 //          client holding the share's running sync
+//   keys   (s2skeys, pre-xfer exec) the same for the key file of one share,
+//          "s2skeys/<share>"
+//   keys-done (s2skeys, post-xfer exec) removes from the key directory
+//          what is not a plain file
+//   upload (s2sspool, pre-xfer exec) admits one new file named by a request
+//          id while the spool has room
+//   upload-done (s2sspool, post-xfer exec) removes from the spool what is
+//          not a command file (too large, not a regular file)
+//
+// Every spool hook first removes entries older than kSpoolStaleSeconds.
 //
 // Inputs come from the daemon's environment (RSYNC_PID, RSYNC_REQUEST,
 // RSYNC_MODULE_NAME, RSYNC_HOST_ADDR, RSYNC_USER_NAME) and are validated
@@ -39,10 +49,15 @@ std::string UploadDir();
 std::string ReplyDir();
 
 int EarlyHook(const HookEnv& env, FILE* in);
-int PreHook(const HookEnv& env, bool old_server);
+// `out`, when given, receives a refusal of the request itself.
+int PreHook(const HookEnv& env, bool old_server, FILE* out = nullptr);
 int PostHook(const HookEnv& env);
 // `out` receives the refusal, which the daemon shows the client.
 int DataHook(const HookEnv& env, FILE* out);
+int KeyHook(const HookEnv& env, FILE* out);
+int KeyDoneHook();
+int UploadHook(const HookEnv& env, FILE* out);
+int UploadDoneHook();
 
 }  // namespace server
 }  // namespace S2S

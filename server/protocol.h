@@ -30,6 +30,15 @@ enum Status : int {
 // bytes; larger ones come through the spool module).
 const size_t kMaxCommandFile = 64 * 1024;
 
+// How long after its arrival a command may still be applied. The client
+// waits 60 seconds for an answer; what is left is for the reply's way back.
+const int kCommandBudgetSeconds = 50;
+
+// The upload spool: what all pending uploads may hold together, and the age
+// after which an entry of any spool directory is abandoned and removed.
+const size_t kMaxSpool = 64 * kMaxCommandFile;
+const int kSpoolStaleSeconds = 600;
+
 // The protocol version "S2S_GetProtocolVer" reports; above 0 means
 // multi-source pairing.
 const int kProtocolVersion = 1;

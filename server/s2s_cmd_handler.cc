@@ -1,6 +1,6 @@
 // s2s-cmd-handler: the program the server's rsync daemon runs from its hooks.
 //
-//   s2s-cmd-handler [--root DIR] [--old-server] early|pre|post|data
+//   s2s-cmd-handler [--root DIR] [--old-server] MODE
 //   s2s-cmd-handler --help | --version
 //
 // --root sets the appliance root (as S2S_ROOT does) for the registry, the
@@ -16,7 +16,7 @@
 namespace {
 
 const char kHelp[] =
-    "usage: s2s-cmd-handler [--root DIR] [--old-server] early|pre|post|data\n"
+    "usage: s2s-cmd-handler [--root DIR] [--old-server] MODE\n"
     "       s2s-cmd-handler --help | --version\n"
     "\n"
     "Run by the server's rsync daemon from the hooks of its configuration\n"
@@ -26,6 +26,10 @@ const char kHelp[] =
     "  post   removes the connection's spool, upload and reply files\n"
     "  data   lets a push into a share through only from the client that\n"
     "         holds the share's running sync\n"
+    "  keys   the same for the share's key file in the key module\n"
+    "  keys-done    removes what is not a plain file from the key directory\n"
+    "  upload       admits one new command file per request id to the spool\n"
+    "  upload-done  removes oversized or non-regular files from the spool\n"
     "\n"
     "  --root DIR     appliance root (as $S2S_ROOT) of the registry, shares\n"
     "                 and spool directories\n"
@@ -61,7 +65,8 @@ int main(int argc, char** argv) {
   }
   if (mode == nullptr) {
     fprintf(stderr,
-            "usage: %s [--root DIR] [--old-server] early|pre|post|data\n",
+            "usage: %s [--root DIR] [--old-server] "
+            "early|pre|post|data|keys|keys-done|upload|upload-done\n",
             argv[0]);
     return 2;
   }
@@ -69,9 +74,13 @@ int main(int argc, char** argv) {
   using namespace S2S::server;
   HookEnv env = HookEnv::FromEnvironment();
   if (strcmp(mode, "early") == 0) return EarlyHook(env, stdin);
-  if (strcmp(mode, "pre") == 0) return PreHook(env, old_server);
+  if (strcmp(mode, "pre") == 0) return PreHook(env, old_server, stdout);
   if (strcmp(mode, "post") == 0) return PostHook(env);
   if (strcmp(mode, "data") == 0) return DataHook(env, stdout);
+  if (strcmp(mode, "keys") == 0) return KeyHook(env, stdout);
+  if (strcmp(mode, "keys-done") == 0) return KeyDoneHook();
+  if (strcmp(mode, "upload") == 0) return UploadHook(env, stdout);
+  if (strcmp(mode, "upload-done") == 0) return UploadDoneHook();
   fprintf(stderr, "%s: unknown mode %s\n", argv[0], mode);
   return 2;
 }

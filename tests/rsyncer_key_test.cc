@@ -23,18 +23,22 @@ class RsyncerKeyTest : public ::testing::Test {
     ASSERT_TRUE(app_.AddShare("docs"));
     ASSERT_TRUE(app_.AddShare("vault", /*encrypted=*/true));
     ASSERT_TRUE(app_.AddShare("nokey", /*encrypted=*/true));
+    ASSERT_TRUE(WriteFile(
+        app_.server_root() + "/etc/s2s/shares.conf",
+        ReadFile(app_.server_root() + "/etc/s2s/shares.conf") +
+            "[auto]\n\tpath=\"" + app_.server_root() + "/data/auto\"\n"));
     ASSERT_TRUE(app_.StartServer()) << app_.DaemonLog();
     std::string ssh = app_.client_root() + "/etc/s2s/ssh";
     ASSERT_TRUE(sshd_.Start("rsync --server --daemon --config=" +
                                 app_.server_root() + "/etc/s2s/rsyncd.conf .",
                             ssh + "/id_ed25519", ssh + "/known_hosts"));
     // A share decrypted at start-up keeps its key elsewhere.
-    std::string conf =
-        ReadFile(app_.client_root() + "/etc/s2s/shares.conf") +
-        "[auto]\n\tpath=\"" + app_.client_root() +
-        "/data/auto\"\n\tencrypted=\"yes\"\n\tauto_mount=\"yes\"\n"
-        "\tauto_key_file=\"" +
-        app_.client_root() + "/keys/auto.stored\"\n";
+    std::string conf = ReadFile(app_.client_root() + "/etc/s2s/shares.conf") +
+                       "[auto]\n\tpath=\"" + app_.client_root() +
+                       "/data/auto\"\n\tvolume=\"/"
+                       "volume1\"\n\tencrypted=\"yes\"\n\tauto_mount=\"yes\"\n"
+                       "\tauto_key_file=\"" +
+                       app_.client_root() + "/keys/auto.stored\"\n";
     ASSERT_TRUE(WriteFile(app_.client_root() + "/etc/s2s/shares.conf", conf));
     ASSERT_TRUE(WriteFile(app_.ClientKeyFile("vault"), "vault key material"));
     ASSERT_TRUE(WriteFile(app_.client_root() + "/keys/auto.stored", "auto"));
@@ -52,6 +56,14 @@ class RsyncerKeyTest : public ::testing::Test {
 
 TEST_F(RsyncerKeyTest, KeyFilesTravelOverSshEvenWithSshOff) {
   ASSERT_FALSE(r_.GetSyncInfo().UseSSH());
+  // The key module takes a share's key only from the client syncing it.
+  EXPECT_NE(0, r_.SyncEncryptKey("vault"));
+  EXPECT_FALSE(fs::exists(app_.ServerKeyDir() + "/vault"));
+  for (const char* share : {"vault", "auto"}) {
+    int status = -1;
+    ASSERT_EQ(0, r_.StartSyncShare(share, status));
+    ASSERT_EQ(0, status) << share;
+  }
   LogCapture log;
   EXPECT_EQ(0, r_.SyncEncryptKey("vault"));
   // Key contents never reach the log.

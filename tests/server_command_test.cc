@@ -1,10 +1,16 @@
 // The server's command handler on untrusted input: command files, ids and
 // hook requests that must be refused before they touch a path or the
 // registry.
+#include <sched.h>
 #include <sys/stat.h>
+#include <sys/time.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <filesystem>
+#include <thread>
 
+#include "S2S/is_syncedshare.h"
 #include "command_file.h"
 #include "command_handler.h"
 #include "gtest/gtest.h"
@@ -15,6 +21,7 @@
 namespace {
 
 using namespace S2S::server;
+using s2s_test::Has;
 using s2s_test::ReadFile;
 using s2s_test::WriteFile;
 
@@ -63,12 +70,16 @@ TEST(CommandFile, IdsThatCouldEscapeAPathAreRefused) {
   }
   EXPECT_TRUE(IsValidClientId("0011.2233-AB_c"));
   EXPECT_TRUE(IsValidRequestId("0123456789abcdef0123456789abcdef"));
-  for (const char* name :
-       {"", ".", "..", "a/b", "../etc", "a:b", "a]b", "a\"b", "a\nb"}) {
+  for (std::string name : {"", ".", "..", "a/b", "../etc", "a:b", "a]b", "a\"b",
+                           "a\nb", "a ", " a"}) {
     EXPECT_FALSE(IsValidShareName(name)) << name;
   }
+  EXPECT_FALSE(IsValidShareName(std::string("a\0b", 3)));
   EXPECT_TRUE(IsValidShareName("Public Data"));
-  EXPECT_FALSE(IsValidTaskName("t/../x"));
+  for (std::string name : {std::string("t/../x"), std::string("t "),
+                           std::string(" t"), std::string("t\0u", 3)}) {
+    EXPECT_FALSE(IsValidTaskName(name)) << name;
+  }
   EXPECT_FALSE(IsValidTaskName(std::string(129, 't')));
   EXPECT_TRUE(IsValidTaskName("nightly task"));
 }
@@ -85,6 +96,23 @@ class HookTest : public ::testing::Test {
   }
   std::string Registry() {
     return ReadFile(tmp_.path() + "/usr/karo/etc/karoS2S.info");
+  }
+  void DeclareShares(const std::vector<std::string>& names) {
+    std::string conf;
+    for (const std::string& n : names) {
+      conf += "[" + n + "]\n\tpath=\"" + tmp_.Sub(n) + "\"\n";
+    }
+    std::filesystem::create_directories(tmp_.Sub("etc/s2s"));
+    WriteFile(tmp_.Sub("etc/s2s/shares.conf"), conf);
+  }
+  // Runs `text` as request `id` through the pre hook; the reply's status.
+  int Status(const std::string& text, const std::string& id) {
+    if (Pull(text + "requestID=\"" + id + "\"\n", "s2scmd/" + id) != 0) {
+      return -1;
+    }
+    std::string reply = ReadFile(ReplyDir() + "/" + id);
+    return reply.compare(0, 7, "status=") == 0 ? std::stoi(reply.substr(7))
+                                               : -1;
   }
   // Spools `text` as this connection's early input and runs the pre hook.
   int Pull(const std::string& text, const std::string& request) {
@@ -127,6 +155,14 @@ TEST_F(HookTest, BadCommandsGetAClearStatusAndWriteNothing) {
        "serverName=\"s\"\n",
        kMalformed},
       {"command=\"S2S_Nonsense\"\nclientID=\"c\"\n", kUnknownCommand},
+      // Refused, not truncated at the NUL or trimmed.
+      {"command=\"S2S_SyncStart\"\nclientID=\"c\"\nvolumeName=\"v\"\n"
+       "shareName=\"a" +
+           std::string(1, '\0') + "b\"\n",
+       kBadId},
+      {"command=\"S2S_UpdateTaskStatus\"\nclientID=\"c\"\n"
+       "taskName=\"t \"\n",
+       kBadId},
   };
   int n = 0;
   for (const Case& c : cases) {
@@ -149,11 +185,150 @@ TEST_F(HookTest, PostHookRemovesSpoolUploadAndReply) {
       "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\nrequestID=\"r1\"\n";
   ASSERT_EQ(0, Pull(cmd, "s2scmd/r1"));
   EXPECT_EQ("status=0\n1\n", ReadFile(ReplyDir() + "/r1"));
+  struct stat st;
+  ASSERT_EQ(0, stat((ReplyDir() + "/r1").c_str(), &st));
+  EXPECT_EQ(0600u, st.st_mode & 0777);
   WriteFile(UploadDir() + "/r1", cmd);
   EXPECT_EQ(0, PostHook(env_));
   EXPECT_TRUE(std::filesystem::is_empty(ReplyDir()));
   EXPECT_TRUE(std::filesystem::is_empty(UploadDir()));
   EXPECT_TRUE(std::filesystem::is_empty(EarlyDir()));
+}
+
+TEST_F(HookTest, ClientIdStaysWithItsDaemonUserAndALostRegistryStaysLost) {
+  DeclareShares({"s"});
+  const std::string pair =
+      "command=\"S2S_Pairing\"\nclientID=\"CL1\"\ndryRun=\"no\"\n"
+      "serverName=\"srv\"\n";
+  const std::string start =
+      "command=\"S2S_SyncStart\"\nclientID=\"CL1\"\nvolumeName=\"v\"\n"
+      "shareName=\"s\"\n";
+  env_.user = "u1";
+  EXPECT_EQ(kOk, Status(pair, "p1"));
+  // Another daemon user naming CL1 gets nothing, whatever the command.
+  env_.user = "u2";
+  EXPECT_EQ(kBadId, Status(start, "s1"));
+  EXPECT_EQ(kBadId, Status(pair, "p2"));
+  env_.user = "u1";
+  EXPECT_EQ(kOk, Status(start, "s2"));
+  // The registry vanishes: refused, and not recreated open.
+  ASSERT_EQ(0, unlink((tmp_.path() + "/usr/karo/etc/karoS2S.info").c_str()));
+  env_.user = "u2";
+  EXPECT_EQ(kRegistryFailure,
+            Status("command=\"S2S_Pairing\"\nclientID=\"CL9\"\n"
+                   "dryRun=\"no\"\nserverName=\"x\"\n",
+                   "p3"));
+  EXPECT_FALSE(
+      std::filesystem::exists(tmp_.path() + "/usr/karo/etc/karoS2S.info"));
+}
+
+TEST_F(HookTest, ParallelSyncStartsForAFreeShareHaveOneWinner) {
+  const int kRounds = 5, kRacers = 8;
+  std::vector<std::string> shares;
+  for (int r = 0; r < kRounds; ++r) shares.push_back("r" + std::to_string(r));
+  DeclareShares(shares);
+  for (const std::string& share : shares) {
+    int go[2];
+    ASSERT_EQ(0, pipe(go));
+    std::vector<pid_t> racers;
+    for (int i = 0; i < kRacers; ++i) {
+      pid_t pid = fork();
+      ASSERT_GE(pid, 0);
+      if (pid == 0) {
+        close(go[1]);
+        char c;
+        if (read(go[0], &c, 1) != 0) _exit(2);
+        CommandFile cmd;
+        cmd.command = "S2S_SyncStart";
+        cmd.client_id = "racer" + std::to_string(i);
+        cmd.params = {{"volumeName", "v"}, {"shareName", share}};
+        HandlerContext ctx;
+        ctx.peer_user = "u" + std::to_string(i);
+        std::string answer;
+        _exit(HandleCommand(cmd, ctx, &answer) == kOk ? 0 : 1);
+      }
+      racers.push_back(pid);
+    }
+    close(go[0]);
+    close(go[1]);  // all start at once
+    int winners = 0;
+    for (pid_t pid : racers) {
+      int st = 0;
+      waitpid(pid, &st, 0);
+      ASSERT_TRUE(WIFEXITED(st) && WEXITSTATUS(st) < 2);
+      winners += WEXITSTATUS(st) == 0;
+    }
+    EXPECT_EQ(1, winners) << share;
+  }
+}
+
+// Runs in a private IPC namespace, so that the held lock blocks no other
+// root's test. The child's exit code names the first failed step.
+TEST_F(HookTest, HeldLockTimesOutAndLateCommandsAreNotApplied) {
+  pid_t pid = fork();
+  ASSERT_GE(pid, 0);
+  if (pid == 0) {
+    if (unshare(CLONE_NEWIPC) != 0 &&
+        unshare(CLONE_NEWUSER | CLONE_NEWIPC) != 0) {
+      _exit(77);
+    }
+    CommandFile cmd;
+    cmd.command = "S2S_UpdateTaskStatus";
+    cmd.client_id = "c1";
+    cmd.params = {{"taskName", "t1"}};
+    HandlerContext ctx;
+    std::string answer;
+    int held[2], release[2];
+    if (pipe(held) != 0 || pipe(release) != 0) _exit(10);
+    std::thread holder([&] {
+      char c = S2SRegistryLock(-1) == 0 ? 'y' : 'n';
+      if (write(held[1], &c, 1) != 1) return;
+      read(release[0], &c, 1);
+      S2SRegistryUnlock();
+    });
+    char c = 0;
+    if (read(held[0], &c, 1) != 1 || c != 'y') _exit(11);
+    ctx.deadline = time(nullptr) + 1;
+    int busy = HandleCommand(cmd, ctx, &answer);
+    bool written = Has(Registry(), "TASK_t1");
+    if (write(release[1], "x", 1) != 1) _exit(12);
+    holder.join();
+    if (busy != kRegistryFailure || written) _exit(13);
+    // The lock is free, but the client stopped waiting long ago.
+    ctx.deadline = time(nullptr) - 1;
+    if (HandleCommand(cmd, ctx, &answer) != kRegistryFailure ||
+        Has(Registry(), "TASK_t1")) {
+      _exit(14);
+    }
+    // The same through the hook: the connection's early input is old.
+    std::string text =
+        "command=\"S2S_UpdateTaskStatus\"\nclientID=\"c1\"\n"
+        "taskName=\"t1\"\nrequestID=\"late\"\n";
+    std::string early = EarlyDir() + "/" + env_.pid;
+    WriteFile(early, text);
+    struct timeval old[2] = {{time(nullptr) - kCommandBudgetSeconds - 5, 0},
+                             {time(nullptr) - kCommandBudgetSeconds - 5, 0}};
+    env_.request = "s2scmd/late";
+    if (utimes(early.c_str(), old) != 0 || PreHook(env_, false) != 0 ||
+        ReadFile(ReplyDir() + "/late") != "status=242\n" ||
+        Has(Registry(), "TASK_t1")) {
+      _exit(15);
+    }
+    ctx.deadline = time(nullptr) + 30;
+    if (HandleCommand(cmd, ctx, &answer) != kOk ||
+        !Has(Registry(), "TASK_t1")) {
+      _exit(16);
+    }
+    _exit(0);
+  }
+  int st = 0;
+  ASSERT_EQ(pid, waitpid(pid, &st, 0));
+  ASSERT_TRUE(WIFEXITED(st));
+  if (WEXITSTATUS(st) == 77) {
+    GTEST_SKIP() << "no private IPC namespace (unshare needs CAP_SYS_ADMIN or "
+                    "user namespaces)";
+  }
+  EXPECT_EQ(0, WEXITSTATUS(st)) << "failed step (see the child's codes)";
 }
 
 }  // namespace

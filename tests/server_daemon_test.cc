@@ -1,7 +1,9 @@
 // The server side end to end: a daemon configuration generated from the
 // share configuration, the real rsync daemon on loopback running the real
 // command handler, and the client's rsync wrapper.
+#include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -21,6 +23,37 @@ using s2s_test::WriteFile;
 
 const char kUser[] = "s2s";
 const char kPassword[] = "daemon-Secret-91";
+// A second client with a daemon user of its own.
+const char kOtherUser[] = "mallory";
+const char kOtherPassword[] = "other-Secret-17";
+
+// Plain rsync against the daemon as `user`, as a hostile client would run
+// it; rsync's exit code.
+int Rsync(const std::string& user, const std::string& password,
+          std::vector<std::string> args, int port) {
+  pid_t pid = fork();
+  if (pid == 0) {
+    setenv("RSYNC_PASSWORD", password.c_str(), 1);
+    int null = open("/dev/null", O_RDWR);
+    dup2(null, 1);
+    dup2(null, 2);
+    std::string url = "rsync://" + user + "@127.0.0.1:" + std::to_string(port);
+    std::vector<char*> argv = {const_cast<char*>("rsync")};
+    for (std::string& a : args) {
+      if (a.compare(0, 1, "/") != 0 && a.find(':') == std::string::npos &&
+          a.compare(0, 1, "-") != 0) {
+        a = url + "/" + a;  // a module path
+      }
+      argv.push_back(const_cast<char*>(a.c_str()));
+    }
+    argv.push_back(nullptr);
+    execvp("rsync", argv.data());
+    _exit(127);
+  }
+  int st = 0;
+  waitpid(pid, &st, 0);
+  return WIFEXITED(st) ? WEXITSTATUS(st) : -1;
+}
 
 class ServerDaemonTest : public ::testing::Test {
  protected:
@@ -33,10 +66,14 @@ class ServerDaemonTest : public ::testing::Test {
     WriteFile(tmp_.Sub("src/file"), "payload");
     DaemonConfig config;
     config.handler = S2S_CMD_HANDLER;
-    config.user = kUser;
-    config.password = kPassword;
+    config.user = kOtherUser;
+    config.password = kOtherPassword;
     config.uid = geteuid();
     config.gid = getegid();
+    ASSERT_EQ(0, WriteDaemonConfig(config));
+    // A second user joins the first.
+    config.user = kUser;
+    config.password = kPassword;
     ASSERT_EQ(0, WriteDaemonConfig(config));
     struct stat st;
     ASSERT_EQ(0, stat(DaemonSecretsPath().c_str(), &st));
@@ -48,7 +85,8 @@ class ServerDaemonTest : public ::testing::Test {
 
   // Runs one command for `client`; its status.
   int Command(const std::string& client, const std::string& command,
-              std::vector<std::string> params) {
+              std::vector<std::string> params, const char* user = kUser,
+              const char* password = kPassword) {
     std::list<std::string> lines = {"command=\"" + command + "\"",
                                     "clientID=\"" + client + "\""};
     for (const std::string& p : params) lines.push_back(p);
@@ -57,7 +95,7 @@ class ServerDaemonTest : public ::testing::Test {
     w.setKaroAuth(true, true);
     w.setTimeout(10);
     w.setKaroCustCmdRule(lines);
-    w.setDestPath(kUser, "127.0.0.1", kPassword, "", "");
+    w.setDestPath(user, "127.0.0.1", password, "", "");
     return w.execute(boost::function<bool()>());
   }
 
@@ -108,6 +146,77 @@ TEST_F(ServerDaemonTest, OversizedCommandIsRefusedWithStatus) {
                                 {"taskName=\"" + big + "\""}));
   EXPECT_EQ(kBadId, Command("c1", "S2S_UpdateTaskStatus",
                             {"taskName=\"" + std::string(3000, 'x') + "\""}));
+}
+
+// What a client that knows a daemon password tries against a share another
+// client syncs, against the real daemon. Each row's attempt must fail and
+// leave the victim's files as they were.
+TEST_F(ServerDaemonTest, HostileClientsAreRefused) {
+  StartServer();
+  const std::vector<std::string> start = {"volumeName=\"vol1\"",
+                                          "shareName=\"share1\""};
+  ASSERT_EQ(0, Command("CL1", "S2S_SyncStart", start));
+  std::string keys = tmp_.Sub("usr/karo/etc/.encrypt");
+  std::string upload = tmp_.Sub("var/spool/s2s/upload");
+  std::filesystem::create_directories(tmp_.Sub("empty"));
+  std::filesystem::create_directories(tmp_.Sub("tree/sub"));
+  WriteFile(tmp_.Sub("tree/sub/f"), "x");
+  WriteFile(tmp_.Sub("key"), "victim key");
+  WriteFile(tmp_.Sub("evil"), "evil key");
+  WriteFile(tmp_.Sub("big"), std::string(kMaxCommandFile + 1, 'b'));
+  int port = daemon_.port();
+  // The client holding the sync pushes its key and a pending upload.
+  ASSERT_EQ(0,
+            Rsync(kUser, kPassword, {tmp_.Sub("key"), "s2skeys/share1"}, port));
+  ASSERT_EQ(
+      0, Rsync(kUser, kPassword, {tmp_.Sub("key"), "s2sspool/pending"}, port));
+  struct stat st;
+  ASSERT_EQ(0, stat((upload + "/pending").c_str(), &st));
+  EXPECT_EQ(0600u, st.st_mode & 0777);
+
+  std::string src = tmp_.Sub("empty") + "/";
+  struct Row {
+    const char* what;
+    std::vector<std::string> args;
+  } rows[] = {
+      {"delete every key", {"-r", "--delete", src, "s2skeys/"}},
+      {"replace a key", {tmp_.Sub("evil"), "s2skeys/share1"}},
+      {"delete every upload", {"-r", "--delete", src, "s2sspool/"}},
+      {"replace an upload", {tmp_.Sub("evil"), "s2sspool/pending"}},
+      {"upload a tree", {"-r", tmp_.Sub("tree"), "s2sspool/t1"}},
+      {"push into the share", {"-r", "--delete", src, "share1/"}},
+  };
+  for (const Row& row : rows) {
+    EXPECT_NE(0, Rsync(kOtherUser, kOtherPassword, row.args, port)) << row.what;
+  }
+  EXPECT_EQ("victim key", ReadFile(keys + "/share1"));
+  EXPECT_EQ("victim key", ReadFile(upload + "/pending"));
+  EXPECT_FALSE(std::filesystem::exists(upload + "/t1"));
+  // The other user may not act as CL1, nor start its own sync of share1.
+  EXPECT_EQ(kBadId,
+            Command("CL1", "S2S_SyncStart", start, kOtherUser, kOtherPassword));
+  EXPECT_EQ(kPairedElsewhere,
+            Command("CLM", "S2S_SyncStart", start, kOtherUser, kOtherPassword));
+  EXPECT_EQ(kBadId, Command("CL1", "S2S_SyncFinish",
+                            {"finishType=\"share\"", "name=\"share1\""},
+                            kOtherUser, kOtherPassword));
+  // An oversized upload does not stay: the next upload clears it.
+  EXPECT_EQ(0, Rsync(kOtherUser, kOtherPassword,
+                     {tmp_.Sub("big"), "s2sspool/big"}, port));
+  EXPECT_EQ(0, Rsync(kOtherUser, kOtherPassword,
+                     {tmp_.Sub("evil"), "s2sspool/next"}, port));
+  EXPECT_FALSE(std::filesystem::exists(upload + "/big"));
+  // A malformed request id: the hook refuses the pull after the daemon has
+  // accepted it, which rsync reports as a broken connection.
+  WriteFile(tmp_.Sub("cmd"),
+            "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\n"
+            "requestID=\"a..b\"\n");
+  EXPECT_EQ(10, Rsync(kUser, kPassword,
+                      {"--early-input=" + tmp_.Sub("cmd"), "s2scmd/a..b",
+                       tmp_.Sub("empty") + "/"},
+                      port));
+  EXPECT_EQ(0, Command("CL1", "S2S_SyncFinish",
+                       {"finishType=\"share\"", "name=\"share1\""}));
 }
 
 }  // namespace

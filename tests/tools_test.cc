@@ -541,11 +541,16 @@ TEST(ToolsPrograms, ServerStopSignalsOnlyItsOwnDaemon) {
   Child sleeper = Spawn(tmp.path(), {"/bin/sleep", "30"});
   WriteFile(root + "/var/run/s2s-rsyncd.pid",
             std::to_string(sleeper.pid) + "\n");
+  WriteFile(root + "/var/run/s2s-rsyncd.port", "873\n");
   Child stop =
       RunProgram(tmp.path(), {S2S_SERVER_PROGRAM, "--root", root, "stop"});
   EXPECT_EQ(1, stop.code);
   EXPECT_NE(std::string::npos, stop.err.find("not signalled")) << stop.err;
   EXPECT_EQ(0, kill(sleeper.pid, 0)) << "the foreign process was signalled";
+  // Refused, and nothing forgotten: the files still name what runs.
+  EXPECT_EQ(std::to_string(sleeper.pid) + "\n",
+            ReadFile(root + "/var/run/s2s-rsyncd.pid"));
+  EXPECT_EQ("873\n", ReadFile(root + "/var/run/s2s-rsyncd.port"));
   kill(sleeper.pid, SIGKILL);
   sleeper.Wait();
 

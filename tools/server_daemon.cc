@@ -198,10 +198,10 @@ int StopServerDaemon(std::string& error) {
     return 0;
   }
   if (!IsOurDaemon(pid)) {
+    // The files stay: they may be all that points at a daemon that still
+    // serves, and removing them would make status report it stopped.
     error = "pid " + std::to_string(pid) + " of " + pid_path +
-            " is not this root's rsync daemon; not signalled";
-    unlink(pid_path.c_str());
-    unlink(ServerPortPath().c_str());
+            " is not this root's rsync daemon; not signalled, pid file kept";
     return -1;
   }
   if (kill(pid, SIGTERM) != 0) {

@@ -6,6 +6,7 @@
 #include <memory>
 
 #include "S2S/is_syncedshare.h"
+#include "command_handler.h"
 #include "daemon_config.h"
 #include "karo_host.h"
 #include "karo_programs.h"
@@ -65,7 +66,8 @@ bool InitServerRoot(const RootSpec& spec, std::string& error) {
   if (!MergeSection(KaroRootPath(kPlatformConf), "Platform", platform, error)) {
     return false;
   }
-  if (S2SCheckServerInfo() != 0 || KAROUISetS2S(1, nullptr, nullptr) != 0) {
+  if (S2SCheckServerInfo() != 0 || KAROUISetS2S(1, nullptr, nullptr) != 0 ||
+      S2S::server::MarkRegistryInitialised() != 0) {
     error = "cannot create the pairing registry";
     return false;
   }

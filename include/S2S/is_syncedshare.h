@@ -6,8 +6,10 @@
  * "clientID", "serverName"), "SHARE_<share>" ("RunningID", "CompleteID", ...),
  * "TASK_<task>" ("status": "idle" or the epoch seconds of the last activity)
  * and "CLIENTID_<client>" ("ServerName"). Every write, in every process, is
- * serialised on the System V semaphore 0x2980298 and replaces the file
- * atomically; reads take no lock. Failures are logged to the system log at
+ * serialised on a System V semaphore (key 0x2980298 for the real root, a key
+ * derived from the root's path for a relocated one) and replaces the file
+ * atomically; reads take no lock. A writer waits at most 30 seconds for the
+ * lock and then fails. Failures are logged to the system log at
  * LOG_ERR. A name or value that the file cannot hold (a line break; in names
  * also '[' or ']') is refused and nothing is written.
  *
@@ -78,6 +80,16 @@ S2S_EXPORT int S2SGetServerInfo(const char* section, KSZHASH* out);
 
 /* Replaces `section` with `values`, or appends it when it is new. 0, or -1. */
 S2S_EXPORT int S2SUpdateServerInfo(const char* section, const KSZHASH* values);
+
+/* Holds the registry lock for the calling thread until S2SRegistryUnlock,
+ * waiting at most `timeoutMs` milliseconds (negative: the default 30 s). The
+ * registry functions this thread calls meanwhile do not wait for it again,
+ * so that a check and the write it leads to happen under one lock. Calls
+ * nest. 0, or -1 when the lock could not be had in time. */
+S2S_EXPORT int S2SRegistryLock(int timeoutMs);
+/* Releases the latest S2SRegistryLock of this thread. 0, or -1 when it holds
+ * none. */
+S2S_EXPORT int S2SRegistryUnlock(void);
 
 /* ---- Pair records and status. */
 
