@@ -1,13 +1,12 @@
 /* Services of the host platform layer: the background programs of S2S,
  * started, watched and paused by name.
  *
- * One service is known, "s2s_daemon": the S2S client program started as
- * "<program> --daemon" in a session of its own, with standard input and
+ * One service is known, "s2s_daemon": the S2S client service started as
+ * "<program> --foreground" in a session of its own, with standard input and
  * output on /dev/null, and the pid file /var/run/s2s_daemon.pid under the
  * root. The program is "daemon_program" of the platform configuration, else
- * "s2s-client" as KaroProgramFind finds it (karo_programs.h). The
- * program must stay in the foreground: the pid file names the process that
- * was started.
+ * "s2sd" as KaroProgramFind finds it (karo_programs.h). The program must
+ * stay in the foreground: the pid file names the process that was started.
  *
  * Every failure returns -1 and sets the platform error (karo_err.h).
  * Thread-safe, but two processes starting one service at the same moment

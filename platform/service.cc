@@ -21,7 +21,7 @@ namespace {
 
 const char kDaemonService[] = "s2s_daemon";
 const char kDaemonPidFile[] = "/var/run/s2s_daemon.pid";
-const char kDaemonProgram[] = "s2s-client";
+const char kDaemonProgram[] = "s2sd";
 
 // Returns the pid file of a known service, or "" (KERR_NOT_FOUND /
 // KERR_INVALID_ARG).
@@ -103,7 +103,7 @@ extern "C" int KLIBServiceStart(const char* name, int flags) {
     return -1;
   }
   std::string program = DaemonProgram();
-  const char* argv[] = {program.c_str(), "--daemon", nullptr};
+  const char* argv[] = {program.c_str(), "--foreground", nullptr};
   pid_t pid =
       karo_detail::Spawn(argv, karo_detail::kDevNull, karo_detail::kDevNull,
                          karo_detail::kInherit, true);

@@ -26,14 +26,4 @@ bool InstallCancelSignals() {
          sigaction(SIGTERM, &sa, nullptr) == 0;
 }
 
-void WaitForCancel() {
-  sigset_t block, old;
-  sigemptyset(&block);
-  sigaddset(&block, SIGINT);
-  sigaddset(&block, SIGTERM);
-  sigprocmask(SIG_BLOCK, &block, &old);
-  while (!g_signalled.IsSet()) sigsuspend(&old);
-  sigprocmask(SIG_SETMASK, &old, nullptr);
-}
-
 }  // namespace s2s_tools

@@ -12,9 +12,6 @@ namespace s2s_tools {
 // Returns false when that fails.
 bool InstallCancelSignals();
 
-// Blocks until a signal sets the flag.
-void WaitForCancel();
-
 }  // namespace s2s_tools
 
 #endif  // S2S_TOOLS_CANCEL_H_

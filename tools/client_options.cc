@@ -25,7 +25,6 @@ enum Option {
   kSSH,
   kSSHPort,
   kBeacon,
-  kDaemon,
   kVersion,
 };
 
@@ -47,7 +46,6 @@ const struct option kOptions[] = {
     {"ssh", no_argument, nullptr, kSSH},
     {"ssh-port", required_argument, nullptr, kSSHPort},
     {"beacon-interval", required_argument, nullptr, kBeacon},
-    {"daemon", no_argument, nullptr, kDaemon},
     {"verbose", no_argument, nullptr, 'v'},
     {"help", no_argument, nullptr, 'h'},
     {"version", no_argument, nullptr, kVersion},
@@ -56,7 +54,6 @@ const struct option kOptions[] = {
 
 const char kUsage[] =
     "usage: s2s-client [options]\n"
-    "       s2s-client --daemon\n"
     "       s2s-client [--root DIR] init --share NAME[=PATH]... (init --help)\n"
     "\n"
     "Runs one sync task: probes the server, pairs the shares, then starts,\n"
@@ -81,7 +78,6 @@ const char kUsage[] =
     "  --ssh                  go through SSH; --ssh-port PORT\n"
     "  --beacon-interval SEC  seconds between beacons during a run (30)\n"
     "  -v, --verbose          log INFO; twice: DEBUG and rsync's output\n"
-    "  --daemon               service mode: wait until SIGTERM\n"
     "  -h, --help             this text; --version: the version\n"
     "\n"
     "Exit codes:\n"
@@ -185,9 +181,6 @@ bool ParseClientArgs(int argc, char** argv, ClientOptions& o,
       case kBeacon:
         if (!Number("beacon-interval", optarg, 86400, n, error)) return false;
         o.beacon_interval = static_cast<unsigned int>(n);
-        break;
-      case kDaemon:
-        o.daemon = true;
         break;
       case 'v':
         ++o.verbose;

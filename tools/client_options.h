@@ -13,7 +13,6 @@ struct ClientOptions {
   std::string root;       // --root: the appliance root (S2S_ROOT)
   std::string task_file;  // --task-file
   int verbose = 0;        // -v: library INFO; -vv: DEBUG and rsync's output
-  bool daemon = false;    // --daemon: the platform service's mode
   bool help = false;
   bool version = false;               // --version
   unsigned int beacon_interval = 30;  // seconds between beacons during a run

@@ -1,7 +1,6 @@
 // s2s-client: runs one sync task against a server appliance.
 //
 //   s2s-client [--root DIR] [--task-file FILE] [options]   (see --help)
-//   s2s-client --daemon
 //   s2s-client [--root DIR] init --share NAME[=PATH]...   (client_root.h)
 //
 // Progress goes to standard output, one line per step, then a summary; the
@@ -111,12 +110,6 @@ int main(int argc, char** argv) {
   if (!InstallCancelSignals()) {
     fprintf(stderr, "s2s-client: cannot handle signals\n");
     return kExitLocal;
-  }
-  if (o.daemon) {
-    // The service mode of the platform's "s2s_daemon": no scheduler yet,
-    // so it only stays up until it is told to stop.
-    WaitForCancel();
-    return kExitOk;
   }
   if (!CheckTaskSpec(o.spec, error)) {
     fprintf(stderr, "s2s-client: %s\n", error.c_str());

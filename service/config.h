@@ -1,0 +1,42 @@
+// The service's settings and where its files lie under the appliance root.
+//
+// Settings come from <root>/etc/s2s/s2sd.conf, section [Service]; each key
+// is optional:
+//
+//   [Service]
+//   	max_parallel="2"        most runs at once, 1 to 64
+//   	admin_group="s2sadmin"  a group whose members may use the socket
+//   	beacon_interval="30"    seconds between beacons during a transfer
+#ifndef S2S_SERVICE_CONFIG_H_
+#define S2S_SERVICE_CONFIG_H_
+
+#include <sys/types.h>
+
+#include <string>
+
+namespace s2s_service {
+
+struct DaemonConfig {
+  unsigned int max_parallel = 2;
+  bool has_admin_group = false;
+  gid_t admin_gid = 0;
+  unsigned int beacon_interval = 30;
+};
+
+// Reads the settings file (a missing file means the defaults). True, or
+// false with `error` naming the bad key.
+bool LoadDaemonConfig(DaemonConfig& config, std::string& error);
+
+// Paths under the root (KaroRootPath).
+std::string TaskDir();
+std::string HistoryDir();
+std::string RunDir();  // socket, pid file, share locks
+std::string SocketPath();
+std::string PidFilePath();
+std::string ConfigPath();
+// The lock file that keeps syncs of `share` apart.
+std::string ShareLockPath(const std::string& share);
+
+}  // namespace s2s_service
+
+#endif  // S2S_SERVICE_CONFIG_H_

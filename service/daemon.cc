@@ -1,0 +1,449 @@
+#include "service/daemon.h"
+
+#include <errno.h>
+#include <poll.h>
+#include <signal.h>
+#include <string.h>
+#include <sys/eventfd.h>
+#include <sys/signalfd.h>
+#include <sys/stat.h>
+#include <sys/timerfd.h>
+#include <unistd.h>
+
+#include <algorithm>
+
+#include "S2S/logger.h"
+#include "karo_process.h"
+#include "karo_root.h"
+#include "service/exit_codes.h"
+#include "service/record.h"
+
+namespace s2s_service {
+
+namespace {
+
+using S2S::PObject;
+
+// With nothing due, the timer is still armed this far ahead, so that a
+// change of the clock is noticed all the same.
+const long kIdleArm = 365L * 24 * 3600;
+
+void LogError(const std::string& what) {
+  S2S::Logger::LogMsg(S2S::Logger::Error, "[ERROR] s2sd: %s\n", what.c_str());
+}
+
+void LogInfo(const std::string& what) {
+  S2S::Logger::LogMsg(S2S::Logger::Info, "[INFO] s2sd: %s\n", what.c_str());
+}
+
+void Wake(int fd) {
+  uint64_t one = 1;
+  while (write(fd, &one, sizeof one) < 0 && errno == EINTR) {
+  }
+}
+
+void Drain(int fd) {
+  uint64_t count;
+  while (read(fd, &count, sizeof count) < 0 && errno == EINTR) {
+  }
+}
+
+std::string OutcomeOf(const TaskOutcome& out) {
+  if (out.exit_code == kExitOk) return "ok";
+  if (out.exit_code == kExitCancelled) return "cancelled";
+  return "failed";
+}
+
+// The task's state numbers as the history carries them.
+enum TaskStatusNumber { kStatusIdle = 0, kStatusRunning = 1 };
+
+}  // namespace
+
+Daemon::Daemon(const DaemonConfig& config, const Clock& clock)
+    : config_(config),
+      clock_(clock),
+      store_(TaskDir()),
+      history_(HistoryDir()) {}
+
+Daemon::~Daemon() { Teardown(); }
+
+int Daemon::Run() {
+  if (!Setup()) {
+    Teardown();
+    return 1;
+  }
+  Loop();
+  Teardown();
+  return 0;
+}
+
+bool Daemon::Setup() {
+  started_ = clock_.WallSeconds();
+  std::string error;
+  if (!MakeDirs(RunDir() + "/locks", error) || !MakeDirs(HistoryDir(), error) ||
+      !MakeDirs(TaskDir(), error) ||
+      !MakeDirs(KaroRootPath("/tmp/S2S"), error)) {
+    LogError(error);
+    return false;
+  }
+  chmod(TaskDir().c_str(), 0700);
+  chmod(HistoryDir().c_str(), 0700);
+  chmod(KaroRootPath("/tmp/S2S").c_str(), 0700);
+  std::string pid_file = PidFilePath();
+  if (KLIBCProcAliveByPidFile(pid_file.c_str())) {
+    LogError("already running (pid " +
+             std::to_string(KaroReadPidFile(pid_file.c_str())) + ", " +
+             pid_file + ")");
+    return false;
+  }
+  if (!WriteFileAtomic(pid_file, std::to_string(getpid()) + "\n", 0644,
+                       error)) {
+    LogError(error);
+    return false;
+  }
+  // Signals become readable on the loop's descriptor; every thread started
+  // from here on inherits the blocked mask.
+  sigset_t mask;
+  sigemptyset(&mask);
+  sigaddset(&mask, SIGTERM);
+  sigaddset(&mask, SIGINT);
+  sigaddset(&mask, SIGHUP);
+  pthread_sigmask(SIG_BLOCK, &mask, nullptr);
+  signal(SIGPIPE, SIG_IGN);
+  signal_fd_ = signalfd(-1, &mask, SFD_CLOEXEC | SFD_NONBLOCK);
+  timer_fd_ = timerfd_create(CLOCK_REALTIME, TFD_CLOEXEC | TFD_NONBLOCK);
+  ended_fd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  request_fd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  if (signal_fd_ < 0 || timer_fd_ < 0 || ended_fd_ < 0 || request_fd_ < 0) {
+    LogError(std::string("cannot make the loop's descriptors: ") +
+             strerror(errno));
+    return false;
+  }
+  std::vector<std::string> errors;
+  Reload(errors);
+  CatchUp();
+  if (!control_.Start(
+          SocketPath(), config_.has_admin_group, config_.admin_gid,
+          [this](const PObject& request) { return Handle(request); }, error)) {
+    LogError(error);
+    return false;
+  }
+  S2S::Logger::LogMsg(S2S::Logger::Note,
+                      "[NOTE] s2sd: started, %zu tasks, socket %s\n",
+                      tasks_.size(), SocketPath().c_str());
+  return true;
+}
+
+void Daemon::Teardown() {
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    closed_ = true;
+    for (Pending* p : requests_) {
+      p->reply = MakeReply(kResultBusy, "the service is stopping");
+      p->done = true;
+    }
+    requests_.clear();
+  }
+  answered_.notify_all();
+  control_.Stop();
+  for (auto& it : runs_) {
+    it.second->cancel.Set();
+    if (it.second->thread.joinable()) it.second->thread.join();
+  }
+  runs_.clear();
+  for (int* fd : {&timer_fd_, &signal_fd_, &ended_fd_, &request_fd_}) {
+    if (*fd >= 0) close(*fd);
+    *fd = -1;
+  }
+  if (started_ != 0) {
+    std::string pid_file = PidFilePath();
+    if (KaroReadPidFile(pid_file.c_str()) == getpid()) unlink(pid_file.c_str());
+    started_ = 0;
+  }
+}
+
+void Daemon::Loop() {
+  ArmTimer();
+  pollfd fds[4] = {{timer_fd_, POLLIN, 0},
+                   {signal_fd_, POLLIN, 0},
+                   {ended_fd_, POLLIN, 0},
+                   {request_fd_, POLLIN, 0}};
+  while (!(stopping_ && runs_.empty())) {
+    if (poll(fds, 4, -1) < 0) {
+      if (errno == EINTR) continue;
+      LogError(std::string("poll: ") + strerror(errno));
+      return;
+    }
+    if (fds[2].revents != 0) OnRunsEnded();
+    if (fds[1].revents != 0) OnSignal();
+    if (fds[3].revents != 0) OnRequests();
+    if (fds[0].revents != 0) OnTimer();
+  }
+  LogInfo("stopped");
+}
+
+void Daemon::ArmTimer() {
+  long now = clock_.WallSeconds();
+  long at = scheduler_.Earliest();
+  if (at == 0) at = now + kIdleArm;
+  // The timer runs on the system's wall clock; the service's clock may be
+  // set apart from it.
+  itimerspec its = {};
+  its.it_value.tv_sec = at - (now - SystemClock().WallSeconds());
+  if (timerfd_settime(timer_fd_, TFD_TIMER_ABSTIME | TFD_TIMER_CANCEL_ON_SET,
+                      &its, nullptr) != 0) {
+    LogError(std::string("cannot arm the timer: ") + strerror(errno));
+  }
+}
+
+void Daemon::OnTimer() {
+  uint64_t expirations = 0;
+  ssize_t n = read(timer_fd_, &expirations, sizeof expirations);
+  long now = clock_.WallSeconds();
+  if (n < 0 && errno == ECANCELED) {
+    // The wall clock was set: every next time is computed again.
+    LogInfo("the clock changed; next runs recomputed");
+    scheduler_.RecomputeAll(now);
+  }
+  for (const Scheduler::Due& due : scheduler_.TakeDue(now)) {
+    std::string error;
+    if (!due.retry && !history_.SetLastDue(due.id, due.slot, error)) {
+      LogError(error);
+    }
+    if (!Queue(due.id, due.retry ? "retry" : "schedule")) {
+      LogInfo("task " + std::to_string(due.id) +
+              " was due while it ran; the run is not repeated");
+    }
+  }
+  ArmTimer();
+}
+
+void Daemon::OnSignal() {
+  signalfd_siginfo info;
+  while (read(signal_fd_, &info, sizeof info) == sizeof info) {
+    if (info.ssi_signo == SIGHUP) {
+      std::vector<std::string> errors;
+      Reload(errors);
+      ArmTimer();
+      continue;
+    }
+    if (!stopping_) {
+      S2S::Logger::LogMsg(S2S::Logger::Note,
+                          "[NOTE] s2sd: stopping, %zu runs cancelled\n",
+                          runs_.size());
+    }
+    stopping_ = true;
+    for (auto& it : runs_) it.second->cancel.Set();
+    for (unsigned long long id : queue_) tasks_[id].queued = false;
+    queue_.clear();
+  }
+}
+
+void Daemon::Reload(std::vector<std::string>& errors) {
+  std::map<unsigned long long, StoredTask> loaded;
+  store_.Load(loaded, errors);
+  long now = clock_.WallSeconds();
+  for (auto it = tasks_.begin(); it != tasks_.end();) {
+    if (loaded.count(it->first) == 0) {
+      scheduler_.Remove(it->first);
+      it = tasks_.erase(it);
+    } else {
+      ++it;
+    }
+  }
+  for (auto& it : loaded) {
+    Task& task = tasks_[it.first];
+    bool changed = task.stored.task != it.second.task ||
+                   task.stored.enabled != it.second.enabled;
+    task.stored = it.second;
+    if (changed) {
+      scheduler_.Set(it.first, it.second.task.GetInfo().GetSchedule(),
+                     it.second.enabled, now);
+    }
+  }
+  LogInfo(std::to_string(tasks_.size()) + " tasks loaded, " +
+          std::to_string(errors.size()) + " refused");
+}
+
+void Daemon::CatchUp() {
+  long now = clock_.WallSeconds();
+  for (auto& it : tasks_) {
+    std::string error;
+    long last = history_.LastDue(it.first);
+    if (last <= 0) {
+      if (!history_.SetLastDue(it.first, now, error)) LogError(error);
+      continue;
+    }
+    if (!it.second.stored.enabled) continue;
+    long missed =
+        it.second.stored.task.GetInfo().GetSchedule().GetNextScheduledSeconds(
+            last);
+    if (missed <= 0 || missed > now) continue;
+    if (!history_.SetLastDue(it.first, now, error)) LogError(error);
+    Queue(it.first, "catch-up");
+  }
+}
+
+bool Daemon::Queue(unsigned long long id, const std::string& trigger) {
+  auto it = tasks_.find(id);
+  if (stopping_ || it == tasks_.end() || it->second.queued ||
+      runs_.count(id) != 0) {
+    return false;
+  }
+  it->second.queued = true;
+  it->second.queued_trigger = trigger;
+  queue_.push_back(id);
+  StartQueued();
+  return true;
+}
+
+bool Daemon::SharesFree(const Task& task) const {
+  for (const auto& it : runs_) {
+    for (const std::string& busy :
+         it.second->task.task.GetInfo().GetShareList()) {
+      const std::list<std::string>& mine =
+          task.stored.task.GetInfo().GetShareList();
+      if (std::find(mine.begin(), mine.end(), busy) != mine.end()) {
+        return false;
+      }
+    }
+  }
+  return true;
+}
+
+void Daemon::StartQueued() {
+  for (auto q = queue_.begin();
+       q != queue_.end() && runs_.size() < config_.max_parallel;) {
+    auto it = tasks_.find(*q);
+    if (it == tasks_.end()) {
+      q = queue_.erase(q);
+    } else if (SharesFree(it->second)) {
+      unsigned long long id = *q;
+      q = queue_.erase(q);
+      it->second.queued = false;
+      Start(id, it->second.queued_trigger);
+    } else {
+      ++q;
+    }
+  }
+}
+
+PObject Daemon::RunMap(const ActiveRun& run, bool ended) const {
+  PObject map;
+  map = PObject::Map();
+  map["start"] = static_cast<unsigned long long>(run.started);
+  map["end"] =
+      static_cast<unsigned long long>(ended ? clock_.WallSeconds() : 0);
+  map["trigger"] = run.trigger;
+  const TaskOutcome& out = run.outcome;
+  map["outcome"] = ended ? OutcomeOf(out) : "running";
+  map["message"] = ended ? (out.error.empty() ? "ok" : out.error)
+                         : (run.trigger == "catch-up"
+                                ? "was due while the service was not running"
+                                : "running");
+  map["task_status"] = static_cast<int>(ended ? kStatusIdle : kStatusRunning);
+  map["task_result"] = ended ? out.exit_code : 0;
+  PObject::Array shares;
+  for (const ShareOutcome& s : out.shares) {
+    PObject share;
+    share = PObject::Map();
+    share["name"] = s.name;
+    share["step"] = s.ok ? "finish" : s.failed_step;
+    share["status"] = s.status;
+    share["status_text"] = StatusText(s.status);
+    share["seconds"] = static_cast<unsigned long long>(s.seconds + 0.5);
+    share["files"] = 0ULL;
+    share["bytes"] = 0ULL;
+    shares.push_back(share);
+  }
+  map["shares"] = shares;
+  return map;
+}
+
+void Daemon::Start(unsigned long long id, const std::string& trigger) {
+  auto run = std::make_shared<ActiveRun>();
+  run->id = id;
+  run->task = tasks_[id].stored;
+  run->trigger = trigger;
+  run->started = clock_.WallSeconds();
+  run->beacon_interval = config_.beacon_interval;
+  std::string error;
+  if (!history_.Begin(id, RunMap(*run, false), error)) LogError(error);
+  runs_[id] = run;
+  LogInfo("task " + std::to_string(id) + " started (" + trigger + ")");
+  StartRun(run, [this](unsigned long long ended) {
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      ended_.push_back(ended);
+    }
+    Wake(ended_fd_);
+  });
+}
+
+void Daemon::OnRunsEnded() {
+  Drain(ended_fd_);
+  std::vector<unsigned long long> ended;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    ended.swap(ended_);
+  }
+  for (unsigned long long id : ended) Finish(id);
+  StartQueued();
+  ArmTimer();
+}
+
+void Daemon::Finish(unsigned long long id) {
+  auto it = runs_.find(id);
+  if (it == runs_.end()) return;
+  std::shared_ptr<ActiveRun> run = it->second;
+  run->thread.join();
+  runs_.erase(it);
+  PObject map = RunMap(*run, true);
+  const TaskOutcome& out = run->outcome;
+  long now = clock_.WallSeconds();
+  if (out.exit_code == kExitCancelled) {
+    scheduler_.CancelRetry(id);
+  } else if (out.exit_code == kExitOk) {
+    scheduler_.ResetRetry(id);
+  } else if (!stopping_ && tasks_.count(id) != 0) {
+    long at = scheduler_.ScheduleRetry(id, now);
+    if (at > 0) {
+      map["message"] = map["message"].asString() + "; retry in " +
+                       std::to_string((at - now) / 60) + " min";
+    }
+  }
+  std::string error;
+  if (!history_.Finish(id, map, error)) LogError(error);
+  LogInfo("task " + std::to_string(id) +
+          " ended: " + map["message"].asString());
+}
+
+PObject Daemon::Handle(const PObject& request) {
+  Pending pending;
+  pending.request = &request;
+  std::unique_lock<std::mutex> lock(mu_);
+  if (closed_) return MakeReply(kResultBusy, "the service is stopping");
+  requests_.push_back(&pending);
+  Wake(request_fd_);
+  answered_.wait(lock, [&pending] { return pending.done; });
+  return pending.reply;
+}
+
+void Daemon::OnRequests() {
+  Drain(request_fd_);
+  std::deque<Pending*> requests;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    requests.swap(requests_);
+  }
+  for (Pending* p : requests) {
+    PObject reply = Dispatch(*p->request);
+    std::lock_guard<std::mutex> lock(mu_);
+    p->reply.swap(reply);
+    p->done = true;
+  }
+  answered_.notify_all();
+  ArmTimer();
+}
+
+}  // namespace s2s_service

@@ -1,0 +1,67 @@
+#include "service/run_worker.h"
+
+#include <set>
+#include <vector>
+
+#include "S2S/logger.h"
+#include "S2S/s2s_lock.h"
+#include "service/config.h"
+#include "service/exit_codes.h"
+
+namespace s2s_service {
+
+void ActiveRun::Progress(std::string& share, std::string& step) const {
+  std::lock_guard<std::mutex> lock(mu_);
+  share = share_;
+  step = step_;
+}
+
+// Runner lines are "probe: ...", "pair: ...", "beacon: ...",
+// "share NAME: started|transferred ...|finished|..." and "task NAME: ...".
+void ActiveRun::Note(const std::string& line) {
+  S2S::Logger::LogMsg(S2S::Logger::Info, "[INFO] task %llu: %s\n", id,
+                      line.c_str());
+  std::lock_guard<std::mutex> lock(mu_);
+  size_t colon = line.find(": ");
+  if (line.compare(0, 6, "share ") == 0 && colon != std::string::npos) {
+    share_ = line.substr(6, colon - 6);
+    std::string rest = line.substr(colon + 2);
+    step_ = rest.substr(0, rest.find(' '));
+  } else if (colon != std::string::npos && line.compare(0, 7, "beacon:") != 0) {
+    share_.clear();
+    step_ = line.substr(0, line.find_first_of(" :"));
+  }
+}
+
+void StartRun(std::shared_ptr<ActiveRun> run,
+              std::function<void(unsigned long long)> done) {
+  run->thread = std::thread([run, done] {
+    BindCancelFlag(&run->cancel);
+    {
+      const std::list<std::string>& list =
+          run->task.task.GetInfo().GetShareList();
+      // In name order, so that two runs never wait for each other's locks.
+      std::set<std::string> shares(list.begin(), list.end());
+      std::vector<S2S::SimpleFileLock> locks;
+      bool locked = true;
+      for (const std::string& share : shares) {
+        locks.push_back(S2S::LockFactory(ShareLockPath(share)).GetLock());
+        if (locks.back().ExLock() != 0) {
+          locked = false;
+          run->outcome.exit_code = kExitLocal;
+          run->outcome.error = "cannot lock share " + share;
+          break;
+        }
+      }
+      if (locked) {
+        run->outcome =
+            RunTask(run->task.task, run->task.excludes, run->beacon_interval,
+                    [&run](const std::string& line) { run->Note(line); });
+      }
+    }
+    BindCancelFlag(nullptr);
+    done(run->id);
+  });
+}
+
+}  // namespace s2s_service

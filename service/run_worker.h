@@ -1,0 +1,50 @@
+// One run of a task on a thread of its own: the task's shares locked
+// against other runs (LockFactory, one lock file per share, so that other
+// processes of the service are kept apart too), the task runner with the
+// run's cancel flag bound to the thread, then a report back to the owner.
+#ifndef S2S_SERVICE_RUN_WORKER_H_
+#define S2S_SERVICE_RUN_WORKER_H_
+
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+
+#include "service/cancel.h"
+#include "service/task_map.h"
+#include "service/task_runner.h"
+
+namespace s2s_service {
+
+struct ActiveRun {
+  unsigned long long id = 0;
+  StoredTask task;  // a copy: an update applies from the next run
+  std::string trigger;
+  long started = 0;  // wall clock
+  unsigned int beacon_interval = 30;
+  CancelFlag cancel;
+  TaskOutcome outcome;  // written by the run's thread before it reports
+
+  // Where the run is: the share and the step of the runner's last line.
+  void Progress(std::string& share, std::string& step) const;
+
+  std::thread thread;
+
+ private:
+  friend void StartRun(std::shared_ptr<ActiveRun>,
+                       std::function<void(unsigned long long)>);
+  void Note(const std::string& line);
+  mutable std::mutex mu_;
+  std::string share_, step_;
+};
+
+// Starts `run` on its thread; `done(id)` is called from that thread when
+// the run has ended and `run->outcome` is final. The owner joins
+// `run->thread` afterwards.
+void StartRun(std::shared_ptr<ActiveRun> run,
+              std::function<void(unsigned long long)> done);
+
+}  // namespace s2s_service
+
+#endif  // S2S_SERVICE_RUN_WORKER_H_

@@ -1,0 +1,47 @@
+// A task as the service keeps it, and its flat map.
+//
+// A StoredTask is the library's SyncTask plus the service's own settings
+// (enabled, excludes). It crosses the control socket and lies in its file
+// as the flat map of the sync-object mapping (SyncTask2PObj's keys) with
+// "enabled" and "excludes" beside them. Every key of an incoming map is
+// checked against one table (kind and size) before anything is applied, so
+// a bad map changes nothing.
+#ifndef S2S_SERVICE_TASK_MAP_H_
+#define S2S_SERVICE_TASK_MAP_H_
+
+#include <list>
+#include <string>
+
+#include "S2S/pobject.h"
+#include "S2S/sync_obj_task.h"
+
+namespace s2s_service {
+
+struct StoredTask {
+  S2S::SyncTask task;
+  bool enabled = true;
+  std::list<std::string> excludes;
+};
+
+// Lays the keys of `in` over `task`: only keys present change, "pswd"
+// included. Keys that replies carry but requests may not set ("next_run",
+// "state", ...) are ignored. Returns true, or false with `error` (a key
+// unknown, of the wrong kind or over its size) and `task` unchanged.
+bool ApplyTaskMap(const S2S::PObject& in, StoredTask& task, std::string& error);
+
+// The map of `task`; with `with_password` the password too (for the task's
+// file), otherwise only "has_password".
+S2S::PObject TaskToMap(const StoredTask& task, bool with_password);
+
+// Whether the task may be stored and run: the library's TaskInfo::Validate
+// and an id of at least 1. False with `error` saying, in words, the first
+// rule broken.
+bool CheckTask(const StoredTask& task, std::string& error);
+
+// An id from the control socket: an integer, or a decimal string. Returns
+// true with `id` (at least 1), false for anything else.
+bool ReadTaskId(const S2S::PObject& value, unsigned long long& id);
+
+}  // namespace s2s_service
+
+#endif  // S2S_SERVICE_TASK_MAP_H_
