@@ -33,12 +33,13 @@ void MakeParents(const std::string& path) {
   }
 }
 
-// Reads `key` of `section` into `buf`; a missing file, section or key reads
-// as "". false (after logging) on any other failure.
-bool ReadTolerant(const std::string& file, const char* section, const char* key,
+// Reads `key` of `section` of `doc` (nullptr: the registry could not be
+// read) into `buf`; a missing file, section or key reads as "". false (after
+// logging) on any other failure.
+bool ReadTolerant(const SectionDoc* doc, const char* section, const char* key,
                   char* buf, int size) {
   buf[0] = '\0';
-  if (KLIBCFileGetSectionValue(file.c_str(), section, key, buf, size) >= 0) {
+  if (doc != nullptr && CopyValue(*doc, section, key, buf, size) >= 0) {
     return true;
   }
   int err = KLIBCErrGet();
@@ -102,81 +103,118 @@ RegistryLock::~RegistryLock() {
   held_handle = -1;
 }
 
-HashPtr LoadPairedClientInfo() {
+RegistryPtr ReadRegistry() {
+  RegistryPtr doc = std::make_shared<SectionDoc>();
+  if (doc->Load(RegistryPath().c_str()) != 0) return nullptr;
+  return doc;
+}
+
+int WriteRegistry(const SectionDoc& doc) {
+  return doc.Store(RegistryPath().c_str());
+}
+
+int CopyValue(const SectionDoc& doc, const std::string& section,
+              const char* key, char* buf, int size) {
+  const std::string* value = doc.Value(section, key);
+  if (value == nullptr) {
+    KLIBCErrSet(KERR_NOT_FOUND);
+    return -1;
+  }
+  if (value->size() >= static_cast<size_t>(size)) {
+    KLIBCErrSet(KERR_BUFFER_TOO_SMALL);
+    return -1;
+  }
+  memcpy(buf, value->c_str(), value->size() + 1);
+  return static_cast<int>(value->size());
+}
+
+int CopySection(const SectionDoc& doc, const std::string& section,
+                KSZHASH* out) {
+  const karo_detail::SectionPairs* pairs = doc.Find(section);
+  if (pairs == nullptr) return 0;
+  for (const auto& p : *pairs) {
+    if (KLIBCSzHashSetValue(out, p.first.c_str(), p.second.c_str()) != 0) {
+      return -1;
+    }
+  }
+  return 1;
+}
+
+bool Holdable(const char* section, const KSZHASH* values) {
+  if (section == nullptr || values == nullptr) {
+    KLIBCErrSet(KERR_INVALID_ARG);
+    return false;
+  }
+  bool ok = karo_detail::SectionNameHoldable(section);
+  for (int i = 0; ok && i < KLIBCSzHashCount(values); ++i) {
+    ok = karo_detail::SectionKeyHoldable(KLIBCSzHashKeyAt(values, i)) &&
+         karo_detail::SectionValueHoldable(KLIBCSzHashValueAt(values, i));
+  }
+  if (!ok) KLIBCErrSet(KERR_VALUE_UNHOLDABLE);
+  return ok;
+}
+
+HashPtr PairedClientInfo(const SectionDoc& doc) {
   HashPtr hash(KLIBCSzHashAlloc(1024));
-  if (!hash || S2SCheckServerInfo() != 0) return nullptr;
-  if (KLIBCFileGetSection(RegistryPath().c_str(), kPairedClientInfo,
-                          hash.get()) < 0) {
+  if (!hash || CopySection(doc, kPairedClientInfo, hash.get()) < 0) {
     return nullptr;
   }
   return hash;
 }
 
-int StorePairedClientInfo(const KSZHASH* values) {
-  if (S2SCheckServerInfo() != 0) return -1;
-  const std::string file = RegistryPath();
-  int ret =
-      KLIBCIFileModifySection(file.c_str(), kPairedClientInfo, 0, values, 1, 0);
-  if (ret == 0) {
-    ret = KLIBCFileAddSection(file.c_str(), kPairedClientInfo, values, nullptr);
+bool LoadPairedClientInfo(RegistryPtr* doc, HashPtr* hash) {
+  if (S2SCheckServerInfo() != 0) return false;
+  *doc = ReadRegistry();
+  if (!*doc) return false;
+  *hash = PairedClientInfo(**doc);
+  return *hash != nullptr;
+}
+
+int StorePairedClientInfo(SectionDoc* doc, const KSZHASH* values) {
+  if (S2SCheckServerInfo() != 0 || !Holdable(kPairedClientInfo, values)) {
+    return -1;
   }
-  return ret < 0 ? -1 : 0;
+  karo_detail::SectionPairs* pairs = doc->Add(kPairedClientInfo);
+  for (int i = 0; i < KLIBCSzHashCount(values); ++i) {
+    SectionDoc::Set(pairs, KLIBCSzHashKeyAt(values, i),
+                    KLIBCSzHashValueAt(values, i));
+  }
+  return WriteRegistry(*doc) == 0 ? 0 : -1;
 }
 
 int UpdateServerInfoLocked(const char* section, const KSZHASH* values) {
   const std::string file = RegistryPath();
   const char* name = section != nullptr ? section : "";
-  HashPtr scratch(KLIBCSzHashAlloc(512));
-  if (!scratch) return -1;
-  bool ok = true;
-  bool exists = false;
-  if (name[0] != '\0') {
-    int ret = KLIBCFileGetSection(file.c_str(), name, scratch.get());
-    if (ret < 0) {
-      Syslog(LOG_ERR,
-             "KLIBCFileGetSection error. filePath:[%s] szOldSecName:[%s]  "
-             "iRet:[%d]",
-             file.c_str(), name, ret);
-      ok = false;
-    } else if (ret > 0) {
-      exists = true;
-      if (KLIBCFileSetSection(file.c_str(), name, 0, values,
-                              KLIBC_SECTION_PAIR_FORMAT) < 0) {
-        Syslog(LOG_ERR,
-               "KLIBCFileSetSection() failed!! szFile=[%s], section=[%s], "
-               "errno=[0x%04X]",
-               file.c_str(), name, KLIBCErrGet());
-        ok = false;
-      }
-    }
+  RegistryPtr doc = ReadRegistry();
+  if (!doc && KLIBCErrGet() == KERR_FILE_NOT_FOUND) {
+    doc = std::make_shared<SectionDoc>();
   }
-  if (ok && !exists) {
-    struct stat st;
-    if (stat(file.c_str(), &st) != 0) {
-      if (errno != ENOENT) {
-        Syslog(LOG_ERR, "Failed to stat file [%s], errno=[%d/%m]", file.c_str(),
-               errno);
-        ok = false;
-      } else {
-        int fd = open(file.c_str(),
-                      O_RDWR | O_CREAT | O_EXCL | O_TRUNC | O_SYNC | O_CLOEXEC,
-                      0777);
-        if (fd < 0) {
-          Syslog(LOG_ERR, "Failed to open file [%s], errno=[%d/%m]",
-                 file.c_str(), errno);
-          ok = false;
-        } else {
-          close(fd);
-        }
+  bool ok = false;
+  if (!doc && name[0] != '\0') {
+    Syslog(LOG_ERR,
+           "KLIBCFileGetSection error. filePath:[%s] szOldSecName:[%s]  "
+           "iRet:[%d]",
+           file.c_str(), name, -1);
+  } else {
+    bool exists = doc && name[0] != '\0' && doc->Find(name) != nullptr;
+    // An unnamed section is never holdable, so past this check `doc` is
+    // there.
+    if (Holdable(section, values)) {
+      karo_detail::SectionPairs pairs;
+      for (int i = 0; i < KLIBCSzHashCount(values); ++i) {
+        SectionDoc::Set(&pairs, KLIBCSzHashKeyAt(values, i),
+                        KLIBCSzHashValueAt(values, i));
       }
+      *doc->Add(name) = std::move(pairs);
+      ok = WriteRegistry(*doc) == 0;
     }
-    if (ok && KLIBCFileAddSection(file.c_str(), section, values,
-                                  KLIBC_SECTION_PAIR_FORMAT) < 1) {
+    if (!ok) {
       Syslog(LOG_ERR,
-             "KLIBCFileAddSection() failed!! szFile=[%s], section=[%s], "
-             "errno=[0x%04X]",
+             exists ? "KLIBCFileSetSection() failed!! szFile=[%s], "
+                      "section=[%s], errno=[0x%04X]"
+                    : "KLIBCFileAddSection() failed!! szFile=[%s], "
+                      "section=[%s], errno=[0x%04X]",
              file.c_str(), name, KLIBCErrGet());
-      ok = false;
     }
   }
   if (ok) return 0;
@@ -228,7 +266,13 @@ extern "C" int S2SCheckServerInfo(void) {
 
 extern "C" int S2SGetServerInfo(const char* section, KSZHASH* out) {
   S2SCheckServerInfo();
-  return KLIBCFileGetSection(RegistryPath().c_str(), section, out);
+  if (section == nullptr || out == nullptr) {
+    KLIBCErrSet(KERR_INVALID_ARG);
+    return -1;
+  }
+  S2S::detail::RegistryPtr doc = S2S::detail::ReadRegistry();
+  if (!doc) return -1;
+  return S2S::detail::CopySection(*doc, section, out);
 }
 
 extern "C" int S2SUpdateServerInfo(const char* section, const KSZHASH* values) {
@@ -248,8 +292,9 @@ extern "C" int KAROUISetS2S(int enable, const char* clientID,
   // process is not written back over with the old one.
   RegistryLock lock;
   if (!lock.Held()) return -1;
-  HashPtr hash = S2S::detail::LoadPairedClientInfo();
-  if (!hash) return -1;
+  S2S::detail::RegistryPtr doc;
+  HashPtr hash;
+  if (!S2S::detail::LoadPairedClientInfo(&doc, &hash)) return -1;
   if (clientID != nullptr && serverName != nullptr &&
       (KLIBCSzHashSetValue(hash.get(), "clientID", clientID) != 0 ||
        KLIBCSzHashSetValue(hash.get(), "serverName", serverName) != 0)) {
@@ -259,7 +304,7 @@ extern "C" int KAROUISetS2S(int enable, const char* clientID,
       0) {
     return -1;
   }
-  return S2S::detail::StorePairedClientInfo(hash.get());
+  return S2S::detail::StorePairedClientInfo(doc.get(), hash.get());
 }
 
 extern "C" int KAROS2SIsSyncedShare(const char* shareName) {
@@ -273,14 +318,14 @@ extern "C" int KAROS2SIsSyncedShare(const char* shareName) {
                           shareName, KLIBCErrGet());
     return 0;
   }
-  const std::string file = RegistryPath();
+  S2S::detail::RegistryPtr doc = S2S::detail::ReadRegistry();
   char value[256];
-  if (!S2S::detail::ReadTolerant(file, kPairedClientInfo, "s2sEnabled", value,
-                                 sizeof value)) {
+  if (!S2S::detail::ReadTolerant(doc.get(), kPairedClientInfo, "s2sEnabled",
+                                 value, sizeof value)) {
     return 0;
   }
   if (strcmp(value, "no") == 0) return 0;
-  if (!S2S::detail::ReadTolerant(file, section.get(), "RunningID", value,
+  if (!S2S::detail::ReadTolerant(doc.get(), section.get(), "RunningID", value,
                                  sizeof value)) {
     return 0;
   }

@@ -1,8 +1,11 @@
 // Internal: what the registry functions share. The registry's path under the
-// root, its lock, and the read-modify-write of "PairedClientInfo".
+// root, its lock, the registry read once per call, and the read-modify-write
+// of "PairedClientInfo".
 //
 // Every read-modify-write takes the lock before it reads, so that two
 // processes changing different keys of one section never undo each other.
+// A function reads the file once (ReadRegistry) and hands that snapshot to
+// its helpers, rather than reading the whole file again for every key.
 #ifndef S2S_IS_SYNCEDSHARE_DETAIL_H_
 #define S2S_IS_SYNCEDSHARE_DETAIL_H_
 
@@ -10,6 +13,7 @@
 #include <string>
 
 #include "karo_section.h"
+#include "section_doc.h"
 
 // Source name of the messages that carry a "%s:%d " prefix.
 #define S2S_REGISTRY_SOURCE "is_syncedshare"
@@ -61,13 +65,45 @@ class RegistryLock {
   bool locked_ = false;
 };
 
-// Reads "PairedClientInfo" into a new hash of 1,024 entries, creating the
-// file when it is missing. nullptr when the file cannot be had or read.
-HashPtr LoadPairedClientInfo();
+using karo_detail::SectionDoc;
+using RegistryPtr = std::shared_ptr<SectionDoc>;
 
-// Writes `values` into "PairedClientInfo" (modified, or added when absent).
-// The caller holds the lock. 0, or -1.
-int StorePairedClientInfo(const KSZHASH* values);
+// The registry file read once. nullptr, with the platform error set
+// (KERR_FILE_NOT_FOUND, KERR_FILE_FORMAT, KERR_SYSTEM), when it cannot be
+// read.
+RegistryPtr ReadRegistry();
+
+// Writes `doc` (read by ReadRegistry, then changed) as the registry. The
+// caller holds the lock. 0, or -1 (KERR_SYSTEM).
+int WriteRegistry(const SectionDoc& doc);
+
+// Copies `key` of `section` of `doc` into `buf` (`size` bytes) as
+// KLIBCFileGetSectionValue does: the value's length, or -1 (KERR_NOT_FOUND,
+// KERR_BUFFER_TOO_SMALL).
+int CopyValue(const SectionDoc& doc, const std::string& section,
+              const char* key, char* buf, int size);
+
+// Adds the pairs of `section` of `doc` to `out`: 1, 0 when there is no such
+// section, -1 (KERR_NO_MEMORY) when `out` is full.
+int CopySection(const SectionDoc& doc, const std::string& section,
+                KSZHASH* out);
+
+// Whether `section` and every key and value of `values` can be held by the
+// file; when not, the platform error is set (KERR_VALUE_UNHOLDABLE, or
+// KERR_INVALID_ARG for a null argument) and nothing is changed.
+bool Holdable(const char* section, const KSZHASH* values);
+
+// "PairedClientInfo" of `doc` in a new hash of 1,024 entries; nullptr when
+// it does not fit or cannot be allocated.
+HashPtr PairedClientInfo(const SectionDoc& doc);
+
+// Reads the registry, creating the file when it is missing, and
+// "PairedClientInfo" from it. false when the file cannot be had or read.
+bool LoadPairedClientInfo(RegistryPtr* doc, HashPtr* hash);
+
+// Sets the pairs of `values` in "PairedClientInfo" of `doc` (added when
+// absent) and writes `doc`. The caller holds the lock. 0, or -1.
+int StorePairedClientInfo(SectionDoc* doc, const KSZHASH* values);
 
 // S2SUpdateServerInfo for a caller that already holds the lock.
 int UpdateServerInfoLocked(const char* section, const KSZHASH* values);

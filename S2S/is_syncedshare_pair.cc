@@ -15,6 +15,8 @@ namespace {
 using S2S::detail::HashPtr;
 using S2S::detail::kMultiSrcMarker;
 using S2S::detail::RegistryLock;
+using S2S::detail::RegistryPtr;
+using S2S::detail::SectionDoc;
 using S2S::detail::StrPtr;
 using S2S::detail::Syslog;
 
@@ -32,14 +34,19 @@ int UpdateNamed(const char* prefix, const char* name, const KSZHASH* values) {
   return S2SUpdateServerInfo(section.get(), values);
 }
 
-// Reads `key` of the share's section; a share without that record reads as
-// "". false (logged) when the registry cannot be read.
-bool ReadShareKey(const char* share, const char* key, char* buf, int size) {
-  if (S2SServerGetShare(share, key, buf, size) >= 0) return true;
+// Reads `key` of the share's section of `doc` (nullptr: the registry could
+// not be read); a share without that record reads as "". false (logged) when
+// the registry cannot be read.
+bool ReadShareKey(const SectionDoc* doc, const char* share, const char* key,
+                  char* buf, int size) {
+  const std::string section = std::string("SHARE_") + share;
+  if (doc != nullptr &&
+      S2S::detail::CopyValue(*doc, section, key, buf, size) >= 0) {
+    return true;
+  }
   buf[0] = '\0';
   int err = KLIBCErrGet();
   if (err == KERR_NOT_FOUND || err == KERR_FILE_NOT_FOUND) return true;
-  const std::string section = std::string("SHARE_") + share;
   if (strcmp(key, "CompleteID") == 0) {
     Syslog(LOG_ERR, "Failed to get section [%s] CompleteID value.",
            section.c_str());
@@ -51,14 +58,14 @@ bool ReadShareKey(const char* share, const char* key, char* buf, int size) {
 }
 
 // The ids that complete and run syncs into `share`. 0, 201 or 206.
-int getSharePairStatus(const char* share, char* complete, char* running,
-                       int size) {
+int getSharePairStatus(const SectionDoc* doc, const char* share, char* complete,
+                       char* running, int size) {
   if (Empty(share)) {
     Syslog(LOG_ERR, "Parameter error on getSharePairStatus.");
     return S2S_SVR_BAD_ARGUMENT;
   }
-  if (!ReadShareKey(share, "CompleteID", complete, size) ||
-      !ReadShareKey(share, "RunningID", running, size)) {
+  if (!ReadShareKey(doc, share, "CompleteID", complete, size) ||
+      !ReadShareKey(doc, share, "RunningID", running, size)) {
     return S2S_SVR_READ_ERROR;
   }
   return S2S_SVR_OK;
@@ -93,8 +100,13 @@ extern "C" int S2SServerGetShare(const char* share, const char* key,
   }
   StrPtr section(KLIBCStrGet("SHARE_%s", share));
   if (!section) return -1;
-  return KLIBCFileGetSectionValue(S2S::detail::RegistryPath().c_str(),
-                                  section.get(), key, buffer, size);
+  if (size < 1) {
+    KLIBCErrSet(KERR_INVALID_ARG);
+    return -1;
+  }
+  RegistryPtr doc = S2S::detail::ReadRegistry();
+  if (!doc) return -1;
+  return S2S::detail::CopyValue(*doc, section.get(), key, buffer, size);
 }
 
 extern "C" int S2SServerUpdateShare(const char* share, const KSZHASH* values) {
@@ -176,8 +188,9 @@ extern "C" int s2s_svr_reset_pair(void) {
   if (S2SCheckServerInfo() != 0) return -1;
   RegistryLock lock;
   if (!lock.Held()) return -1;
-  HashPtr hash = S2S::detail::LoadPairedClientInfo();
-  if (!hash) return -1;
+  RegistryPtr doc;
+  HashPtr hash;
+  if (!S2S::detail::LoadPairedClientInfo(&doc, &hash)) return -1;
   const char* client = KLIBCSzHashGetValue(hash.get(), "clientID");
   const char* server = KLIBCSzHashGetValue(hash.get(), "serverName");
   if (client == nullptr) {
@@ -185,14 +198,16 @@ extern "C" int s2s_svr_reset_pair(void) {
   } else if (server == nullptr) {
     Syslog(LOG_ERR, "Failed to get serverName from hash.");
   } else {
+    // Remembered in the same write as the move to many-client mode.
     StrPtr section(KLIBCStrGet("CLIENTID_%s", client));
     HashPtr old_client(KLIBCSzHashAlloc(16));
     if (!section || !old_client ||
         KLIBCSzHashSetValue(old_client.get(), "ServerName", server) != 0 ||
-        KLIBCFileAddSection(S2S::detail::RegistryPath().c_str(), section.get(),
-                            old_client.get(), nullptr) < 1) {
+        !S2S::detail::Holdable(section.get(), old_client.get())) {
       Syslog(LOG_ERR, "Failed to add section [%s].",
              section ? section.get() : client);
+    } else {
+      *doc->Add(section.get()) = {{"ServerName", server}};
     }
   }
   // `client` and `server` point into the hash: done with them above.
@@ -200,7 +215,7 @@ extern "C" int s2s_svr_reset_pair(void) {
       KLIBCSzHashSetValue(hash.get(), "serverName", kMultiSrcMarker) != 0) {
     return -1;
   }
-  return S2S::detail::StorePairedClientInfo(hash.get());
+  return S2S::detail::StorePairedClientInfo(doc.get(), hash.get());
 }
 
 extern "C" int S2SCheckIfSharePaired(const KSZLIST* shares,
@@ -213,11 +228,16 @@ extern "C" int S2SCheckIfSharePaired(const KSZLIST* shares,
     Syslog(LOG_ERR, "Input parameters are null or empty!");
     return S2S_SVR_BAD_ARGUMENT;
   }
+  // One read for every share of the list.
+  RegistryPtr doc = S2S::detail::ReadRegistry();
+  int read_error = doc ? 0 : KLIBCErrGet();
   for (int i = 0; i < KLIBCSzListCount(shares); ++i) {
     const char* share = KLIBCSzListGet(shares, i);
     char complete[256];
     char running[256];
-    int ret = getSharePairStatus(share, complete, running, sizeof complete);
+    if (!doc) KLIBCErrSet(read_error);
+    int ret = getSharePairStatus(doc.get(), share, complete, running,
+                                 sizeof complete);
     if (ret != S2S_SVR_OK) {
       Syslog(LOG_ERR, "getSharePairStatus error");
       return ret;

@@ -22,27 +22,21 @@ char* CopyOrNull(const KSZHASH* hash, const char* key) {
   return value != nullptr ? KLIBCStrGet("%s", value) : nullptr;
 }
 
-bool AnyTaskBusy() {
-  const std::string file = S2S::detail::RegistryPath();
-  KSZLIST* names = KLIBCSzListAlloc();
-  if (names == nullptr) return false;
-  bool busy = false;
-  int n = KLIBCFileEnumSection(file.c_str(), names);
+bool AnyTaskBusy(const S2S::detail::SectionDoc& doc) {
   time_t now = time(nullptr);
-  for (int i = 0; i < n && !busy; ++i) {
-    const char* name = KLIBCSzListGet(names, i);
-    if (strncmp(name, "TASK_", 5) != 0) continue;
+  for (size_t i = 0; i < doc.Count(); ++i) {
+    const std::string& name = doc.NameAt(i);
+    if (name.compare(0, 5, "TASK_") != 0) continue;
     char status[64];
-    if (KLIBCFileGetSectionValue(file.c_str(), name, "status", status,
-                                 sizeof status) < 0 ||
+    if (S2S::detail::CopyValue(doc, name, "status", status, sizeof status) <
+            0 ||
         strcmp(status, "idle") == 0) {
       continue;
     }
     long t = strtol(status, nullptr, 10);
-    busy = static_cast<long>(now) - t <= kBusySeconds;
+    if (static_cast<long>(now) - t <= kBusySeconds) return true;
   }
-  KLIBCSzListFree(names);
-  return busy;
+  return false;
 }
 
 }  // namespace
@@ -53,8 +47,10 @@ extern "C" int s2s_svr_get_status(S2S_SVR_STATUS* status) {
   status->busy = 0;
   status->clientID = nullptr;
   status->serverName = nullptr;
-  S2S::detail::HashPtr hash = S2S::detail::LoadPairedClientInfo();
-  if (hash) {
+  // One read for the pairing and the tasks.
+  S2S::detail::RegistryPtr doc;
+  S2S::detail::HashPtr hash;
+  if (S2S::detail::LoadPairedClientInfo(&doc, &hash)) {
     const char* enabled = KLIBCSzHashGetValue(hash.get(), "s2sEnabled");
     if (enabled != nullptr && strcmp(enabled, "yes") == 0) {
       status->running =
@@ -63,7 +59,8 @@ extern "C" int s2s_svr_get_status(S2S_SVR_STATUS* status) {
     status->clientID = CopyOrNull(hash.get(), "clientID");
     status->serverName = CopyOrNull(hash.get(), "serverName");
   }
-  status->busy = AnyTaskBusy() ? 1 : 0;
+  if (!doc) doc = S2S::detail::ReadRegistry();
+  status->busy = doc && AnyTaskBusy(*doc) ? 1 : 0;
   return 0;
 }
 
