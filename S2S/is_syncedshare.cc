@@ -39,7 +39,7 @@ void MakeParents(const std::string& path) {
 bool ReadTolerant(const SectionDoc* doc, const char* section, const char* key,
                   char* buf, int size) {
   buf[0] = '\0';
-  if (doc != nullptr && CopyValue(*doc, section, key, buf, size) >= 0) {
+  if (doc != nullptr && doc->CopyValue(section, key, buf, size) >= 0) {
     return true;
   }
   int err = KLIBCErrGet();
@@ -111,21 +111,6 @@ RegistryPtr ReadRegistry() {
 
 int WriteRegistry(const SectionDoc& doc) {
   return doc.Store(RegistryPath().c_str());
-}
-
-int CopyValue(const SectionDoc& doc, const std::string& section,
-              const char* key, char* buf, int size) {
-  const std::string* value = doc.Value(section, key);
-  if (value == nullptr) {
-    KLIBCErrSet(KERR_NOT_FOUND);
-    return -1;
-  }
-  if (value->size() >= static_cast<size_t>(size)) {
-    KLIBCErrSet(KERR_BUFFER_TOO_SMALL);
-    return -1;
-  }
-  memcpy(buf, value->c_str(), value->size() + 1);
-  return static_cast<int>(value->size());
 }
 
 int CopySection(const SectionDoc& doc, const std::string& section,

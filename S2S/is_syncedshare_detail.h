@@ -77,12 +77,6 @@ RegistryPtr ReadRegistry();
 // caller holds the lock. 0, or -1 (KERR_SYSTEM).
 int WriteRegistry(const SectionDoc& doc);
 
-// Copies `key` of `section` of `doc` into `buf` (`size` bytes) as
-// KLIBCFileGetSectionValue does: the value's length, or -1 (KERR_NOT_FOUND,
-// KERR_BUFFER_TOO_SMALL).
-int CopyValue(const SectionDoc& doc, const std::string& section,
-              const char* key, char* buf, int size);
-
 // Adds the pairs of `section` of `doc` to `out`: 1, 0 when there is no such
 // section, -1 (KERR_NO_MEMORY) when `out` is full.
 int CopySection(const SectionDoc& doc, const std::string& section,

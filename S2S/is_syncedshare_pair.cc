@@ -40,8 +40,7 @@ int UpdateNamed(const char* prefix, const char* name, const KSZHASH* values) {
 bool ReadShareKey(const SectionDoc* doc, const char* share, const char* key,
                   char* buf, int size) {
   const std::string section = std::string("SHARE_") + share;
-  if (doc != nullptr &&
-      S2S::detail::CopyValue(*doc, section, key, buf, size) >= 0) {
+  if (doc != nullptr && doc->CopyValue(section, key, buf, size) >= 0) {
     return true;
   }
   buf[0] = '\0';
@@ -106,7 +105,7 @@ extern "C" int S2SServerGetShare(const char* share, const char* key,
   }
   RegistryPtr doc = S2S::detail::ReadRegistry();
   if (!doc) return -1;
-  return S2S::detail::CopyValue(*doc, section.get(), key, buffer, size);
+  return doc->CopyValue(section.get(), key, buffer, size);
 }
 
 extern "C" int S2SServerUpdateShare(const char* share, const KSZHASH* values) {

@@ -28,8 +28,7 @@ bool AnyTaskBusy(const S2S::detail::SectionDoc& doc) {
     const std::string& name = doc.NameAt(i);
     if (name.compare(0, 5, "TASK_") != 0) continue;
     char status[64];
-    if (S2S::detail::CopyValue(doc, name, "status", status, sizeof status) <
-            0 ||
+    if (doc.CopyValue(name, "status", status, sizeof status) < 0 ||
         strcmp(status, "idle") == 0) {
       continue;
     }

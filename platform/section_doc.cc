@@ -248,6 +248,21 @@ const std::string* SectionDoc::Value(const std::string& name,
   return nullptr;
 }
 
+int SectionDoc::CopyValue(const std::string& name, const std::string& key,
+                          char* buf, int size) const {
+  const std::string* value = Value(name, key);
+  if (value == nullptr) {
+    KLIBCErrSet(KERR_NOT_FOUND);
+    return -1;
+  }
+  if (value->size() >= static_cast<size_t>(size)) {
+    KLIBCErrSet(KERR_BUFFER_TOO_SMALL);
+    return -1;
+  }
+  memcpy(buf, value->c_str(), value->size() + 1);
+  return static_cast<int>(value->size());
+}
+
 void SectionDoc::Set(SectionPairs* pairs, const std::string& key,
                      const std::string& value) {
   for (auto& p : *pairs) {

@@ -48,6 +48,12 @@ class SectionDoc {
   const std::string* Value(const std::string& name,
                            const std::string& key) const;
 
+  // Copies the value of `key` in section `name` into `buf` (`size` bytes,
+  // NUL included). Returns its length, or -1 with the platform error set
+  // (KERR_NOT_FOUND, KERR_BUFFER_TOO_SMALL).
+  int CopyValue(const std::string& name, const std::string& key, char* buf,
+                int size) const;
+
   // Section names in file order.
   size_t Count() const { return sections_.size(); }
   const std::string& NameAt(size_t i) const { return sections_[i].name; }

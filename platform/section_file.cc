@@ -80,17 +80,7 @@ extern "C" int KLIBCFileGetSectionValue(const char* file, const char* section,
   }
   SectionDoc doc;
   if (doc.Load(file) != 0) return -1;
-  const std::string* value = doc.Value(section, key);
-  if (value == nullptr) {
-    KLIBCErrSet(KERR_NOT_FOUND);
-    return -1;
-  }
-  if (value->size() >= static_cast<size_t>(size)) {
-    KLIBCErrSet(KERR_BUFFER_TOO_SMALL);
-    return -1;
-  }
-  memcpy(buf, value->c_str(), value->size() + 1);
-  return static_cast<int>(value->size());
+  return doc.CopyValue(section, key, buf, size);
 }
 
 extern "C" int KLIBCFileSetSection(const char* file, const char* section,
