@@ -76,6 +76,34 @@ namespace {
 // RegistryLock objects of the thread share it.
 thread_local int held_handle = -1;
 thread_local int held_depth = 0;
+
+// While the thread holds the lock no other writer changes the registry, so
+// what the thread read under it stays true until it gives the lock back: the
+// registry is read once for everything done under one lock (a whole
+// command), and kept in step with the thread's own writes. The file's
+// identity guards against a writer that bypasses the lock.
+struct Snapshot {
+  RegistryPtr doc;
+  std::string path;
+  struct stat st;
+};
+thread_local Snapshot held_snapshot;
+
+bool SameFile(const struct stat& a, const struct stat& b) {
+  return a.st_dev == b.st_dev && a.st_ino == b.st_ino &&
+         a.st_size == b.st_size && a.st_mtim.tv_sec == b.st_mtim.tv_sec &&
+         a.st_mtim.tv_nsec == b.st_mtim.tv_nsec;
+}
+
+// Keeps `doc` as the snapshot when the thread holds the lock; forgets the
+// snapshot when it does not, or when `doc` is null.
+void KeepSnapshot(const RegistryPtr& doc, const std::string& path) {
+  held_snapshot = Snapshot{};
+  if (held_depth > 0 && doc && stat(path.c_str(), &held_snapshot.st) == 0) {
+    held_snapshot.doc = doc;
+    held_snapshot.path = path;
+  }
+}
 }  // namespace
 
 RegistryLock::RegistryLock(int timeout_ms) {
@@ -98,20 +126,40 @@ RegistryLock::RegistryLock(int timeout_ms) {
 
 RegistryLock::~RegistryLock() {
   if (!locked_ || --held_depth > 0) return;
+  held_snapshot = Snapshot{};
   KLIBCSemUnlock(held_handle);
   KLIBCSemClose(held_handle);
   held_handle = -1;
 }
 
 RegistryPtr ReadRegistry() {
+  const std::string path = RegistryPath();
+  struct stat st;
+  if (held_depth > 0 && held_snapshot.doc && held_snapshot.path == path &&
+      stat(path.c_str(), &st) == 0 && SameFile(st, held_snapshot.st)) {
+    return held_snapshot.doc;
+  }
   RegistryPtr doc = std::make_shared<SectionDoc>();
-  if (doc->Load(RegistryPath().c_str()) != 0) return nullptr;
+  // Identified before it is read: a change in between makes the snapshot
+  // look stale, never the other way round.
+  bool known = held_depth > 0 && stat(path.c_str(), &st) == 0;
+  held_snapshot = Snapshot{};
+  if (doc->Load(path.c_str()) != 0) return nullptr;
+  if (known) held_snapshot = Snapshot{doc, path, st};
   return doc;
 }
 
-int WriteRegistry(const SectionDoc& doc) {
-  return doc.Store(RegistryPath().c_str());
+int WriteRegistry(const RegistryPtr& doc) {
+  const std::string path = RegistryPath();
+  if (doc->Store(path.c_str()) != 0) {
+    ForgetRegistry();
+    return -1;
+  }
+  KeepSnapshot(doc, path);
+  return 0;
 }
+
+void ForgetRegistry() { held_snapshot = Snapshot{}; }
 
 int CopySection(const SectionDoc& doc, const std::string& section,
                 KSZHASH* out) {
@@ -155,8 +203,10 @@ bool LoadPairedClientInfo(RegistryPtr* doc, HashPtr* hash) {
   return *hash != nullptr;
 }
 
-int StorePairedClientInfo(SectionDoc* doc, const KSZHASH* values) {
+int StorePairedClientInfo(const RegistryPtr& doc, const KSZHASH* values) {
   if (S2SCheckServerInfo() != 0 || !Holdable(kPairedClientInfo, values)) {
+    // The caller may have changed `doc` already.
+    ForgetRegistry();
     return -1;
   }
   karo_detail::SectionPairs* pairs = doc->Add(kPairedClientInfo);
@@ -164,7 +214,7 @@ int StorePairedClientInfo(SectionDoc* doc, const KSZHASH* values) {
     SectionDoc::Set(pairs, KLIBCSzHashKeyAt(values, i),
                     KLIBCSzHashValueAt(values, i));
   }
-  return WriteRegistry(*doc) == 0 ? 0 : -1;
+  return WriteRegistry(doc) == 0 ? 0 : -1;
 }
 
 int UpdateServerInfoLocked(const char* section, const KSZHASH* values) {
@@ -191,7 +241,7 @@ int UpdateServerInfoLocked(const char* section, const KSZHASH* values) {
                         KLIBCSzHashValueAt(values, i));
       }
       *doc->Add(name) = std::move(pairs);
-      ok = WriteRegistry(*doc) == 0;
+      ok = WriteRegistry(doc) == 0;
     }
     if (!ok) {
       Syslog(LOG_ERR,
@@ -289,7 +339,7 @@ extern "C" int KAROUISetS2S(int enable, const char* clientID,
       0) {
     return -1;
   }
-  return S2S::detail::StorePairedClientInfo(doc.get(), hash.get());
+  return S2S::detail::StorePairedClientInfo(doc, hash.get());
 }
 
 extern "C" int KAROS2SIsSyncedShare(const char* shareName) {

@@ -68,14 +68,21 @@ class RegistryLock {
 using karo_detail::SectionDoc;
 using RegistryPtr = std::shared_ptr<SectionDoc>;
 
-// The registry file read once. nullptr, with the platform error set
-// (KERR_FILE_NOT_FOUND, KERR_FILE_FORMAT, KERR_SYSTEM), when it cannot be
-// read.
+// The registry file read once: read now, or, while this thread holds the
+// lock, the snapshot it read under the lock (the same object for every
+// call). nullptr, with the platform error set (KERR_FILE_NOT_FOUND,
+// KERR_FILE_FORMAT, KERR_SYSTEM), when it cannot be read. A caller that
+// changes the snapshot writes it (WriteRegistry) or forgets it
+// (ForgetRegistry).
 RegistryPtr ReadRegistry();
 
-// Writes `doc` (read by ReadRegistry, then changed) as the registry. The
-// caller holds the lock. 0, or -1 (KERR_SYSTEM).
-int WriteRegistry(const SectionDoc& doc);
+// Writes `doc` (from ReadRegistry, changed) as the registry; it stays the
+// thread's snapshot while the thread holds the lock. The caller holds the
+// lock. 0, or -1 (KERR_SYSTEM; the snapshot is forgotten).
+int WriteRegistry(const RegistryPtr& doc);
+
+// Forgets the thread's snapshot, after a change that is not written.
+void ForgetRegistry();
 
 // Adds the pairs of `section` of `doc` to `out`: 1, 0 when there is no such
 // section, -1 (KERR_NO_MEMORY) when `out` is full.
@@ -97,7 +104,7 @@ bool LoadPairedClientInfo(RegistryPtr* doc, HashPtr* hash);
 
 // Sets the pairs of `values` in "PairedClientInfo" of `doc` (added when
 // absent) and writes `doc`. The caller holds the lock. 0, or -1.
-int StorePairedClientInfo(SectionDoc* doc, const KSZHASH* values);
+int StorePairedClientInfo(const RegistryPtr& doc, const KSZHASH* values);
 
 // S2SUpdateServerInfo for a caller that already holds the lock.
 int UpdateServerInfoLocked(const char* section, const KSZHASH* values);

@@ -214,7 +214,7 @@ extern "C" int s2s_svr_reset_pair(void) {
       KLIBCSzHashSetValue(hash.get(), "serverName", kMultiSrcMarker) != 0) {
     return -1;
   }
-  return S2S::detail::StorePairedClientInfo(doc.get(), hash.get());
+  return S2S::detail::StorePairedClientInfo(doc, hash.get());
 }
 
 extern "C" int S2SCheckIfSharePaired(const KSZLIST* shares,

@@ -21,11 +21,13 @@ namespace {
 
 const char kBlanks[] = " \t\r";
 
+bool IsBlank(char c) { return c == ' ' || c == '\t' || c == '\r'; }
+
 std::string_view Trim(std::string_view s) {
-  size_t b = s.find_first_not_of(kBlanks);
-  if (b == std::string_view::npos) return {};
-  size_t e = s.find_last_not_of(kBlanks);
-  return s.substr(b, e - b + 1);
+  size_t b = 0, e = s.size();
+  while (b < e && IsBlank(s[b])) ++b;
+  while (e > b && IsBlank(s[e - 1])) --e;
+  return s.substr(b, e - b);
 }
 
 bool HasOuterBlanks(const char* s) {
@@ -137,6 +139,7 @@ int SectionDoc::Load(const char* file) {
   // Most sections take a few lines of some 20 bytes: reserving for that
   // spares the index its rehashes.
   index_.reserve(text.size() / 128);
+  sections_.reserve(text.size() / 128);
   std::vector<std::unique_ptr<KeyIndex>> keys;  // per section, when large
   long current = -1;
   for (size_t pos = 0; pos < all.size();) {
