@@ -54,8 +54,10 @@ bool ReadTolerant(const SectionDoc* doc, const char* section, const char* key,
 
 std::string RegistryPath() { return KaroRootPath(kRegistryFile); }
 
-int RegistrySemKey() {
-  std::string root = KaroRootPrefix();
+int RegistrySemKey() { return RegistrySemKeyFor(KaroRootPrefix()); }
+
+int RegistrySemKeyFor(std::string root) {
+  while (!root.empty() && root.back() == '/') root.pop_back();
   if (root.empty()) return kRegistrySemKey;
   // One root named by two paths must still share its lock.
   char real[PATH_MAX];

@@ -36,8 +36,10 @@ const char kMultiSrcMarker[] = "S2SMULTI-SRC-SUPPORT";
 
 // The registry file resolved under the root.
 std::string RegistryPath();
-// The semaphore key of the current root.
+// The semaphore key of the current root, and of the root at `root` (a
+// prefix as S2S_ROOT gives it).
 int RegistrySemKey();
+int RegistrySemKeyFor(std::string root);
 
 struct HashFree {
   void operator()(KSZHASH* hash) const { KLIBCSzHashFree(hash); }

@@ -23,6 +23,7 @@ packages=(
   libgtest-dev libgmock-dev libbenchmark-dev
   rsync openssh-server openssh-client samba-common-bin acl tzdata
   scdoc man-db lintian
+  clang libclang-rt-14-dev
 )
 
 install_missing() {

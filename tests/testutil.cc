@@ -7,6 +7,7 @@
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <sys/sem.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -20,6 +21,7 @@
 #include <mutex>
 #include <sstream>
 
+#include "S2S/is_syncedshare_detail.h"
 #include "S2S/logger.h"
 #include "S2S/syslog_sink.h"
 
@@ -132,7 +134,26 @@ TempDir::TempDir() {
   path_ = made;
 }
 
+namespace {
+
+// A root's registry lock outlives its files (a System V semaphore): the
+// locks of the directory and of the roots directly inside it go with it.
+void RemoveRegistryLocks(const std::string& dir) {
+  std::vector<std::string> roots = {dir};
+  std::error_code ec;
+  for (const auto& e : std::filesystem::directory_iterator(dir, ec)) {
+    if (e.is_directory(ec)) roots.push_back(e.path().string());
+  }
+  for (const std::string& root : roots) {
+    int id = semget(S2S::detail::RegistrySemKeyFor(root), 1, 0);
+    if (id >= 0) semctl(id, 0, IPC_RMID);
+  }
+}
+
+}  // namespace
+
 TempDir::~TempDir() {
+  RemoveRegistryLocks(path_);
   std::error_code ec;
   std::filesystem::remove_all(path_, ec);
 }
