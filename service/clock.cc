@@ -23,12 +23,19 @@ const Clock& SystemClock() {
   return clock;
 }
 
-long OffsetClock::WallSeconds() const {
-  return SystemClock().WallSeconds() + offset_;
+long ShiftedClock::WallSeconds() const {
+  timespec ts;
+  clock_gettime(CLOCK_REALTIME, &ts);
+  return static_cast<long>(ts.tv_sec) * rate_ + offset_ +
+         static_cast<long>(ts.tv_nsec * static_cast<double>(rate_) / 1e9);
 }
 
-double OffsetClock::MonotonicSeconds() const {
+double ShiftedClock::MonotonicSeconds() const {
   return SystemClock().MonotonicSeconds();
+}
+
+double ShiftedClock::SystemSecondsOf(long wall) const {
+  return static_cast<double>(wall - offset_) / static_cast<double>(rate_);
 }
 
 }  // namespace s2s_service

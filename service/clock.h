@@ -13,22 +13,30 @@ class Clock {
   virtual long WallSeconds() const = 0;
   // Seconds on a clock that never jumps.
   virtual double MonotonicSeconds() const = 0;
+  // The system's wall-clock time (seconds since the epoch) at which this
+  // clock reads `wall`: where the service arms its timer.
+  virtual double SystemSecondsOf(long wall) const {
+    return static_cast<double>(wall);
+  }
 };
 
 // The system's clocks (CLOCK_REALTIME, CLOCK_MONOTONIC).
 const Clock& SystemClock();
 
-// The system's clocks with the wall clock `offset` seconds ahead, so that a
-// test or a benchmark can bring a schedule's time near without waiting for
-// it.
-class OffsetClock : public Clock {
+// The system's clocks with the wall clock moved: it reads
+// system time * `rate` + `offset`, so that a test or a benchmark can bring a
+// schedule's time near, or let the schedule's minutes pass in seconds,
+// without waiting for them.
+class ShiftedClock : public Clock {
  public:
-  explicit OffsetClock(long offset) : offset_(offset) {}
+  ShiftedClock(long offset, long rate) : offset_(offset), rate_(rate) {}
   long WallSeconds() const override;
   double MonotonicSeconds() const override;
+  double SystemSecondsOf(long wall) const override;
 
  private:
   long offset_;
+  long rate_;
 };
 
 }  // namespace s2s_service

@@ -188,8 +188,12 @@ void Daemon::ArmTimer() {
   if (at == 0) at = now + kIdleArm;
   // The timer runs on the system's wall clock; the service's clock may be
   // set apart from it.
+  double system_at = clock_.SystemSecondsOf(at);
   itimerspec its = {};
-  its.it_value.tv_sec = at - (now - SystemClock().WallSeconds());
+  its.it_value.tv_sec = static_cast<time_t>(system_at);
+  its.it_value.tv_nsec = static_cast<long>(
+      (system_at - static_cast<double>(its.it_value.tv_sec)) * 1e9);
+  if (its.it_value.tv_sec <= 0) its.it_value.tv_sec = 1;
   if (timerfd_settime(timer_fd_, TFD_TIMER_ABSTIME | TFD_TIMER_CANCEL_ON_SET,
                       &its, nullptr) != 0) {
     LogError(std::string("cannot arm the timer: ") + strerror(errno));
@@ -335,12 +339,17 @@ PObject Daemon::RunMap(const ActiveRun& run, bool ended) const {
   map["end"] =
       static_cast<unsigned long long>(ended ? clock_.WallSeconds() : 0);
   map["trigger"] = run.trigger;
-  const TaskOutcome& out = run.outcome;
+  // The outcome belongs to the run's thread until the run has ended.
+  static const TaskOutcome kRunning;
+  const TaskOutcome& out = ended ? run.outcome : kRunning;
+  std::string message = !ended              ? "running"
+                        : out.error.empty() ? "ok"
+                                            : out.error;
+  if (run.trigger == "catch-up") {
+    message += " (was due while the service was not running)";
+  }
   map["outcome"] = ended ? OutcomeOf(out) : "running";
-  map["message"] = ended ? (out.error.empty() ? "ok" : out.error)
-                         : (run.trigger == "catch-up"
-                                ? "was due while the service was not running"
-                                : "running");
+  map["message"] = message;
   map["task_status"] = static_cast<int>(ended ? kStatusIdle : kStatusRunning);
   map["task_result"] = ended ? out.exit_code : 0;
   PObject::Array shares;
@@ -367,10 +376,7 @@ void Daemon::Start(unsigned long long id, const std::string& trigger) {
   run->trigger = trigger;
   run->started = clock_.WallSeconds();
   run->beacon_interval = config_.beacon_interval;
-  std::string error;
-  if (!history_.Begin(id, RunMap(*run, false), error)) LogError(error);
   runs_[id] = run;
-  LogInfo("task " + std::to_string(id) + " started (" + trigger + ")");
   StartRun(run, [this](unsigned long long ended) {
     {
       std::lock_guard<std::mutex> lock(mu_);
@@ -378,6 +384,11 @@ void Daemon::Start(unsigned long long id, const std::string& trigger) {
     }
     Wake(ended_fd_);
   });
+  // Written while the run already probes the server: the history's write
+  // waits for the disk.
+  std::string error;
+  if (!history_.Begin(id, RunMap(*run, false), error)) LogError(error);
+  LogInfo("task " + std::to_string(id) + " started (" + trigger + ")");
 }
 
 void Daemon::OnRunsEnded() {

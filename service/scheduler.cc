@@ -17,7 +17,9 @@ void Scheduler::Push(unsigned long long id, Entry& e) {
 }
 
 void Scheduler::Compute(Entry& e, long now) {
-  e.next = e.enabled ? e.schedule.GetNextScheduledSeconds(now) : 0;
+  // A realtime schedule is "due" every second; it is run when asked.
+  bool timed = e.enabled && e.schedule.GetMode() != S2S::SCHD_REALTIME;
+  e.next = timed ? e.schedule.GetNextScheduledSeconds(now) : 0;
 }
 
 void Scheduler::Set(unsigned long long id, const S2S::Schedule& schedule,

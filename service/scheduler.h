@@ -8,9 +8,10 @@
 // service arms its one timer with.
 //
 // A schedule that has no next time gives 0 (manual, a once schedule that
-// is over) and is never due; -1 (the local-time arithmetic failed) is kept
-// as the task's schedule error. Retries back off 1, 2, 4 ... minutes up to
-// 30 and are dropped when they would come after the next scheduled run.
+// is over, and realtime, which would be due every second) and is never due; -1
+// (the local-time arithmetic failed) is kept as the task's schedule error.
+// Retries back off 1, 2, 4 ... minutes up to 30 and are dropped when they would
+// come after the next scheduled run.
 //
 // Thread-safety: none; the service's loop owns it.
 #ifndef S2S_SERVICE_SCHEDULER_H_

@@ -348,6 +348,17 @@ class ServiceTest : public ::testing::Test {
     return out;
   }
 
+  // How many transfers of share big have started.
+  size_t BigTransfersStarted() {
+    std::string log = ReadFile(rsync_log_);
+    size_t n = 0;
+    for (size_t at = log.find(app_.ClientShare("big")); at != std::string::npos;
+         at = log.find(app_.ClientShare("big"), at + 1)) {
+      ++n;
+    }
+    return n;
+  }
+
   // Seconds to add to the clock so that it reads 12:00 and `second`
   // seconds today, amid the runs of EveryMinute.
   static long OffsetTo(int second) {
@@ -428,15 +439,7 @@ TEST_F(ServiceTest, CancelEndsALongTransferAndTheServerShowsTheTaskIdle) {
   unsigned long long id = Add("long", {"big"}, S2S::Schedule());
   ASSERT_EQ(0u, Request(Action("run", id))["result"].asUInt64());
   // Wait for the data transfer itself.
-  ASSERT_TRUE(WaitFor(
-      [&] {
-        for (const Transfer& t : Transfers()) {
-          if (t.share == "big") return true;
-        }
-        return ReadFile(rsync_log_).find(app_.ClientShare("big")) !=
-               std::string::npos;
-      },
-      30));
+  ASSERT_TRUE(WaitFor([&] { return BigTransfersStarted() == 1; }, 30));
   auto start = std::chrono::steady_clock::now();
   PObject cancel = Request(Action("cancel", id));
   EXPECT_EQ(1u, cancel["was_running"].asUInt64())
@@ -446,6 +449,16 @@ TEST_F(ServiceTest, CancelEndsALongTransferAndTheServerShowsTheTaskIdle) {
   EXPECT_LT(s2s_test::SecondsSince(start), 5.0);
   EXPECT_EQ("idle", app_.ServerRegistry("TASK_long", "status"));
   EXPECT_EQ("idle", Request(Action("get", id))["task"]["state"].asString());
+
+  // SIGTERM during the next transfer: cancelled the same way, and s2sd ends.
+  ASSERT_EQ(0u, Request(Action("run", id))["result"].asUInt64());
+  ASSERT_TRUE(WaitFor([&] { return BigTransfersStarted() == 2; }, 30));
+  EXPECT_EQ(0, StopDaemon());
+  PObject::Array runs = History(HistoryDir()).Runs(id, 1);
+  ASSERT_EQ(1u, runs.size());
+  EXPECT_EQ("cancelled", runs[0]["outcome"].asString());
+  EXPECT_EQ("idle", app_.ServerRegistry("TASK_long", "status"));
+  EXPECT_FALSE(std::filesystem::exists(PidFilePath()));
 }
 
 TEST_F(ServiceTest, SharedShareNeverAtOnceAndNoMoreThanMaxParallelRuns) {

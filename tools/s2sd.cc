@@ -30,8 +30,9 @@ const char kUsage[] =
     "  --root DIR     the appliance root (default: $S2S_ROOT, else /)\n"
     "  --log WHERE    syslog (default), stderr, or a file to append to\n"
     "  -v             also log each step of every run; -vv: debug\n"
-    "  --clock-offset S  schedules see the wall clock S seconds ahead\n"
-    "                 (for tests and benchmarks)\n"
+    "  --clock-offset S, --clock-rate R\n"
+    "                 schedules see the wall clock as system time * R + S\n"
+    "                 (for tests and benchmarks; default 0 and 1)\n"
     "\n"
     "Settings: <root>/etc/s2s/s2sd.conf, section [Service]: max_parallel,\n"
     "admin_group, beacon_interval. SIGHUP reloads the tasks; SIGTERM\n"
@@ -51,7 +52,7 @@ void WrapperLog(int priority, const char* message) {
 
 int main(int argc, char** argv) {
   std::string root, log = "syslog";
-  long clock_offset = 0;
+  long clock_offset = 0, clock_rate = 1;
   for (int i = 1; i < argc; ++i) {
     std::string a = argv[i];
     std::string value;
@@ -59,25 +60,27 @@ int main(int argc, char** argv) {
     if (a.compare(0, 2, "--") == 0 && eq != std::string::npos) {
       value = a.substr(eq + 1);
       a = a.substr(0, eq);
-    } else if ((a == "--root" || a == "--log" || a == "--clock-offset") &&
-               i + 1 < argc) {
+    } else if (a == "--root" || a == "--log" || a == "--clock-offset" ||
+               a == "--clock-rate") {
+      if (i + 1 == argc) {
+        fprintf(stderr, "s2sd: %s needs a value\n", a.c_str());
+        return 2;
+      }
       value = argv[++i];
-    } else if (a == "--root" || a == "--log" || a == "--clock-offset") {
-      fprintf(stderr, "s2sd: %s needs a value\n", a.c_str());
-      return 2;
     }
-    if (a == "--foreground") {
+    if (a == "--clock-offset" || a == "--clock-rate") {
+      char* end = nullptr;
+      long n = strtol(value.c_str(), &end, 10);
+      if (value.empty() || *end != '\0' || (a == "--clock-rate" && n < 1)) {
+        fprintf(stderr, "s2sd: %s needs a number\n", a.c_str());
+        return 2;
+      }
+      (a == "--clock-offset" ? clock_offset : clock_rate) = n;
+    } else if (a == "--foreground") {
     } else if (a == "--root") {
       root = value;
     } else if (a == "--log") {
       log = value;
-    } else if (a == "--clock-offset") {
-      char* end = nullptr;
-      clock_offset = strtol(value.c_str(), &end, 10);
-      if (value.empty() || *end != '\0') {
-        fprintf(stderr, "s2sd: --clock-offset needs a number of seconds\n");
-        return 2;
-      }
     } else if (a == "-v") {
       ++g_verbose;
     } else if (a == "-vv") {
@@ -115,7 +118,7 @@ int main(int argc, char** argv) {
                         error.c_str());
     return 1;
   }
-  s2s_service::OffsetClock clock(clock_offset);
+  s2s_service::ShiftedClock clock(clock_offset, clock_rate);
   s2s_service::Daemon daemon(config, clock);
   return daemon.Run();
 }
