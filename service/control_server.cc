@@ -105,7 +105,8 @@ bool ControlServer::Permitted(int fd) const {
   ucred cred;
   socklen_t len = sizeof cred;
   if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) return false;
-  return cred.uid == 0 || (has_admin_group_ && cred.gid == admin_gid_);
+  return cred.uid == 0 || cred.uid == geteuid() ||
+         (has_admin_group_ && cred.gid == admin_gid_);
 }
 
 void ControlServer::Serve() {
@@ -126,14 +127,9 @@ void ControlServer::Serve() {
 }
 
 void ControlServer::Connection(int fd) {
-  if (!Permitted(fd)) {
-    S2S::Logger::LogMsg(S2S::Logger::Warning,
-                        "[WARNING] control: a peer that is not permitted was "
-                        "refused\n");
-    SendReply(fd, MakeReply(kResultNotPermitted,
-                            "not permitted: only root or the admin group"));
-    return;
-  }
+  // A refused peer's request is read all the same, so that the reply is
+  // not lost to a connection reset over unread bytes.
+  bool permitted = Permitted(fd);
   std::string data;
   PObject request;
   long long deadline = NowMs() + kRequestSeconds * 1000LL;
@@ -170,6 +166,15 @@ void ControlServer::Connection(int fd) {
       return;
     }
     data.append(buf, static_cast<size_t>(n));
+  }
+  if (!permitted) {
+    S2S::Logger::LogMsg(S2S::Logger::Warning,
+                        "[WARNING] control: a peer that is not permitted was "
+                        "refused\n");
+    SendReply(fd, MakeReply(kResultNotPermitted,
+                            "not permitted: only root, the service's user or "
+                            "the admin group"));
+    return;
   }
   SendReply(fd, handler_(request));
 }

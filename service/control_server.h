@@ -1,14 +1,13 @@
 // The control socket's connections, one at a time on a thread of their own,
 // so that a slow or hostile peer never holds up the service's loop.
 //
-// For each connection: the peer's credentials (SO_PEERCRED) are checked
-// first, and a peer that is neither root nor in the admin group gets one
-// reply with result 6; then the request is read with a deadline
-// (kRequestSeconds for the whole of it) and a size limit (kMaxRequest),
-// decoded (service/wire_reader.h), handed to the handler, and the handler's
-// reply sent. Bytes that cannot be a message, a peer that goes away or one
-// that is too slow get no reply: the connection is closed and the next one
-// served.
+// For each connection the request is read with a deadline (kRequestSeconds
+// for the whole of it) and a size limit (kMaxRequest) and decoded
+// (service/wire_reader.h); a peer (SO_PEERCRED) that is neither root, nor
+// the service's own user, nor in the admin group then gets one reply with
+// result 6; any other request goes to the handler and its reply is sent. Bytes
+// that cannot be a message, a peer that goes away or one that is too slow get
+// no reply: the connection is closed and the next one served.
 #ifndef S2S_SERVICE_CONTROL_SERVER_H_
 #define S2S_SERVICE_CONTROL_SERVER_H_
 
