@@ -5,9 +5,11 @@
 #include <signal.h>
 #include <string.h>
 #include <sys/eventfd.h>
+#include <sys/inotify.h>
 #include <sys/signalfd.h>
 #include <sys/stat.h>
 #include <sys/timerfd.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -114,6 +116,13 @@ bool Daemon::Setup() {
   timer_fd_ = timerfd_create(CLOCK_REALTIME, TFD_CLOEXEC | TFD_NONBLOCK);
   ended_fd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
   request_fd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  // The C library's zone: /etc/localtime unless TZ names another.
+  zone_fd_ = inotify_init1(IN_CLOEXEC | IN_NONBLOCK);
+  if (zone_fd_ >= 0 && inotify_add_watch(zone_fd_, "/etc",
+                                         IN_CREATE | IN_MOVED_TO |
+                                             IN_CLOSE_WRITE | IN_DELETE) < 0) {
+    LogInfo("changes of the time zone are not watched");
+  }
   if (signal_fd_ < 0 || timer_fd_ < 0 || ended_fd_ < 0 || request_fd_ < 0) {
     LogError(std::string("cannot make the loop's descriptors: ") +
              strerror(errno));
@@ -151,7 +160,8 @@ void Daemon::Teardown() {
     if (it.second->thread.joinable()) it.second->thread.join();
   }
   runs_.clear();
-  for (int* fd : {&timer_fd_, &signal_fd_, &ended_fd_, &request_fd_}) {
+  for (int* fd :
+       {&timer_fd_, &signal_fd_, &ended_fd_, &request_fd_, &zone_fd_}) {
     if (*fd >= 0) close(*fd);
     *fd = -1;
   }
@@ -164,12 +174,13 @@ void Daemon::Teardown() {
 
 void Daemon::Loop() {
   ArmTimer();
-  pollfd fds[4] = {{timer_fd_, POLLIN, 0},
+  pollfd fds[5] = {{timer_fd_, POLLIN, 0},
                    {signal_fd_, POLLIN, 0},
                    {ended_fd_, POLLIN, 0},
-                   {request_fd_, POLLIN, 0}};
+                   {request_fd_, POLLIN, 0},
+                   {zone_fd_, POLLIN, 0}};
   while (!(stopping_ && runs_.empty())) {
-    if (poll(fds, 4, -1) < 0) {
+    if (poll(fds, 5, -1) < 0) {
       if (errno == EINTR) continue;
       LogError(std::string("poll: ") + strerror(errno));
       return;
@@ -177,6 +188,7 @@ void Daemon::Loop() {
     if (fds[2].revents != 0) OnRunsEnded();
     if (fds[1].revents != 0) OnSignal();
     if (fds[3].revents != 0) OnRequests();
+    if (fds[4].revents != 0) OnZoneChange();
     if (fds[0].revents != 0) OnTimer();
   }
   LogInfo("stopped");
@@ -219,6 +231,25 @@ void Daemon::OnTimer() {
               " was due while it ran; the run is not repeated");
     }
   }
+  ArmTimer();
+}
+
+void Daemon::OnZoneChange() {
+  alignas(inotify_event) char buf[4096];
+  bool zone = false;
+  ssize_t n;
+  while ((n = read(zone_fd_, buf, sizeof buf)) > 0) {
+    for (ssize_t at = 0; at < n;) {
+      const inotify_event* e = reinterpret_cast<const inotify_event*>(buf + at);
+      std::string name = e->len > 0 ? e->name : "";
+      zone = zone || name == "localtime" || name == "timezone";
+      at += static_cast<ssize_t>(sizeof(inotify_event) + e->len);
+    }
+  }
+  if (!zone) return;
+  tzset();
+  LogInfo("the time zone changed; next runs recomputed");
+  scheduler_.RecomputeAll(clock_.WallSeconds());
   ArmTimer();
 }
 

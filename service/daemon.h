@@ -5,7 +5,9 @@
 // at the scheduler's earliest due time and cancelled by a clock change, so
 // that every next time is then recomputed), the signals (signalfd), and two
 // queues it waits on through eventfds: runs that ended, and requests from
-// the control socket's thread. Runs happen on worker threads (one Rsyncer
+// the control socket's thread; and an inotify watch on /etc, where the
+// local time zone lies, so that a change of zone recomputes the next times
+// as a change of the clock does. Runs happen on worker threads (one Rsyncer
 // each); the loop never waits on a transfer. All task state belongs to the
 // loop's thread.
 //
@@ -67,6 +69,7 @@ class Daemon {
   void OnSignal();
   void OnRunsEnded();
   void OnRequests();
+  void OnZoneChange();
   void ArmTimer();
   void Reload(std::vector<std::string>& errors);
   void CatchUp();
@@ -118,6 +121,7 @@ class Daemon {
   int signal_fd_ = -1;
   int ended_fd_ = -1;    // eventfd: a run ended
   int request_fd_ = -1;  // eventfd: a request waits
+  int zone_fd_ = -1;     // inotify on /etc: the local time zone changed
   std::mutex mu_;        // guards the members below and each Pending
   std::vector<unsigned long long> ended_;
   std::deque<Pending*> requests_;
