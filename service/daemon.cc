@@ -304,12 +304,10 @@ void Daemon::CatchUp() {
   long now = clock_.WallSeconds();
   for (auto& it : tasks_) {
     std::string error;
+    // A task that never recorded a slot (its file was written by hand) has
+    // nothing to catch up.
     long last = history_.LastDue(it.first);
-    if (last <= 0) {
-      if (!history_.SetLastDue(it.first, now, error)) LogError(error);
-      continue;
-    }
-    if (!it.second.stored.enabled) continue;
+    if (last <= 0 || !it.second.stored.enabled) continue;
     long missed =
         it.second.stored.task.GetInfo().GetSchedule().GetNextScheduledSeconds(
             last);

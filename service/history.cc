@@ -50,7 +50,9 @@ bool History::Save(unsigned long long id, const Entry& e, std::string& error) {
   record["last_due"] = static_cast<unsigned long long>(e.last_due);
   PObject::Array runs(e.runs.begin(), e.runs.end());
   record["runs"] = runs;
-  return WriteFileAtomic(PathOf(id), EncodeRecord(record), 0600, error);
+  // Not synced: a run's start and end are written often, and a lost entry
+  // after a power cut costs less than a disk wait per run.
+  return WriteFileAtomic(PathOf(id), EncodeRecord(record), 0600, error, false);
 }
 
 bool History::Begin(unsigned long long id, const PObject& run,

@@ -171,7 +171,7 @@ bool MakeDirs(const std::string& dir, std::string& error) {
 }
 
 bool WriteFileAtomic(const std::string& path, const std::string& data,
-                     unsigned int mode, std::string& error) {
+                     unsigned int mode, std::string& error, bool sync) {
   size_t slash = path.rfind('/');
   if (slash != std::string::npos && slash > 0 &&
       !MakeDirs(path.substr(0, slash), error)) {
@@ -190,7 +190,7 @@ bool WriteFileAtomic(const std::string& path, const std::string& data,
     ok = n > 0;
     if (ok) done += static_cast<size_t>(n);
   }
-  ok = ok && fsync(fd) == 0;
+  ok = ok && (!sync || fsync(fd) == 0);
   int saved = errno;
   ok = close(fd) == 0 && ok;
   if (ok && rename(tmp.c_str(), path.c_str()) != 0) {

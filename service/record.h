@@ -26,10 +26,11 @@ bool DecodeRecord(const std::string& text, S2S::PObject& map,
                   std::string& error);
 
 // Writes `data` to `path` through a temporary file in the same directory,
-// synced and renamed over it, with mode `mode`; missing directories are
-// made (0755). Returns true, or false with `error` saying what failed.
+// renamed over it, with mode `mode`; missing directories are made (0755).
+// With `sync` the data reaches the disk before the rename. Returns true, or
+// false with `error` saying what failed.
 bool WriteFileAtomic(const std::string& path, const std::string& data,
-                     unsigned int mode, std::string& error);
+                     unsigned int mode, std::string& error, bool sync = true);
 // Reads the whole of `path` into `data`. True, or false with `error`.
 bool ReadWholeFile(const std::string& path, std::string& data,
                    std::string& error);
