@@ -125,7 +125,10 @@ int WriteDaemonConfig(const DaemonConfig& c) {
       return -1;
     }
   }
-  std::string hook = c.handler + (root.empty() ? "" : " --root " + root) +
+  // `exec`: the shell the daemon runs a hook through becomes the handler
+  // instead of waiting for it in a process of its own.
+  std::string hook = "exec " + c.handler +
+                     (root.empty() ? "" : " --root " + root) +
                      (c.old_server ? " --old-server" : "");
   // The users configured before stay; `c.user` is added or gets its new
   // password. One user per client keeps one client's secret from opening
@@ -175,8 +178,7 @@ int WriteDaemonConfig(const DaemonConfig& c) {
           "\n\tread only = yes\n\tlist = no\n\tmax connections = 64\n"
           "\trefuse options = delete recursive\n" +
           auth + "\tearly exec = " + hook +
-          " early\n\tpre-xfer exec = " + hook +
-          " pre\n\tpost-xfer exec = " + hook + " post\n";
+          " early\n\tpre-xfer exec = " + hook + " pre\n";
   conf += std::string("[") + kSpoolModule + "]\n\tpath = " + UploadDir() +
           "\n\tread only = no\n\twrite only = yes\n\tlist = no\n"
           "\tmax connections = 16\n"

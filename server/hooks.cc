@@ -3,11 +3,15 @@
 #include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
+#include <poll.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <time.h>
 #include <unistd.h>
+
+#include <string>
 
 #include "command_file.h"
 #include "karo_root.h"
@@ -188,9 +192,6 @@ int PreHook(const HookEnv& env, bool old_server, FILE* out) {
     if (out != nullptr) fprintf(out, "malformed request id\n");
     return 1;
   }
-  for (const std::string& dir : {EarlyDir(), UploadDir(), ReplyDir()}) {
-    PruneStale(dir);
-  }
   std::string text;
   std::string early = EarlyDir() + "/" + env.pid;
   // The connection began when its early input was spooled.
@@ -227,6 +228,39 @@ int PostHook(const HookEnv& env) {
   unlink((early + ".id").c_str());
   unlink(early.c_str());
   return 0;
+}
+
+int CleanUpAfterConnection(const HookEnv& env) {
+  if (!IsPid(env.pid)) return -1;
+  pid_t connection = static_cast<pid_t>(std::stol(env.pid));
+  pid_t child = fork();
+  if (child < 0) {
+    LOG_WARNING("cannot leave a cleaner for connection %s: %s", env.pid.c_str(),
+                strerror(errno));
+    return -1;
+  }
+  if (child > 0) return 0;
+  // The cleaner holds none of the daemon's pipes, or the daemon would wait
+  // for it, and leaves the hook's session.
+  setsid();
+  int null = open("/dev/null", O_RDWR | O_CLOEXEC);
+  for (int fd = 0; fd < 3; ++fd) dup2(null, fd);
+  close_range(3, ~0u, 0);
+  int pidfd = static_cast<int>(syscall(SYS_pidfd_open, connection, 0));
+  if (pidfd >= 0) {
+    // Readable once the connection's process has ended; a connection that
+    // outlives every command's budget is left to the stale pruning.
+    struct pollfd p = {pidfd, POLLIN, 0};
+    int wait_ms = kSpoolStaleSeconds * 1000;
+    while (poll(&p, 1, wait_ms) < 0 && errno == EINTR) {
+    }
+    if ((p.revents & POLLIN) == 0) _exit(0);
+  }
+  PostHook(env);
+  for (const std::string& dir : {EarlyDir(), UploadDir(), ReplyDir()}) {
+    PruneStale(dir);
+  }
+  _exit(0);
 }
 
 int UploadHook(const HookEnv& env, FILE* out) {

@@ -4,7 +4,9 @@
 //   pre    (s2scmd, pre-xfer exec) reads the command (spooled early input,
 //          else the file uploaded to s2sspool), runs it, writes the reply
 //          file named by the request id into the command module
-//   post   (s2scmd, post-xfer exec) removes the spool, upload and reply
+//   post   (daemon configurations of older versions: s2scmd, post-xfer
+//          exec) removes the spool, upload and reply; the handler now does
+//          that after "pre" in a process of its own (CleanUpAfterConnection)
 //   data   (share modules, pre-xfer exec) lets a push through only from the
 //          client holding the share's running sync
 //   keys   (s2skeys, pre-xfer exec) the same for the key file of one share,
@@ -16,7 +18,8 @@
 //   upload-done (s2sspool, post-xfer exec) removes from the spool what is
 //          not a command file (too large, not a regular file)
 //
-// Every spool hook first removes entries older than kSpoolStaleSeconds.
+// Spool entries older than kSpoolStaleSeconds are removed by the upload and
+// key hooks before they start, and by a command's cleaner after it.
 //
 // Inputs come from the daemon's environment (RSYNC_PID, RSYNC_REQUEST,
 // RSYNC_MODULE_NAME, RSYNC_HOST_ADDR, RSYNC_USER_NAME) and are validated
@@ -52,6 +55,12 @@ int EarlyHook(const HookEnv& env, FILE* in);
 // `out`, when given, receives a refusal of the request itself.
 int PreHook(const HookEnv& env, bool old_server, FILE* out = nullptr);
 int PostHook(const HookEnv& env);
+// Leaves behind a process that waits for the daemon's connection process
+// (RSYNC_PID) to end, then does what PostHook does and removes stale spool
+// entries, so that neither the command nor the next one waits for a
+// cleanup hook. Returns 0 in the caller, or -1 (logged) when no process
+// could be started; stale entries are then pruned after a later command.
+int CleanUpAfterConnection(const HookEnv& env);
 // `out` receives the refusal, which the daemon shows the client.
 int DataHook(const HookEnv& env, FILE* out);
 int KeyHook(const HookEnv& env, FILE* out);

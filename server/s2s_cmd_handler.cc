@@ -74,7 +74,12 @@ int main(int argc, char** argv) {
   using namespace S2S::server;
   HookEnv env = HookEnv::FromEnvironment();
   if (strcmp(mode, "early") == 0) return EarlyHook(env, stdin);
-  if (strcmp(mode, "pre") == 0) return PreHook(env, old_server, stdout);
+  if (strcmp(mode, "pre") == 0) {
+    int rc = PreHook(env, old_server, stdout);
+    fflush(stdout);
+    CleanUpAfterConnection(env);
+    return rc;
+  }
   if (strcmp(mode, "post") == 0) return PostHook(env);
   if (strcmp(mode, "data") == 0) return DataHook(env, stdout);
   if (strcmp(mode, "keys") == 0) return KeyHook(env, stdout);

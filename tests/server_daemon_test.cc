@@ -6,7 +6,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <filesystem>
+#include <thread>
 
 #include "daemon_config.h"
 #include "gtest/gtest.h"
@@ -135,8 +137,16 @@ TEST_F(ServerDaemonTest, SyncRunAndDataModuleGuard) {
   EXPECT_EQ(0, Command("clientA", "S2S_SyncFinish",
                        {"finishType=\"share\"", "name=\"share1\""}));
   EXPECT_NE(0, Push());
-  // Nothing is left in the spool once the connections are over.
-  EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("var/spool/s2s/reply")));
+  // Nothing is left in the spool once the connections are over: each
+  // command's cleaner removes its files when its connection has ended.
+  const std::string replies = tmp_.Sub("var/spool/s2s/reply");
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+  while (!std::filesystem::is_empty(replies) &&
+         std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::yield();
+  }
+  EXPECT_TRUE(std::filesystem::is_empty(replies));
+  EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("var/spool/s2s/early")));
 }
 
 TEST_F(ServerDaemonTest, OversizedCommandIsRefusedWithStatus) {
