@@ -116,6 +116,15 @@ RegistryLock::RegistryLock(int timeout_ms) {
   }
   int handle = KLIBCSemOpen(RegistrySemKey());
   if (handle < 0) return;
+  // The lock belongs to whoever owns the registry's directory (the daemon
+  // user of a server in SSH mode), whichever process made it first.
+  struct stat dir;
+  std::string registry = RegistryPath();
+  if (geteuid() == 0 &&
+      stat(registry.substr(0, registry.rfind('/')).c_str(), &dir) == 0 &&
+      dir.st_uid != 0) {
+    KLIBCSemSetOwner(handle, dir.st_uid, dir.st_gid);
+  }
   if (KLIBCSemLockTimed(
           handle, timeout_ms < 0 ? kRegistryLockWaitMs : timeout_ms) != 0) {
     KLIBCSemClose(handle);

@@ -153,6 +153,10 @@ int KLIBCSemUnlock(int handle);
 /* Forgets the handle (the semaphore itself stays for other processes);
  * 0, or -1 for an invalid handle. */
 int KLIBCSemClose(int handle);
+/* Makes `uid`/`gid` the owner of the semaphore (mode stays 0600), so that
+ * processes of that user may open it too; only its owner or root may. 0
+ * (also when they own it already), or -1 (KERR_LOCK). */
+int KLIBCSemSetOwner(int handle, unsigned int uid, unsigned int gid);
 
 #ifdef __cplusplus
 }

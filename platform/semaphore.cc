@@ -114,3 +114,20 @@ extern "C" int KLIBCSemClose(int handle) {
   }
   return 0;
 }
+
+extern "C" int KLIBCSemSetOwner(int handle, unsigned int uid,
+                                unsigned int gid) {
+  struct semid_ds ds;
+  if (handle < 0 || semctl(handle, 0, IPC_STAT, &ds) != 0) {
+    KLIBCErrSet(KERR_LOCK);
+    return -1;
+  }
+  if (ds.sem_perm.uid == uid && ds.sem_perm.gid == gid) return 0;
+  ds.sem_perm.uid = uid;
+  ds.sem_perm.gid = gid;
+  if (semctl(handle, 0, IPC_SET, &ds) != 0) {
+    KLIBCErrSet(KERR_LOCK);
+    return -1;
+  }
+  return 0;
+}

@@ -8,6 +8,8 @@
 //   s2s-server [--root DIR] share add NAME[=PATH] [--encrypted]
 //   s2s-server [--root DIR] share remove NAME | share list
 //   s2s-server [--root DIR] release SHARE | reset-pairing
+//   s2s-server [--root DIR] ssh-setup --user USER --key-file FILE
+//              [--authorized-keys FILE]
 //
 // Exit codes: 0 done, 1 failed, 2 usage, 3 the daemon is not running
 // (status, pairings).
@@ -28,6 +30,7 @@
 #include "server_report.h"
 #include "server_root.h"
 #include "server_shares.h"
+#include "server_ssh.h"
 
 namespace {
 
@@ -56,6 +59,9 @@ const char kUsage[] =
     "  reset-pairing\n"
     "           forget the client the server is bound to: open to several\n"
     "           clients again\n"
+    "  ssh-setup --user USER --key-file FILE [--authorized-keys FILE]\n"
+    "           SSH mode: the client's key may log in as the daemon user\n"
+    "           only to run the daemon; run as root\n"
     "\n"
     "The root comes from --root or $S2S_ROOT. --help: this text; --version:\n"
     "the version.\n"
@@ -77,6 +83,8 @@ enum Option {
   kVersion,
   kJson,
   kEncrypted,
+  kKeyFile,
+  kAuthorizedKeys,
 };
 
 const struct option kOptions[] = {
@@ -95,6 +103,8 @@ const struct option kOptions[] = {
     {"version", no_argument, nullptr, kVersion},
     {"json", no_argument, nullptr, kJson},
     {"encrypted", no_argument, nullptr, kEncrypted},
+    {"key-file", required_argument, nullptr, kKeyFile},
+    {"authorized-keys", required_argument, nullptr, kAuthorizedKeys},
     {nullptr, 0, nullptr, 0},
 };
 
@@ -110,6 +120,7 @@ struct Args {
   int port = 0;
   std::string address = "127.0.0.1";
   bool json = false;
+  SshSetup ssh;
 };
 
 int Usage(const std::string& error) {
@@ -208,6 +219,14 @@ int Run(const Args& a) {
     printf("daemon: pid %ld, port %d\n", static_cast<long>(pid), port);
     return 0;
   }
+  if (a.command == "ssh-setup" && !has_words) {
+    SshSetup ssh = a.ssh;
+    ssh.user = a.user;
+    std::string done;
+    if (!SetUpSsh(ssh, done, error)) return Fail(error);
+    printf("%s\n", done.c_str());
+    return 0;
+  }
   if (a.command == "stop" && !has_words) {
     int rc = StopServerDaemon(error);
     if (rc < 0) return Fail(error);
@@ -233,7 +252,7 @@ int Run(const Args& a) {
     }
     pid_t pid;
     int port;
-    return ServerDaemonRunning(pid, port) ? 0 : 3;
+    return DaemonAlive(pid, port) ? 0 : 3;
   }
   if (a.command == "release") {
     std::string was;
@@ -326,6 +345,12 @@ int main(int argc, char** argv) {
       case kEncrypted:
         a.spec.encrypted = true;
         break;
+      case kKeyFile:
+        a.ssh.key_file = optarg;
+        break;
+      case kAuthorizedKeys:
+        a.ssh.authorized_keys = optarg;
+        break;
       default:
         return Usage(std::string("unknown or incomplete option ") +
                      argv[optind - 1]);
@@ -343,6 +368,9 @@ int main(int argc, char** argv) {
         "the real one)");
   }
   if (a.command == "config" && a.user.empty()) return Usage("config: --user");
+  if (a.command == "ssh-setup" && (a.user.empty() || a.ssh.key_file.empty())) {
+    return Usage("ssh-setup: --user USER --key-file FILE");
+  }
   S2S::Logger::Initialize(S2S::Logger::Stderr, S2S::Logger::Warning, "", 0);
   return Run(a);
 }

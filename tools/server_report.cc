@@ -8,7 +8,9 @@
 #include <vector>
 
 #include "S2S/is_syncedshare.h"
+#include "daemon_config.h"
 #include "json_writer.h"
+#include "karo_process.h"
 #include "karo_root.h"
 #include "karo_section.h"
 #include "karo_share.h"
@@ -50,6 +52,14 @@ struct TaskRow {
 
 }  // namespace
 
+bool DaemonAlive(pid_t& pid, int& port) {
+  if (ServerDaemonRunning(pid, port)) return true;
+  std::string unit_pid = S2S::server::DaemonPidPath();
+  port = 0;
+  pid = KaroReadPidFile(unit_pid.c_str());
+  return pid > 0 && KLIBCProcAliveByPidFile(unit_pid.c_str()) == 1;
+}
+
 int PrintStatus(FILE* out, bool json) {
   S2S_SVR_STATUS st = {};
   s2s_svr_get_status(&st);
@@ -60,7 +70,7 @@ int PrintStatus(FILE* out, bool json) {
   bool several = client == S2S_MULTI_SRC_MARKER;
   pid_t pid = -1;
   int port = 0;
-  bool daemon = ServerDaemonRunning(pid, port);
+  bool daemon = DaemonAlive(pid, port);
 
   std::vector<ShareRow> shares;
   List names(KLIBCSzListAlloc());
@@ -121,7 +131,10 @@ int PrintStatus(FILE* out, bool json) {
     fprintf(out, "paired:   client %s, server name %s\n",
             OrDash(client).c_str(), OrDash(server_name).c_str());
   }
-  if (daemon) {
+  if (daemon && port == 0) {
+    fprintf(out, "daemon:   pid %ld (started by its unit)\n",
+            static_cast<long>(pid));
+  } else if (daemon) {
     fprintf(out, "daemon:   pid %ld, port %d\n", static_cast<long>(pid), port);
   } else {
     fprintf(out, "daemon:   not running\n");

@@ -5,8 +5,14 @@
 #define S2S_TOOLS_SERVER_REPORT_H_
 
 #include <stdio.h>
+#include <sys/types.h>
 
 namespace s2s_tools {
+
+// True when this root's rsync daemon runs: the one `s2s-server start`
+// started (pid and port set), else one that a unit started on the same
+// configuration (its pid from the configuration's pid file, port 0).
+bool DaemonAlive(pid_t& pid, int& port);
 
 // The service status (running, busy, the paired client or "open to several
 // clients"), the daemon's pid and port, each configured share's running and

@@ -14,6 +14,7 @@
 #include "karo_section.h"
 #include "karo_share.h"
 #include "root_files.h"
+#include "server_ssh.h"
 
 namespace s2s_tools {
 
@@ -88,7 +89,7 @@ bool WriteServerConfig(const std::string& handler, const std::string& user,
     error = "cannot write the daemon configuration";
     return false;
   }
-  return true;
+  return RefreshSshConfig(error);
 }
 
 std::string DefaultHandler() { return KaroProgramPath("s2s-cmd-handler"); }

@@ -37,7 +37,8 @@ bool ParseShareSpec(const std::string& text, ShareSpec& out);
 bool InitServerRoot(const RootSpec& spec, std::string& error);
 
 // Writes rsyncd.conf and the secrets file for the daemon user `user`, run
-// as this process's uid and gid, with the hooks running `handler`.
+// as this process's uid and gid, with the hooks running `handler`; in SSH
+// mode (server_ssh.h) its variant for the daemon started over SSH too.
 bool WriteServerConfig(const std::string& handler, const std::string& user,
                        const std::string& password, bool old_server,
                        std::string& error);
