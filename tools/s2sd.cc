@@ -33,6 +33,7 @@ const char kUsage[] =
     "  --clock-offset S, --clock-rate R\n"
     "                 schedules see the wall clock as system time * R + S\n"
     "                 (for tests and benchmarks; default 0 and 1)\n"
+    "  --help, --version  this text; the version\n"
     "\n"
     "Settings: <root>/etc/s2s/s2sd.conf, section [Service]: max_parallel,\n"
     "admin_group, beacon_interval. SIGHUP reloads the tasks; SIGTERM\n"
@@ -87,6 +88,9 @@ int main(int argc, char** argv) {
       g_verbose += 2;
     } else if (a == "--help" || a == "-h") {
       fputs(kUsage, stdout);
+      return 0;
+    } else if (a == "--version") {
+      printf("s2sd %s\n", S2S_VERSION);
       return 0;
     } else {
       fprintf(stderr, "s2sd: unknown argument %s\n(try --help)\n", a.c_str());
