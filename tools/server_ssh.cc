@@ -49,9 +49,12 @@ bool WriteOwned(const std::string& path, const std::string& data, int mode,
   return false;
 }
 
+// Where the daemon started over SSH keeps its connection count.
+std::string SshRunDir() { return KaroRootPath("/var/run/s2s-ssh"); }
+
 // The daemon configuration as a daemon started over SSH by the user needs
 // it: no chroot, uid or gid (only root may), no pid file (it serves one
-// connection), its own secrets file.
+// connection), a lock file the user may write, its own secrets file.
 std::string SshVariant(const std::string& conf) {
   std::istringstream in(conf);
   std::string out;
@@ -62,10 +65,8 @@ std::string SshVariant(const std::string& conf) {
       continue;
     }
     if (line == "\tuse chroot = yes") line = "\tmunge symlinks = no";
-    // Only root keeps owners as they are; the user keeps them aside.
-    if (line == "use chroot = no" &&
-        conf.find("\nfake super = yes\n") == std::string::npos) {
-      line += "\nfake super = yes";
+    if (line.compare(0, 12, "lock file = ") == 0) {
+      line = "lock file = " + SshRunDir() + "/rsyncd.lock";
     }
     if (line.compare(0, 16, "\tsecrets file = ") == 0) {
       line = "\tsecrets file = " + SshSecretsPath();
@@ -86,15 +87,30 @@ bool LookUp(const std::string& name, uid_t& uid, gid_t& gid,
   return true;
 }
 
-bool WriteSshFiles(uid_t uid, gid_t gid, std::string& error) {
-  std::string conf, secrets;
-  if (!ReadAll(S2S::server::DaemonConfigPath(), conf) ||
-      !ReadAll(S2S::server::DaemonSecretsPath(), secrets)) {
-    error = "no daemon configuration; run 's2s-server config' first";
+// The line of `user` in the daemon's secrets file, or "".
+std::string SecretLine(const std::string& user) {
+  std::string secrets;
+  ReadAll(S2S::server::DaemonSecretsPath(), secrets);
+  std::istringstream lines(secrets);
+  for (std::string line; std::getline(lines, line);) {
+    if (line.compare(0, user.size() + 1, user + ":") == 0) return line + "\n";
+  }
+  return "";
+}
+
+// The SSH configuration and a secrets file with the user's own line only.
+bool WriteSshFiles(const std::string& user, uid_t uid, gid_t gid,
+                   std::string& error) {
+  std::string conf, secret = SecretLine(user);
+  if (!ReadAll(S2S::server::DaemonConfigPath(), conf) || secret.empty()) {
+    error = "the daemon configuration has no user " + user +
+            "; run 's2s-server config --user " + user + "' first";
     return false;
   }
-  if (!WriteOwned(SshConfigPath(), SshVariant(conf), 0644, 0, 0) ||
-      !WriteOwned(SshSecretsPath(), secrets, 0600, uid, gid)) {
+  if (!MakeDirs(SshRunDir(), error) ||
+      lchown(SshRunDir().c_str(), uid, gid) != 0 ||
+      !WriteOwned(SshConfigPath(), SshVariant(conf), 0644, 0, 0) ||
+      !WriteOwned(SshSecretsPath(), secret, 0600, uid, gid)) {
     error = "cannot write " + SshConfigPath() + " and its secrets";
     return false;
   }
@@ -199,19 +215,12 @@ bool SetUpSsh(const SshSetup& s, std::string& done, std::string& error) {
     error = "SSH mode logs in as the daemon user, which may not be root";
     return false;
   }
-  std::string secrets;
-  ReadAll(S2S::server::DaemonSecretsPath(), secrets);
-  if (secrets.compare(0, s.user.size() + 1, s.user + ":") != 0) {
-    error = "the daemon user is not " + s.user +
-            "; run 's2s-server config --user " + s.user + "' first";
-    return false;
-  }
   std::string key;
   if (!ReadAll(s.key_file, key) || key.empty()) {
     error = "cannot read the public key " + s.key_file;
     return false;
   }
-  if (!WriteSshFiles(uid, gid, error)) return false;
+  if (!WriteSshFiles(s.user, uid, gid, error)) return false;
   for (const std::string& dir : StateDirs()) {
     if (!GiveTree(dir, true, uid, gid, error)) return false;
   }
@@ -233,7 +242,12 @@ bool SetUpSsh(const SshSetup& s, std::string& done, std::string& error) {
 bool RefreshSshConfig(std::string& error) {
   struct stat st;
   if (stat(SshSecretsPath().c_str(), &st) != 0) return true;
-  if (!WriteSshFiles(st.st_uid, st.st_gid, error)) return false;
+  passwd* pw = getpwuid(st.st_uid);
+  if (pw == nullptr) {
+    error = "the owner of " + SshSecretsPath() + " is no user any more";
+    return false;
+  }
+  if (!WriteSshFiles(pw->pw_name, st.st_uid, st.st_gid, error)) return false;
   // A share added since: its directory goes to the user as well.
   for (const std::string& dir : StateDirs()) {
     if (!GiveTree(dir, false, st.st_uid, st.st_gid, error)) return false;
