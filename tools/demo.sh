@@ -2,8 +2,11 @@
 # The S2S demo: a client and a server appliance on this machine, under one
 # temporary directory. The server's rsync daemon runs on 127.0.0.1 at a free
 # port; the client syncs three shares of sample data to it, changes them and
-# syncs again; each copy is checked with diff -r. Everything started here is
-# stopped by its own pid file and the directory is removed, also on failure.
+# syncs again; each copy is checked with diff -r. Then the client service
+# s2sd runs on the client root: a task added with s2sctl runs by itself at
+# the next full minute, another is run on demand, and status and history
+# show what happened. Everything started here is stopped by its own pid and
+# the directory is removed, also on failure.
 #
 #   tools/demo.sh [BUILD_DIR]     (default: build/ beside tools/)
 #   tools/demo.sh --installed     the installed programs, found along PATH
@@ -15,20 +18,29 @@ if [ "${1:-}" = --installed ]; then
   client_bin=$(command -v s2s-client || echo "s2s-client (installed)")
   server_bin=$(command -v s2s-server || echo "s2s-server (installed)")
   handler_bin=$(command -v s2s-cmd-handler || echo "s2s-cmd-handler")
+  s2sd_bin=$(command -v s2sd || echo "s2sd (installed)")
+  ctl_bin=$(command -v s2sctl || echo "s2sctl (installed)")
 else
   bin=$(cd "${1:-${S2S_BUILD_DIR:-$top/build}}" && pwd)
   client_bin=$bin/s2s-client
   server_bin=$bin/s2s-server
   handler_bin=$bin/s2s-cmd-handler
+  s2sd_bin=$bin/s2sd
+  ctl_bin=$bin/s2sctl
 fi
-for p in "$client_bin" "$server_bin" "$handler_bin"; do
+for p in "$client_bin" "$server_bin" "$handler_bin" "$s2sd_bin" "$ctl_bin"; do
   [ -x "$p" ] || { echo "demo: $p is missing; build first" >&2; exit 1; }
 done
 
 work=$(mktemp -d "${TMPDIR:-/tmp}/s2s-demo.XXXXXX")
 server=$work/server
 client=$work/client
+s2sd_pid=
 cleanup() {
+  if [ -n "$s2sd_pid" ]; then
+    kill -TERM "$s2sd_pid" 2>/dev/null || true
+    wait "$s2sd_pid" 2>/dev/null || true
+  fi
   "$server_bin" --root "$server" stop >/dev/null 2>&1 || true
   rm -rf "$work"
 }
@@ -116,6 +128,74 @@ verify
 
 step "pairing registry of the server"
 "$server_bin" --root "$server" pairings
+
+# The client service. s2sd stays in the foreground (as a unit runs it); here
+# it runs in the background of this script, which stops it by its pid. It
+# reaches the server's daemon at the port in its environment.
+ctl() { "$ctl_bin" --root "$client" "$@"; }
+step "the client service: s2sd --foreground --root $client"
+S2S_RSYNC_PORT=$port "$s2sd_bin" --foreground --root "$client" \
+  --log "$work/s2sd.log" &
+s2sd_pid=$!
+for _ in $(seq 100); do
+  ctl status >/dev/null 2>&1 && break
+  kill -0 "$s2sd_pid" 2>/dev/null || { cat "$work/s2sd.log" >&2; exit 1; }
+  sleep 0.1
+done
+ctl status
+
+# Waits until the task's newest run has ended (at most $2 seconds) and
+# shows its history; fails unless that run went well.
+await_run() {
+  local task=$1 limit=$2 json
+  for _ in $(seq $((limit * 2))); do
+    json=$(ctl --json history "$task" --limit 1)
+    if grep -q '"outcome": "\(ok\|failed\|cancelled\)"' <<<"$json"; then
+      ctl history "$task"
+      grep -q '"outcome": "ok"' <<<"$json" && return 0
+      cat "$work/s2sd.log" >&2
+      return 1
+    fi
+    sleep 0.5
+  done
+  echo "demo: $task did not run within $limit s" >&2
+  cat "$work/s2sd.log" >&2
+  return 1
+}
+
+# Daily at the next full minute (with at least 10 s to spare), so that it
+# fires by itself while the demo watches.
+now=$(date +%s)
+next=$(((now / 60 + 1) * 60))
+[ $((next - now)) -ge 10 ] || next=$((next + 60))
+at=$(date -d "@$next" +%H:%M)
+step "a task that runs by itself, daily at $at"
+echo "Written while the service waits." >"$d/docs/from-the-service.txt"
+ctl task add --task nightly --server-ip 127.0.0.1 --user s2s \
+  --password-file "$work/password" --share docs --share photos \
+  --share projects --schedule weekly --days daily --at "$at"
+ctl task list
+echo "waiting for $at ($((next - $(date +%s))) s) ..."
+await_run nightly $((next - now + 60))
+verify
+
+step "a manual task, run on demand: s2sctl run on-demand"
+echo "int g(void) { return 7; }" >"$d/projects/s2s/src/g.c"
+ctl task add --task on-demand --server-ip 127.0.0.1 --user s2s \
+  --password-file "$work/password" --share projects
+ctl run on-demand
+await_run on-demand 60
+verify
+
+step "service status, a task as scripts see it (no password in it)"
+ctl status
+ctl --json task show nightly
+
+step "stop the client service"
+kill -TERM "$s2sd_pid"
+wait "$s2sd_pid"
+s2sd_pid=
+echo "s2sd stopped"
 
 step "stop the server's daemon"
 "$server_bin" --root "$server" stop
