@@ -356,7 +356,7 @@ TEST_F(ServiceControlTest, BadRequestsAreRefusedAndChangeNothing) {
               return a;
             }()),
        4},
-      {"empty name", with("name", S2S::PObject("")), 4},
+      {"no server", with("server_ip", S2S::PObject("")), 4},
       {"name taken", with("name", S2S::PObject("kept")), 4},
       {"hour 24", with("schedule_begin_hour", S2S::PObject(24ULL)), 4},
       {"name mistyped", with("name", S2S::PObject(5ULL)), 1},
@@ -422,6 +422,16 @@ TEST_F(ServiceControlTest, PeersOtherThanRootAreRefused) {
   const std::string path = client_.path();
   for (mode_t mode : {0600, 0666}) {
     ASSERT_EQ(0, chmod(path.c_str(), mode));
+    if (mode == 0666) {  // and the test's directories open to pass
+      const std::string& root = apps_.client_root();
+      const std::string top = root.substr(0, root.rfind('/'));
+      for (std::string dir = path.substr(0, path.rfind('/'));
+           dir.size() >= top.size(); dir = dir.substr(0, dir.rfind('/'))) {
+        struct stat st;
+        ASSERT_EQ(0, stat(dir.c_str(), &st));
+        ASSERT_EQ(0, chmod(dir.c_str(), st.st_mode | 0011));
+      }
+    }
     pid_t child = fork();
     if (child == 0) {
       if (setresgid(nobody->pw_gid, nobody->pw_gid, nobody->pw_gid) != 0 ||
@@ -478,7 +488,8 @@ class CtlRun {
 
 TEST_F(ServiceControlTest, CtlAddListShowRunHistory) {
   const std::string pass = tmp_.Sub("pass");
-  ASSERT_TRUE(s2s_test::WriteFile(pass, std::string(kPassword) + "\n"));
+  const std::string password = apps_.Info().GetPassword();
+  ASSERT_TRUE(s2s_test::WriteFile(pass, password + "\n"));
   chmod(pass.c_str(), 0600);
   ASSERT_TRUE(s2s_test::WriteFile(apps_.ClientShare("docs") + "/a.txt", "a\n"));
   CtlRun ctl(tmp_);
@@ -514,7 +525,7 @@ TEST_F(ServiceControlTest, CtlAddListShowRunHistory) {
   EXPECT_TRUE(s2s_test::Has(ctl.output, "docs-copy") ||
               s2s_test::Has(ctl.output, "(none)"))
       << ctl.output;
-  EXPECT_FALSE(s2s_test::Has(ctl.output, kPassword));
+  EXPECT_FALSE(s2s_test::Has(ctl.output, password));
 }
 
 }  // namespace

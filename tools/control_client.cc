@@ -70,7 +70,11 @@ ControlClient::Status ControlClient::Call(const S2S::PObject& request,
   }
   sender.channel().SetTimeout(timeout_);
   reply = S2S::PObject();
-  if (sender.send(request, true, reply) != 0) {
+  // A refusal may come before the request is read, and the daemon may have
+  // closed by the time the request is written: the reply is read whether
+  // or not the request went out whole.
+  sender.send(request);
+  if (sender.recv(reply) != 0) {
     error = "s2sd closed the connection without a reply";
     return kBroken;
   }
