@@ -508,6 +508,8 @@ TEST_F(ServiceControlTest, CtlAddListShowRunHistory) {
   EXPECT_EQ(4, ctl({"task", "show", "no-such-task"}));
   EXPECT_EQ(4, ctl({"run", "999"}));
   EXPECT_EQ(3, ctl({"--socket", tmp_.Sub("none.sock"), "status"}));
+  EXPECT_EQ(2, ctl({"task", "edit", "docs-copy", "--exclude",
+                    std::string(70000, 'x')}));  // the wire would wrap it
 
   ASSERT_EQ(0, ctl({"run", "docs-copy"})) << ctl.output;
   bool done = false;

@@ -43,6 +43,18 @@ int ConnectUnix(const std::string& path, int& err) {
   return fd;
 }
 
+// Whether every string and key in `v` fits the wire's 16-bit length.
+bool Carriable(const S2S::PObject& v) {
+  if (v.isString()) return v.asString().size() <= 0xFFFF;
+  for (const auto& member : v.asMap()) {
+    if (member.first.size() > 0xFFFF || !Carriable(member.second)) return false;
+  }
+  for (const S2S::PObject& item : v.asArray()) {
+    if (!Carriable(item)) return false;
+  }
+  return true;
+}
+
 }  // namespace
 
 ControlClient::ControlClient(const std::string& socket_path)
@@ -51,6 +63,10 @@ ControlClient::ControlClient(const std::string& socket_path)
 ControlClient::Status ControlClient::Call(const S2S::PObject& request,
                                           S2S::PObject& reply,
                                           std::string& error) const {
+  if (!Carriable(request)) {
+    error = "a value of 64 KiB or more cannot go to s2sd";
+    return kUnsendable;
+  }
   int err = 0;
   int fd = ConnectUnix(path_, err);
   if (fd < 0) {

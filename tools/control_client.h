@@ -37,6 +37,7 @@ class ControlClient {
     kUnreachable,  // no socket, or nothing listens on it
     kRefused,      // the socket may not be opened by this user
     kBroken,       // connected, but no well-formed reply came back
+    kUnsendable,   // the request holds a string the wire cannot carry
   };
 
   // `socket_path` empty: kControlSocket under the root (S2S_ROOT).

@@ -49,6 +49,8 @@ int ExitFor(ControlClient::Status status) {
       return kCtlUnreachable;
     case ControlClient::kRefused:
       return kCtlNotPermitted;
+    case ControlClient::kUnsendable:
+      return kCtlUsage;
     default:
       return kCtlFailed;
   }
