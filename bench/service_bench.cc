@@ -30,6 +30,8 @@
 namespace {
 
 using S2S::PObject;
+using s2s_test::ReadAll;
+using s2s_test::WriteAll;
 using s2s_tools::ControlClient;
 
 // A client appliance with one share, "docs", and an s2sd on it that this
@@ -42,15 +44,11 @@ class Service {
   // Starts s2sd and waits until it answers; the seconds that took.
   double Start() {
     auto start = std::chrono::steady_clock::now();
-    pid_ = fork();
-    if (pid_ == 0) {
-      int fd = open("/dev/null", O_WRONLY);
-      dup2(fd, 1);
-      dup2(fd, 2);
-      execl(S2SD_PROGRAM, "s2sd", "--foreground", "--root",
-            apps_.client_root().c_str(), "--log", "stderr", nullptr);
-      _exit(127);
-    }
+    int fd = open("/dev/null", O_WRONLY | O_CLOEXEC);
+    pid_ = s2s_test::Exec({S2SD_PROGRAM, "--foreground", "--root",
+                           apps_.client_root(), "--log", "stderr"},
+                          -1, fd);
+    close(fd);
     PObject status;
     status["action"] = "status";
     for (int i = 0; pid_ > 0 && i < 600000; ++i) {
@@ -132,26 +130,6 @@ std::string Encode(const PObject& m) {
   reader.join();
   close(fds[1]);
   return out;
-}
-
-bool ReadAll(int fd, char* buf, size_t n) {
-  while (n > 0) {
-    ssize_t r = read(fd, buf, n);
-    if (r <= 0) return false;
-    buf += r;
-    n -= static_cast<size_t>(r);
-  }
-  return true;
-}
-
-bool WriteAll(int fd, const char* buf, size_t n) {
-  while (n > 0) {
-    ssize_t r = write(fd, buf, n);
-    if (r <= 0) return false;
-    buf += r;
-    n -= static_cast<size_t>(r);
-  }
-  return true;
 }
 
 // The request and reply bytes of the measured "list", for the baseline.

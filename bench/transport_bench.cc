@@ -13,12 +13,15 @@
 
 #include "S2S/ipc.h"
 #include "S2S/stream.h"
+#include "testutil.h"
 
 namespace {
 
 using S2S::IPCListener;
 using S2S::IPCSender;
 using S2S::PObject;
+using s2s_test::ReadAll;
+using s2s_test::WriteAll;
 
 constexpr unsigned kBulkStrings = 1024;
 constexpr unsigned kBulkStringSize = 65535;  // the largest 16-bit length
@@ -34,26 +37,6 @@ PObject TaskMessage() {
   m["id"] = 123456789ull;
   m["last_sync"] = 1700000000ull;
   return m;
-}
-
-bool ReadAll(int fd, char* buf, size_t n) {
-  while (n > 0) {
-    ssize_t r = read(fd, buf, n);
-    if (r <= 0) return false;
-    buf += r;
-    n -= static_cast<size_t>(r);
-  }
-  return true;
-}
-
-bool WriteAll(int fd, const char* buf, size_t n) {
-  while (n > 0) {
-    ssize_t r = write(fd, buf, n);
-    if (r <= 0) return false;
-    buf += r;
-    n -= static_cast<size_t>(r);
-  }
-  return true;
 }
 
 std::string SocketPath() {

@@ -203,15 +203,12 @@ class ServiceControlTest : public ::testing::Test {
   // once it answers "status".
   bool StartDaemon() {
     log_ = tmp_.Sub("s2sd.log");
-    pid_ = fork();
-    if (pid_ == 0) {
-      int fd = open(log_.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0600);
-      dup2(fd, 1);
-      dup2(fd, 2);
-      execl(S2SD_PROGRAM, "s2sd", "--foreground", "--root",
-            apps_.client_root().c_str(), "--log", "stderr", nullptr);
-      _exit(127);
-    }
+    int fd =
+        open(log_.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
+    pid_ = s2s_test::Exec({S2SD_PROGRAM, "--foreground", "--root",
+                           apps_.client_root(), "--log", "stderr"},
+                          -1, fd);
+    close(fd);
     S2S::PObject status;
     status["action"] = "status";
     for (int waited = 0; pid_ > 0 && waited < 10000; waited += 5) {
@@ -446,7 +443,7 @@ TEST_F(ServiceControlTest, PeersOtherThanRootAreRefused) {
           s2s_tools::ControlClient(path).Call(request, reply, error);
       if (st == s2s_tools::ControlClient::kRefused) _exit(1);
       if (st != s2s_tools::ControlClient::kReplied) _exit(11);
-      if (reply["result"].asUInt64() == s2s_tools::kControlNotPermitted)
+      if (reply["result"].asUInt64() == s2s_service::kResultNotPermitted)
         _exit(2);
       _exit(12);
     }
@@ -464,17 +461,9 @@ class CtlRun {
   explicit CtlRun(const s2s_test::TempDir& tmp) : out_(tmp.Sub("ctl.out")) {}
   int operator()(std::vector<std::string> args) {
     args.insert(args.begin(), S2SCTL_PROGRAM);
-    pid_t pid = fork();
-    if (pid == 0) {
-      int fd = open(out_.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-      dup2(fd, 1);
-      dup2(fd, 2);
-      std::vector<char*> argv;
-      for (std::string& a : args) argv.push_back(&a[0]);
-      argv.push_back(nullptr);
-      execv(argv[0], argv.data());
-      _exit(127);
-    }
+    int fd = open(out_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+    pid_t pid = s2s_test::Exec(args, -1, fd);
+    close(fd);
     int status = 0;
     waitpid(pid, &status, 0);
     output = s2s_test::ReadFile(out_);

@@ -72,23 +72,6 @@ void StopChild(pid_t* pid) {
   *pid = -1;
 }
 
-// Starts `args` (looked up in PATH, no shell) with standard input `in` and
-// standard output and error `out` (-1: inherited); its pid, or -1.
-pid_t Exec(std::vector<std::string> args, int in, int out) {
-  pid_t pid = fork();
-  if (pid != 0) return pid;
-  if (in >= 0) dup2(in, 0);
-  if (out >= 0) {
-    dup2(out, 1);
-    dup2(out, 2);
-  }
-  std::vector<char*> argv;
-  for (std::string& a : args) argv.push_back(&a[0]);
-  argv.push_back(nullptr);
-  execvp(argv[0], argv.data());
-  _exit(127);
-}
-
 // Starts the program that `argv_for` gives for a free port, with its output
 // appended to `log`, and waits until it accepts on that port. Retries on other
 // ports, since a port found free may be taken before the program binds it.
@@ -126,6 +109,41 @@ void RecordSyslog(int priority, const char* format, va_list ap) {
 }
 
 }  // namespace
+
+pid_t Exec(std::vector<std::string> args, int in, int out) {
+  pid_t pid = fork();
+  if (pid != 0) return pid;
+  if (in >= 0) dup2(in, 0);
+  if (out >= 0) {
+    dup2(out, 1);
+    dup2(out, 2);
+  }
+  std::vector<char*> argv;
+  for (std::string& a : args) argv.push_back(&a[0]);
+  argv.push_back(nullptr);
+  execvp(argv[0], argv.data());
+  _exit(127);
+}
+
+bool ReadAll(int fd, char* buf, size_t n) {
+  while (n > 0) {
+    ssize_t r = read(fd, buf, n);
+    if (r <= 0) return false;
+    buf += r;
+    n -= static_cast<size_t>(r);
+  }
+  return true;
+}
+
+bool WriteAll(int fd, const char* buf, size_t n) {
+  while (n > 0) {
+    ssize_t r = write(fd, buf, n);
+    if (r <= 0) return false;
+    buf += r;
+    n -= static_cast<size_t>(r);
+  }
+  return true;
+}
 
 TempDir::TempDir() {
   std::string tmpl = TempBase() + "/s2s-test.XXXXXX";

@@ -194,6 +194,16 @@ class TempRoot : public TempDir {
   ScopedEnv env_;
 };
 
+// Starts `args` (looked up in PATH, no shell) with standard input `in` and
+// standard output and error `out` (-1: inherited); its pid, or -1. The
+// caller waits for it.
+pid_t Exec(std::vector<std::string> args, int in, int out);
+
+// Reads or writes exactly `n` bytes on a blocking descriptor; false on an
+// error or the end of the stream first.
+bool ReadAll(int fd, char* buf, size_t n);
+bool WriteAll(int fd, const char* buf, size_t n);
+
 // Runs a program (an argument vector, looked up in PATH, no shell) to
 // completion with its input and output on /dev/null; true on exit 0.
 bool RunQuiet(const std::vector<std::string>& args);

@@ -7,11 +7,9 @@
 #include <unistd.h>
 
 #include "S2S/ipc.h"
-#include "karo_root.h"
+#include "service/config.h"
 
 namespace s2s_tools {
-
-const char kControlSocket[] = "/run/s2s/s2sd.sock";
 
 namespace {
 
@@ -58,7 +56,7 @@ bool Carriable(const S2S::PObject& v) {
 }  // namespace
 
 ControlClient::ControlClient(const std::string& socket_path)
-    : path_(socket_path.empty() ? KaroRootPath(kControlSocket) : socket_path) {}
+    : path_(socket_path.empty() ? s2s_service::SocketPath() : socket_path) {}
 
 ControlClient::Status ControlClient::Call(const S2S::PObject& request,
                                           S2S::PObject& reply,

@@ -11,23 +11,9 @@
 #include <string>
 
 #include "S2S/pobject.h"
+#include "service/control_server.h"  // the result codes
 
 namespace s2s_tools {
-
-// The socket's place under the appliance root.
-extern const char kControlSocket[];
-
-// Result codes of a reply's "result" key.
-enum ControlResult : unsigned int {
-  kControlOk = 0,
-  kControlMalformed = 1,
-  kControlUnknownAction = 2,
-  kControlUnknownTask = 3,
-  kControlInvalidTask = 4,
-  kControlBusy = 5,
-  kControlNotPermitted = 6,
-  kControlInternal = 7,
-};
 
 class ControlClient {
  public:
@@ -40,7 +26,7 @@ class ControlClient {
     kUnsendable,   // the request holds a string the wire cannot carry
   };
 
-  // `socket_path` empty: kControlSocket under the root (S2S_ROOT).
+  // `socket_path` empty: the daemon's socket under the root (S2S_ROOT).
   explicit ControlClient(const std::string& socket_path = "");
 
   const std::string& path() const { return path_; }

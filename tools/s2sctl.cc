@@ -26,17 +26,17 @@ using namespace s2s_tools;
 
 int ExitFor(unsigned long long result) {
   switch (result) {
-    case kControlOk:
+    case s2s_service::kResultOk:
       return kCtlOk;
-    case kControlMalformed:
+    case s2s_service::kResultMalformed:
       return kCtlUsage;
-    case kControlUnknownTask:
+    case s2s_service::kResultUnknownTask:
       return kCtlUnknownTask;
-    case kControlInvalidTask:
+    case s2s_service::kResultInvalidTask:
       return kCtlInvalidTask;
-    case kControlBusy:
+    case s2s_service::kResultBusy:
       return kCtlBusy;
-    case kControlNotPermitted:
+    case s2s_service::kResultNotPermitted:
       return kCtlNotPermitted;
     default:
       return kCtlFailed;
@@ -77,7 +77,7 @@ bool ResolveTask(const ControlClient& client, const std::string& target,
   S2S::PObject request, reply;
   request["action"] = "list";
   if (!Call(client, request, reply, code)) return false;
-  if (reply["result"].asUInt64() != kControlOk) {
+  if (reply["result"].asUInt64() != s2s_service::kResultOk) {
     fprintf(stderr, "s2sctl: %s\n", reply["message"].asString().c_str());
     code = ExitFor(reply["result"].asUInt64());
     return false;
@@ -182,10 +182,10 @@ int main(int argc, char** argv) {
   const unsigned long long result = reply["result"].asUInt64();
   if (o.json) {
     printf("%s\n", ToJson(reply, true).c_str());
-  } else if (result == kControlOk) {
+  } else if (result == s2s_service::kResultOk) {
     PrintHuman(o, reply);
   }
-  if (result != kControlOk) {
+  if (result != s2s_service::kResultOk) {
     fprintf(stderr, "s2sctl: %s\n", reply["message"].asString().c_str());
   }
   return ExitFor(result);
