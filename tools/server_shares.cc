@@ -29,6 +29,7 @@ bool ReadHook(std::string& handler, bool& old_server) {
     if (line.compare(0, key.size(), key) != 0) continue;
     std::istringstream words(line.substr(key.size()));
     words >> handler;
+    if (handler == "exec") words >> handler;
     old_server = false;
     for (std::string w; words >> w;)
       old_server = old_server || w == "--old-server";
