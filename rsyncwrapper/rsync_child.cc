@@ -27,6 +27,13 @@ namespace {
 
 const int kPollMs = 50;
 const size_t kMaxOutput = 64 * 1024;
+const size_t kMaxErrorLine = 300;
+
+thread_local std::string t_last_error;
+
+bool StartsWith(const std::string& s, const char* prefix) {
+  return s.compare(0, strlen(prefix), prefix) == 0;
+}
 
 long long NowMs() {
   timespec ts;
@@ -121,6 +128,43 @@ bool Exited(pid_t pid) {
 }
 
 }  // namespace
+
+std::string ErrorLine(const std::string& output) {
+  std::string refusal, complaint, summary;
+  size_t start = 0;
+  while (start < output.size()) {
+    size_t end = output.find_first_of("\r\n", start);
+    if (end == std::string::npos) end = output.size();
+    std::string line = output.substr(start, end - start);
+    start = end + 1;
+    if (refusal.empty() && StartsWith(line, "@ERROR: ")) {
+      refusal = line.substr(8);
+    } else if (complaint.empty() && StartsWith(line, "rsync: ")) {
+      complaint = line.substr(7);
+      // "[receiver] ", "[sender] ": which side of rsync noticed.
+      if (!complaint.empty() && complaint[0] == '[') {
+        size_t close = complaint.find("] ");
+        if (close != std::string::npos) complaint.erase(0, close + 2);
+      }
+    } else if (summary.empty() && StartsWith(line, "rsync error: ")) {
+      summary = line.substr(13);
+      size_t at = summary.rfind(" at ");
+      if (at != std::string::npos) summary.erase(at);
+    }
+  }
+  std::string line = !refusal.empty()     ? refusal
+                     : !complaint.empty() ? complaint
+                                          : summary;
+  for (char& c : line) {
+    if (static_cast<unsigned char>(c) < 0x20) c = ' ';
+  }
+  if (line.size() > kMaxErrorLine) line.resize(kMaxErrorLine);
+  return line;
+}
+
+void SetLastError(const std::string& text) { t_last_error = text; }
+
+const std::string& LastError() { return t_last_error; }
 
 ChildOutcome RunRsync(const std::vector<std::string>& args,
                       const std::string& password,
@@ -234,8 +278,10 @@ int RunAndLog(const std::vector<std::string>& args, const RsyncSettings& s,
     Log(LOG_WARNING, "%s to %s cancelled", what, s.host.c_str());
   } else if (outcome.status != 0 &&
              outcome.status != RsyncWrapper::kStartFailed) {
+    std::string why = ErrorLine(outcome.output);
+    SetLastError(why);
     Log(LOG_ERR, "%s to %s failed with status %d: %s", what, s.host.c_str(),
-        outcome.status, last.c_str());
+        outcome.status, why.empty() ? last.c_str() : why.c_str());
   }
   return outcome.status;
 }

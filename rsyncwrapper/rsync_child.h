@@ -43,6 +43,16 @@ int RunAndLog(const std::vector<std::string>& args, const RsyncSettings& s,
               std::string* output = nullptr,
               unsigned long long max_file_size = 0);
 
+// The line of rsync's `output` that says why it failed, without rsync's
+// prefixes: the daemon's "@ERROR:" refusal first, else the first "rsync:"
+// complaint, else the "rsync error:" summary. "" when there is none.
+std::string ErrorLine(const std::string& output);
+
+// The calling thread's last failure, as RsyncWrapper::lastError() returns
+// it.
+void SetLastError(const std::string& text);
+const std::string& LastError();
+
 // How long a cancelled rsync gets between SIGTERM and SIGKILL.
 extern const int kKillGraceMs;
 

@@ -184,20 +184,30 @@ std::string NewRequestId() {
   return id;
 }
 
-bool ParseReply(const std::string& reply, int* status, std::string* answer) {
+bool ParseReply(const std::string& reply, int* status, std::string* answer,
+                std::string* reason) {
   static const std::string kPrefix = "status=";
   size_t eol = reply.find('\n');
   if (eol == std::string::npos ||
       reply.compare(0, kPrefix.size(), kPrefix) != 0) {
     return false;
   }
-  std::string digits = reply.substr(kPrefix.size(), eol - kPrefix.size());
+  std::string first = reply.substr(kPrefix.size(), eol - kPrefix.size());
+  // "status=N" or "status=N reason in words".
+  size_t blank = first.find(' ');
+  std::string digits = first.substr(0, blank);
   if (digits.empty() || digits.size() > 4 ||
       digits.find_first_not_of("0123456789") != std::string::npos) {
     return false;
   }
+  std::string why = blank == std::string::npos ? "" : first.substr(blank + 1);
+  if (why.size() > kMaxReason) why.resize(kMaxReason);
+  for (char& c : why) {
+    if (static_cast<unsigned char>(c) < 0x20 || c == 0x7f) c = '?';
+  }
   *status = std::stoi(digits);
   *answer = reply.substr(eol + 1);
+  *reason = why;
   return true;
 }
 
@@ -239,6 +249,7 @@ int RunCommand(const RsyncSettings& s, const boost::function<bool()>& cancel) {
   }
   std::string reply;
   std::string answer;
+  std::string reason;
   if (status == 0) status = ReadReply(reply_file, &reply);
   if (status == RsyncWrapper::kReplyTooLarge) {
     Log(LOG_ERR, "command to %s: reply larger than %zu bytes, refused",
@@ -246,10 +257,11 @@ int RunCommand(const RsyncSettings& s, const boost::function<bool()>& cancel) {
     return status;
   }
   if (status != 0) return status;
-  if (!ParseReply(reply, &status, &answer)) {
+  if (!ParseReply(reply, &status, &answer, &reason)) {
     Log(LOG_ERR, "command to %s: no valid reply", s.host.c_str());
     return RsyncWrapper::kBadReply;
   }
+  if (status != 0) SetLastError(reason);
   std::string outfile = OutfileOf(s.command_lines);
   if (!outfile.empty() && !WriteWhole(outfile, answer, 0600)) {
     Log(LOG_ERR, "cannot write the answer to %s: %s", outfile.c_str(),

@@ -19,6 +19,8 @@ const size_t kMaxEarlyInput = 5120;
 // The largest reply taken from a server; a larger one fails with
 // kReplyTooLarge and is neither kept on disk nor read.
 const size_t kMaxReply = 1 << 20;
+// The longest reason text a reply's status line may carry; more is cut.
+const size_t kMaxReason = 256;
 
 // Runs the command in `s.command_lines`. Returns the server's status, rsync's
 // exit code when a connection failed, or kStartFailed, kBadReply or
@@ -26,8 +28,11 @@ const size_t kMaxReply = 1 << 20;
 // goes to the `outfile="..."` line's path when there is one.
 int RunCommand(const RsyncSettings& s, const boost::function<bool()>& cancel);
 
-// Splits a reply into its status and answer; false when it is not a reply.
-bool ParseReply(const std::string& reply, int* status, std::string* answer);
+// Splits a reply into its status, its answer and the reason text after the
+// status ("" when none; control characters become '?'); false when it is not
+// a reply.
+bool ParseReply(const std::string& reply, int* status, std::string* answer,
+                std::string* reason);
 
 // A fresh request id: 32 lower-case hex digits.
 std::string NewRequestId();

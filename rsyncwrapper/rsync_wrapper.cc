@@ -77,15 +77,19 @@ void RsyncWrapper::setSrcPath(const std::string& path) {
 
 int RsyncWrapper::execute(boost::function<bool()> cancel) {
   const detail::RsyncSettings& s = *settings_;
+  detail::SetLastError("");
   bool command = !s.command_lines.empty();
   std::string problem = detail::CheckSettings(s, command);
   if (!problem.empty()) {
     detail::Log(LOG_ERR, "cannot run rsync: %s", problem.c_str());
+    detail::SetLastError(problem);
     return kBadSettings;
   }
   if (command) return detail::RunCommand(s, cancel);
   return detail::RunAndLog(detail::DataTransferArgs(s), s, cancel, "transfer");
 }
+
+std::string RsyncWrapper::lastError() { return detail::LastError(); }
 
 }  // namespace Backup
 }  // namespace KARO

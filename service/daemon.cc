@@ -388,7 +388,7 @@ PObject Daemon::RunMap(const ActiveRun& run, bool ended) const {
     share["name"] = s.name;
     share["step"] = s.ok ? "finish" : s.failed_step;
     share["status"] = s.status;
-    share["status_text"] = StatusText(s.status);
+    share["status_text"] = s.ok ? StatusText(0) : s.cause;
     share["seconds"] = static_cast<unsigned long long>(s.seconds + 0.5);
     share["files"] = 0ULL;
     share["bytes"] = 0ULL;

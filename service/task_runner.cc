@@ -5,6 +5,7 @@
 
 #include "S2S/rsyncer.h"
 #include "S2S/s2s_share.h"
+#include "karo/rsync_wrapper.h"
 #include "service/cancel.h"
 #include "service/exit_codes.h"
 
@@ -81,11 +82,11 @@ bool Run::Probe() {
   out_.server_ip = rsyncer_.GetSyncInfo().GetServerIP();
   out_.server_version = rsyncer_.GetServerVersionValue();
   if (rc == kServiceDisabled || rc == kPairedElsewhere) {
-    return Stop(kExitPairing, "server refused this client: " + StatusText(rc));
+    return Stop(kExitPairing, "server refused this client: " + FailureText(rc));
   }
   if (rc != 0 || out_.server_version < 0) {
     return Stop(kExitUnreachable, "server " + target + " unreachable: " +
-                                      StatusText(rc != 0 ? rc : 251));
+                                      FailureText(rc != 0 ? rc : 251));
   }
   report_("probe: " + out_.server_ip + " answers, protocol version " +
           std::to_string(out_.server_version));
@@ -103,7 +104,7 @@ bool Run::Pair() {
                 "shares fed by another client: " + Join(out_.conflicts));
   }
   if (rc != 0 || status != 0) {
-    return Stop(kExitPairing, "pairing refused: " + StatusText(status));
+    return Stop(kExitPairing, "pairing refused: " + FailureText(status));
   }
   report_("pair: " + Join(shares) +
           (rsyncer_.SupportMultiSource() ? "" : " (single-client server)"));
@@ -117,7 +118,7 @@ void Run::Beacon(const char* when) {
     ++out_.beacons;
     report_(std::string("beacon: ") + when);
   } else if (!CancelRequested()) {
-    report_("beacon: not taken: " + StatusText(status));
+    report_("beacon: not taken: " + FailureText(status));
   }
   BeaconSent();
 }
@@ -126,8 +127,10 @@ bool Run::ShareStep(ShareOutcome& share, const char* step, int rc, int status) {
   if (rc == 0 && status == 0) return true;
   share.failed_step = step;
   share.status = rc != 0 && status == 0 ? rc : status;
-  report_("share " + share.name + ": " + step +
-          " failed: " + StatusText(share.status));
+  // -1: nothing ran, so no reason of rsync's belongs to it.
+  share.cause = rc == -1 && status == 0 ? StatusText(share.status)
+                                        : FailureText(share.status);
+  report_("share " + share.name + ": " + step + " failed: " + share.cause);
   return false;
 }
 
@@ -174,7 +177,7 @@ void Run::FinishTask() {
     report_("task " + name + ": finished");
   } else {
     report_("task " + name +
-            ": end not recorded: " + StatusText(status != 0 ? status : rc));
+            ": end not recorded: " + FailureText(status != 0 ? status : rc));
     if (out_.exit_code == kExitOk) {
       out_.exit_code = kExitShare;
       out_.error = "the server did not record the end of the task";
@@ -295,6 +298,11 @@ std::string StatusText(int status) {
       break;
   }
   return text + " [" + std::to_string(status) + "]";
+}
+
+std::string FailureText(int status) {
+  std::string why = KARO::Backup::RsyncWrapper::lastError();
+  return StatusText(status) + (why.empty() ? "" : ": " + why);
 }
 
 TaskOutcome RunTask(const S2S::SyncTask& task,

@@ -29,6 +29,8 @@ struct ShareOutcome {
   bool ok = false;
   std::string failed_step;  // "start", "transfer", "key", "finish"
   int status = 0;           // the failed step's status
+  std::string cause;        // the status in words, with rsync's or the
+                            // server's reason when either gave one
   double seconds = 0;       // time of the transfer
 };
 
@@ -54,6 +56,9 @@ TaskOutcome RunTask(const S2S::SyncTask& task,
 
 // What a status from the rsync wrapper or the server means, for people.
 std::string StatusText(int status);
+// StatusText(status) followed by the reason rsync or the server gave for the
+// calling thread's last failed invocation (RsyncWrapper::lastError), if any.
+std::string FailureText(int status);
 
 }  // namespace s2s_service
 

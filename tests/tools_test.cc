@@ -10,6 +10,7 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/file.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -312,8 +313,9 @@ TEST_F(ToolsTest, ExitCodesNameTheFailedStage) {
       {"nothing listens",
        Client(client, "docs", {"--port", std::to_string(free_port)}),
        kExitUnreachable, "unreachable"},
+      // rsync's own words, not only its exit code.
       {"wrong password", Client(client, "docs", {"--password-file", wrong_pw}),
-       kExitUnreachable, "unreachable"},
+       kExitUnreachable, "auth failed"},
       // A second client with another serial may not feed the same share.
       {"pairing conflict", Client(other, "docs"), kExitPairing,
        "shares fed by another client: docs"},
@@ -476,6 +478,28 @@ TEST_F(ToolsTest, SigtermCancelsARunningTransfer) {
   // The task is recorded as idle again; the share's sync stays unfinished.
   EXPECT_NE(std::string::npos, c.out.find("task t1: finished")) << c.out;
   EXPECT_EQ("CLIENT-A", ShareKey("big", "RunningID"));
+}
+
+// The server's copy of "big" on a 2 MiB filesystem of its own: the client
+// says what rsync said on the far side.
+TEST_F(ToolsTest, AFullServerDiskIsNamedOnTheClient) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  WriteBlob(client + "/volume1/big/blob", 8);
+  std::string share = server_ + "/volume1/big";
+  struct stat st;
+  ASSERT_EQ(0, stat(share.c_str(), &st));
+  char options[128];
+  snprintf(options, sizeof options, "size=2m,mode=%o,uid=%u,gid=%u",
+           st.st_mode & 07777, st.st_uid, st.st_gid);
+  if (mount("s2s-full", share.c_str(), "tmpfs", 0, options) != 0) {
+    GTEST_SKIP() << "cannot mount a small filesystem on the server share: "
+                 << strerror(errno);
+  }
+  Child c = RunProgram(tmp_.path(), Client(client, "big"));
+  umount2(share.c_str(), MNT_DETACH);
+  EXPECT_EQ(kExitShare, c.code) << c.out << c.err;
+  EXPECT_TRUE(s2s_test::Has(c.out, "share big: transfer failed: ")) << c.out;
+  EXPECT_TRUE(s2s_test::Has(c.out, "No space left on device")) << c.out;
 }
 
 // kill -9 of the client while it transfers and a beacon's command is in

@@ -75,7 +75,7 @@ void PrintSummary(const TaskSpec& spec, const TaskOutcome& out) {
       printf("  %-20s ok (%.2f s)\n", s.name.c_str(), s.seconds);
     } else {
       printf("  %-20s FAILED at %s: %s\n", s.name.c_str(),
-             s.failed_step.c_str(), StatusText(s.status).c_str());
+             s.failed_step.c_str(), s.cause.c_str());
     }
   }
   fflush(stdout);

@@ -134,6 +134,13 @@ class KARO_RSYNC_EXPORT RsyncWrapper {
   // the server's status; or one of the statuses above.
   int execute(boost::function<bool()> cancel);
 
+  // Why the last execute() on the calling thread failed, in words: rsync's
+  // own error line ("auth failed on module docs", "write failed on
+  // \"/x\": No space left on device (28)") or the server's reason for a
+  // command's status. "" after a success or when neither said anything.
+  // Like errno, it belongs to the thread and the next execute() replaces it.
+  static std::string lastError();
+
  private:
   std::unique_ptr<detail::RsyncSettings> settings_;
 };
