@@ -82,6 +82,8 @@ int Rsyncer::RunSync(unsigned long long /*taskId*/,
   task.SetCompression(syncInfo_.UseCompression());
   task.SetBlockLevelSync(syncInfo_.UseBlockLevelSync());
   task.SetSyncACL(true);
+  // The task's limit, in KiB/s, as rsync takes it.
+  task.setBandwidthLimit(syncInfo_.GetMaxBandwidth());
   std::string source;
   if (relativePath == "/") {
     source = info.GetModulePath() + "/";

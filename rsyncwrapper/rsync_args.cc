@@ -123,7 +123,8 @@ std::string RemoteSpec(const RsyncSettings& s, const std::string& module,
 
 std::vector<std::string> DataTransferArgs(const RsyncSettings& s) {
   // -H: a share's hard links stay links on the server, not copies.
-  std::vector<std::string> args = {"rsync", "-a", "-H"};
+  // --sparse: a disk image's holes stay holes instead of blocks of zeros.
+  std::vector<std::string> args = {"rsync", "-a", "-H", "--sparse"};
   if (s.del) args.push_back("--delete");
   if (s.numeric_ids) args.push_back("--numeric-ids");
   if (!s.pseudo_root) {
@@ -131,6 +132,7 @@ std::vector<std::string> DataTransferArgs(const RsyncSettings& s) {
                 {"--no-owner", "--no-group", "--no-devices", "--no-specials"});
   }
   if (s.compress) args.push_back("-z");
+  if (s.bwlimit > 0) args.push_back("--bwlimit=" + std::to_string(s.bwlimit));
   args.push_back(s.delta_copy ? "--no-whole-file" : "--whole-file");
   if (s.list_only) args.push_back("--list-only");
   if (s.relative) args.push_back("-R");

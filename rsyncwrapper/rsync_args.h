@@ -32,6 +32,7 @@ struct RsyncSettings {
   bool acl = false;
   bool debug_log = false;
   unsigned int timeout = 600;
+  unsigned int bwlimit = 0;  // KiB/s; 0: none
   std::list<std::string> command_lines;
   std::string user;
   std::string host;

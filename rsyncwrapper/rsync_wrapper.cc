@@ -34,6 +34,9 @@ void RsyncWrapper::setDebugLog(bool on) { settings_->debug_log = on; }
 void RsyncWrapper::setTimeout(unsigned int seconds) {
   settings_->timeout = seconds;
 }
+void RsyncWrapper::setBandwidthLimit(unsigned int kibPerSecond) {
+  settings_->bwlimit = kibPerSecond;
+}
 
 bool RsyncWrapper::getDelete() const { return settings_->del; }
 bool RsyncWrapper::getNumericIds() const { return settings_->numeric_ids; }
@@ -51,6 +54,9 @@ bool RsyncWrapper::getRelativePath() const { return settings_->relative; }
 bool RsyncWrapper::getKaroAcl() const { return settings_->acl; }
 bool RsyncWrapper::getDebugLog() const { return settings_->debug_log; }
 unsigned int RsyncWrapper::getTimeout() const { return settings_->timeout; }
+unsigned int RsyncWrapper::getBandwidthLimit() const {
+  return settings_->bwlimit;
+}
 
 void RsyncWrapper::setKaroCustCmdRule(const std::list<std::string>& lines) {
   settings_->command_lines = lines;

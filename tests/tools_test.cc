@@ -480,6 +480,26 @@ TEST_F(ToolsTest, SigtermCancelsARunningTransfer) {
   EXPECT_EQ("CLIENT-A", ShareKey("big", "RunningID"));
 }
 
+// A 2 GiB disk image holding 1 MiB of data takes about 1 MiB on the server
+// too, not 2 GiB of zeros.
+TEST_F(ToolsTest, SparseFilesStaySparseOnTheServer) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  std::string image = client + "/volume1/big/disk.img";
+  {
+    std::ofstream out(image, std::ios::binary);
+    out.seekp(1 << 30);
+    out << std::string(1 << 20, 'd');
+  }
+  std::filesystem::resize_file(image, 2ull << 30);
+  Child c = RunProgram(tmp_.path(), Client(client, "big"));
+  ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
+  struct stat st;
+  ASSERT_EQ(0, stat((server_ + "/volume1/big/disk.img").c_str(), &st));
+  EXPECT_EQ(2ll << 30, st.st_size);
+  // Data plus the file system's own rounding.
+  EXPECT_LE(st.st_blocks * 512, 2ll << 20) << st.st_blocks;
+}
+
 // The server's copy of "big" on a 2 MiB filesystem of its own: the client
 // says what rsync said on the far side.
 TEST_F(ToolsTest, AFullServerDiskIsNamedOnTheClient) {

@@ -24,6 +24,7 @@ enum Option {
   kDelta,
   kSSH,
   kSSHPort,
+  kMaxBandwidth,
   kBeacon,
   kVersion,
 };
@@ -45,6 +46,7 @@ const struct option kOptions[] = {
     {"delta", no_argument, nullptr, kDelta},
     {"ssh", no_argument, nullptr, kSSH},
     {"ssh-port", required_argument, nullptr, kSSHPort},
+    {"max-bandwidth", required_argument, nullptr, kMaxBandwidth},
     {"beacon-interval", required_argument, nullptr, kBeacon},
     {"verbose", no_argument, nullptr, 'v'},
     {"help", no_argument, nullptr, 'h'},
@@ -74,6 +76,7 @@ const char kUsage[] =
     "  --share NAME           a local share to sync (repeatable)\n"
     "  --exclude RULE         an rsync exclude rule (repeatable)\n"
     "  --compress             compress data on the wire\n"
+    "  --max-bandwidth KIB    at most KIB KiB/s on the wire (0: no limit)\n"
     "  --delta                block-level (delta) transfer\n"
     "  --ssh                  go through SSH; --ssh-port PORT\n"
     "  --beacon-interval SEC  seconds between beacons during a run (30)\n"
@@ -177,6 +180,12 @@ bool ParseClientArgs(int argc, char** argv, ClientOptions& o,
       case kSSHPort:
         if (!Number("ssh-port", optarg, 65535, n, error)) return false;
         o.spec.ssh_port = static_cast<unsigned int>(n);
+        break;
+      case kMaxBandwidth:
+        if (!Number("max-bandwidth", optarg, 4294967295ULL, n, error)) {
+          return false;
+        }
+        o.spec.max_bandwidth = static_cast<unsigned int>(n);
         break;
       case kBeacon:
         if (!Number("beacon-interval", optarg, 86400, n, error)) return false;

@@ -122,7 +122,7 @@ const char kUsage[] =
     "  --compress[=yes|no]    compress data on the wire\n"
     "  --delta[=yes|no]       block-level (delta) transfer\n"
     "  --ssh[=yes|no]         through SSH; --ssh-port PORT\n"
-    "  --max-bandwidth N      bandwidth limit handed to the transfer\n"
+    "  --max-bandwidth KIB    at most KIB KiB/s on the wire (0: no limit)\n"
     "  --schedule MODE        manual, realtime, weekly, monthly, yearly, once\n"
     "  --at HH:MM             time of the first run of a run day\n"
     "  --days DAYS            weekly run days: daily, weekdays, weekends,\n"

@@ -160,6 +160,7 @@ S2S::SyncTask MakeSyncTask(const TaskSpec& spec, const std::string& password) {
   info.SetUser(spec.user);
   info.SetPassword(password);
   info.SetCompression(spec.compress);
+  info.SetMaxBandwidth(spec.max_bandwidth);
   info.SetBlockLevelSync(spec.delta);
   info.SetSSH(spec.ssh);
   info.SetSSHPort(spec.ssh_port);

@@ -41,6 +41,7 @@ struct TaskSpec {
   std::list<std::string> shares;
   std::list<std::string> excludes;
   bool compress = false;
+  unsigned int max_bandwidth = 0;  // KiB/s; 0: no limit
   bool delta = false;
   bool ssh = false;
   unsigned int ssh_port = 0;

@@ -9,8 +9,8 @@
 // status.
 //
 // Switches and the rsync options they become (a data transfer always runs
-// with -a -H, --timeout, and --contimeout/--sockopts=TCP_NODELAY on a daemon
-// socket):
+// with -a -H, --sparse (runs of zeros become holes on the server),
+// --timeout, and --contimeout/--sockopts=TCP_NODELAY on a daemon socket):
 //   setDelete(true)          --delete
 //   setNumericIds(true)      --numeric-ids
 //   setKaroAuth(use, req)    use: log in to the daemon as the user with the
@@ -32,6 +32,10 @@
 //   setTimeout(s)            --timeout=s; the connect time-out is the
 //                            smaller of s and 15 seconds
 //   setExcludeRule(list)     one --exclude=RULE per entry, in order
+//   setBandwidthLimit(k)     --bwlimit=k: at most k KiB (1024 bytes) per
+//                            second on the wire, averaged by rsync over its
+//                            writes; 0 (the default): no limit. Data
+//                            transfers only.
 //
 // The rsync daemon's port is 873 unless the environment variable
 // S2S_RSYNC_PORT names another. A module that is an absolute path (the
@@ -99,6 +103,7 @@ class KARO_RSYNC_EXPORT RsyncWrapper {
   void setKaroAcl(bool on);
   void setDebugLog(bool on);
   void setTimeout(unsigned int seconds);
+  void setBandwidthLimit(unsigned int kibPerSecond);
 
   // The switches as set, for whoever configured the object to check it.
   bool getDelete() const;
@@ -115,6 +120,7 @@ class KARO_RSYNC_EXPORT RsyncWrapper {
   bool getKaroAcl() const;
   bool getDebugLog() const;
   unsigned int getTimeout() const;
+  unsigned int getBandwidthLimit() const;  // KiB/s, 0 when unlimited
 
   // The command lines (key="value", no line breaks). A non-empty rule makes
   // execute() a command; an `outfile="PATH"` line names the local file that
