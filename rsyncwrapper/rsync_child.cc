@@ -105,14 +105,51 @@ int PidFd(pid_t pid) {
 #endif
 }
 
+// Output as it arrives, split into lines at \r and \n, the progress
+// parser's lines taken out.
+struct OutputReader {
+  ProgressParser* progress;
+  std::string* output;
+  std::string pending;
+
+  void Keep(const std::string& text) {
+    size_t room = kMaxOutput - std::min(kMaxOutput, output->size());
+    output->append(text, 0, std::min(room, text.size()));
+  }
+  void Take(const char* data, size_t n) {
+    if (progress == nullptr) {
+      Keep(std::string(data, n));
+      return;
+    }
+    pending.append(data, n);
+    size_t start = 0;
+    for (size_t end;
+         (end = pending.find_first_of("\r\n", start)) != std::string::npos;
+         start = end + 1) {
+      std::string line = pending.substr(start, end - start);
+      if (!progress->Feed(line)) Keep(line + "\n");
+    }
+    pending.erase(0, start);
+    if (pending.size() > kMaxOutput) {
+      Keep(pending);
+      pending.clear();
+    }
+  }
+  void Finish() {
+    if (!pending.empty() && (progress == nullptr || !progress->Feed(pending))) {
+      Keep(pending);
+    }
+    pending.clear();
+  }
+};
+
 // Reads what is available; false once the pipe is at its end.
-bool Drain(int fd, std::string* output) {
+bool Drain(int fd, OutputReader* reader) {
   char buf[4096];
   for (;;) {
     ssize_t n = read(fd, buf, sizeof buf);
     if (n > 0) {
-      size_t room = kMaxOutput - std::min(kMaxOutput, output->size());
-      output->append(buf, std::min(room, static_cast<size_t>(n)));
+      reader->Take(buf, static_cast<size_t>(n));
       continue;
     }
     if (n < 0 && errno == EINTR) continue;
@@ -169,8 +206,10 @@ const std::string& LastError() { return t_last_error; }
 ChildOutcome RunRsync(const std::vector<std::string>& args,
                       const std::string& password,
                       const boost::function<bool()>& cancel,
-                      unsigned long long max_file_size) {
+                      unsigned long long max_file_size,
+                      ProgressParser* progress) {
   ChildOutcome outcome;
+  OutputReader reader = {progress, &outcome.output, ""};
   std::vector<std::string> arg_strings = args;
   std::vector<std::string> env_strings = ChildEnvironment(password);
   std::vector<char*> argv = Pointers(arg_strings);
@@ -220,7 +259,7 @@ ChildOutcome RunRsync(const std::vector<std::string>& args,
     if (out_fd >= 0) fds[nfds++] = {out_fd, POLLIN, 0};
     if (pid_fd >= 0) fds[nfds++] = {pid_fd, POLLIN, 0};
     poll(fds, nfds, kPollMs);
-    if (out_fd >= 0 && !Drain(out_fd, &outcome.output)) {
+    if (out_fd >= 0 && !Drain(out_fd, &reader)) {
       close(out_fd);
       out_fd = -1;
     }
@@ -240,9 +279,10 @@ ChildOutcome RunRsync(const std::vector<std::string>& args,
   while (waitpid(pid, &wstatus, 0) < 0 && errno == EINTR) {
   }
   if (out_fd >= 0) {
-    Drain(out_fd, &outcome.output);
+    Drain(out_fd, &reader);
     close(out_fd);
   }
+  reader.Finish();
   if (pid_fd >= 0) close(pid_fd);
 
   if (outcome.cancelled) {
@@ -261,8 +301,10 @@ ChildOutcome RunRsync(const std::vector<std::string>& args,
 
 int RunAndLog(const std::vector<std::string>& args, const RsyncSettings& s,
               const boost::function<bool()>& cancel, const char* what,
-              std::string* output, unsigned long long max_file_size) {
-  ChildOutcome outcome = RunRsync(args, s.password, cancel, max_file_size);
+              std::string* output, unsigned long long max_file_size,
+              ProgressParser* progress) {
+  ChildOutcome outcome =
+      RunRsync(args, s.password, cancel, max_file_size, progress);
   if (output != nullptr) *output = outcome.output;
   std::string last;
   size_t start = 0;

@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "rsync_args.h"
+#include "rsync_progress.h"
 
 namespace KARO {
 namespace Backup {
@@ -29,10 +30,13 @@ struct ChildOutcome {
 // Runs `args` (args[0] is looked up in PATH). `cancel` may be empty.
 // `max_file_size` (0: none) caps every file rsync writes (RLIMIT_FSIZE).
 // Returns the outcome; a child that cannot be started gives kStartFailed.
+// `progress` (may be null) reads every line of rsync's output as it comes;
+// the lines it takes are left out of the outcome's output.
 ChildOutcome RunRsync(const std::vector<std::string>& args,
                       const std::string& password,
                       const boost::function<bool()>& cancel,
-                      unsigned long long max_file_size = 0);
+                      unsigned long long max_file_size = 0,
+                      ProgressParser* progress = nullptr);
 
 // RunRsync with the settings' password, logging rsync's output line by line
 // at debug level when the debug log is on, and a failure once at error level
@@ -41,7 +45,8 @@ ChildOutcome RunRsync(const std::vector<std::string>& args,
 int RunAndLog(const std::vector<std::string>& args, const RsyncSettings& s,
               const boost::function<bool()>& cancel, const char* what,
               std::string* output = nullptr,
-              unsigned long long max_file_size = 0);
+              unsigned long long max_file_size = 0,
+              ProgressParser* progress = nullptr);
 
 // The line of rsync's `output` that says why it failed, without rsync's
 // prefixes: the daemon's "@ERROR:" refusal first, else the first "rsync:"

@@ -8,6 +8,13 @@
 namespace KARO {
 namespace Backup {
 
+namespace {
+
+thread_local RsyncWrapper::ProgressHandler t_progress;
+thread_local RsyncWrapper::TransferStats t_stats;
+
+}  // namespace
+
 RsyncWrapper::RsyncWrapper() : settings_(new detail::RsyncSettings) {}
 
 RsyncWrapper::~RsyncWrapper() {
@@ -92,10 +99,25 @@ int RsyncWrapper::execute(boost::function<bool()> cancel) {
     return kBadSettings;
   }
   if (command) return detail::RunCommand(s, cancel);
-  return detail::RunAndLog(detail::DataTransferArgs(s), s, cancel, "transfer");
+  std::vector<std::string> args = detail::DataTransferArgs(s);
+  if (!t_progress) return detail::RunAndLog(args, s, cancel, "transfer");
+  // Before "--", the source and the destination, which end the vector.
+  args.insert(args.end() - 3, {"--info=progress2", "--stats"});
+  detail::ProgressParser parser(t_progress);
+  t_stats = RsyncWrapper::TransferStats();
+  int status =
+      detail::RunAndLog(args, s, cancel, "transfer", nullptr, 0, &parser);
+  t_stats = parser.stats();
+  return status;
 }
 
 std::string RsyncWrapper::lastError() { return detail::LastError(); }
+
+void RsyncWrapper::setThreadProgressHandler(const ProgressHandler& handler) {
+  t_progress = handler;
+}
+
+RsyncWrapper::TransferStats RsyncWrapper::lastStats() { return t_stats; }
 
 }  // namespace Backup
 }  // namespace KARO

@@ -390,8 +390,14 @@ PObject Daemon::RunMap(const ActiveRun& run, bool ended) const {
     share["status"] = s.status;
     share["status_text"] = s.ok ? StatusText(0) : s.cause;
     share["seconds"] = static_cast<unsigned long long>(s.seconds + 0.5);
-    share["files"] = 0ULL;
-    share["bytes"] = 0ULL;
+    // rsync's own figures of the transfer.
+    share["files"] = s.stats.files_transferred;
+    share["bytes"] = s.stats.literal_bytes;
+    share["deleted"] = s.stats.files_deleted;
+    share["matched"] = s.stats.matched_bytes;
+    share["sent"] = s.stats.bytes_sent;
+    share["speed"] =
+        static_cast<unsigned long long>(s.stats.bytes_per_second + 0.5);
     shares.push_back(share);
   }
   map["shares"] = shares;

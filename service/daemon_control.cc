@@ -319,9 +319,17 @@ PObject Daemon::DoStatus(const PObject&) {
     r["trigger"] = run.trigger;
     r["started"] = static_cast<unsigned long long>(run.started);
     std::string share, step;
-    run.Progress(share, step);
+    KARO::Backup::RsyncWrapper::TransferProgress p;
+    run.Progress(share, step, p);
     r["share"] = share;
     r["step"] = step;
+    r["bytes_done"] = p.bytes_done;
+    r["bytes_total"] = p.bytes_total;
+    r["percent"] = p.percent;
+    r["rate"] = static_cast<unsigned long long>(p.bytes_per_second + 0.5);
+    r["seconds_left"] = p.seconds_left;
+    r["files_checked"] = p.files_checked;
+    r["files_total"] = p.files_total;
     running.push_back(r);
   }
   reply["running"] = running;

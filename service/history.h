@@ -6,7 +6,8 @@
 // A run map holds "start", "end" (0 while running), "trigger", "outcome"
 // ("ok", "failed", "cancelled", "running"), "message", "task_status",
 // "task_result" and "shares" (per share "name", "step", "status",
-// "status_text", "seconds", "files", "bytes").
+// "status_text", "seconds", and rsync's figures "files", "bytes",
+// "deleted", "matched", "sent", "speed").
 //
 // "last_due" is the schedule slot the task last ran for (or the time it was
 // added), so that a slot missed while the service was down is found at

@@ -10,10 +10,13 @@
 
 namespace s2s_service {
 
-void ActiveRun::Progress(std::string& share, std::string& step) const {
+void ActiveRun::Progress(
+    std::string& share, std::string& step,
+    KARO::Backup::RsyncWrapper::TransferProgress& transfer) const {
   std::lock_guard<std::mutex> lock(mu_);
   share = share_;
   step = step_;
+  transfer = transfer_;
 }
 
 // Runner lines are "probe: ...", "pair: ...", "beacon: ...",
@@ -23,6 +26,10 @@ void ActiveRun::Note(const std::string& line) {
                       line.c_str());
   std::lock_guard<std::mutex> lock(mu_);
   size_t colon = line.find(": ");
+  // Beacons go out while a transfer runs; any other line ends its progress.
+  if (line.compare(0, 7, "beacon:") != 0) {
+    transfer_ = KARO::Backup::RsyncWrapper::TransferProgress();
+  }
   if (line.compare(0, 6, "share ") == 0 && colon != std::string::npos) {
     share_ = line.substr(6, colon - 6);
     std::string rest = line.substr(colon + 2);
@@ -54,9 +61,16 @@ void StartRun(std::shared_ptr<ActiveRun> run,
         }
       }
       if (locked) {
-        run->outcome =
-            RunTask(run->task.task, run->task.excludes, run->beacon_interval,
-                    [&run](const std::string& line) { run->Note(line); });
+        run->outcome = RunTask(
+            run->task.task, run->task.excludes, run->beacon_interval,
+            [&run](const std::string& line) { run->Note(line); },
+            [&run](const std::string& share,
+                   const KARO::Backup::RsyncWrapper::TransferProgress& p) {
+              std::lock_guard<std::mutex> lock(run->mu_);
+              run->share_ = share;
+              run->step_ = "transfer";
+              run->transfer_ = p;
+            });
       }
     }
     BindCancelFlag(nullptr);

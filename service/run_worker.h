@@ -26,8 +26,10 @@ struct ActiveRun {
   CancelFlag cancel;
   TaskOutcome outcome;  // written by the run's thread before it reports
 
-  // Where the run is: the share and the step of the runner's last line.
-  void Progress(std::string& share, std::string& step) const;
+  // Where the run is: the share and the step of the runner's last line, and
+  // rsync's last progress figures while a share transfers (zeros else).
+  void Progress(std::string& share, std::string& step,
+                KARO::Backup::RsyncWrapper::TransferProgress& transfer) const;
 
   std::thread thread;
 
@@ -37,6 +39,7 @@ struct ActiveRun {
   void Note(const std::string& line);
   mutable std::mutex mu_;
   std::string share_, step_;
+  KARO::Backup::RsyncWrapper::TransferProgress transfer_;
 };
 
 // Starts `run` on its thread; `done(id)` is called from that thread when

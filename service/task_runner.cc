@@ -39,8 +39,11 @@ std::string Format(const char* format, double value) {
 class Run {
  public:
   Run(const S2S::SyncTask& task, const std::list<std::string>& excludes,
-      const Reporter& report)
-      : task_(task), excludes_(excludes), report_(report) {}
+      const Reporter& report, const ProgressReporter& progress)
+      : task_(task),
+        excludes_(excludes),
+        report_(report),
+        progress_(progress) {}
 
   void Go(unsigned int beacon_interval);
   TaskOutcome& outcome() { return out_; }
@@ -57,6 +60,7 @@ class Run {
   const S2S::SyncTask& task_;
   const std::list<std::string>& excludes_;
   const Reporter& report_;
+  const ProgressReporter& progress_;
   S2S::Rsyncer rsyncer_;
   TaskOutcome out_;
 };
@@ -143,7 +147,14 @@ void Run::SyncShare(const std::string& name) {
     report_("share " + name + ": started");
     double t0 = Now();
     status = 0;
+    // Always set, so that rsync prints its --stats for the share's figures.
+    KARO::Backup::RsyncWrapper::setThreadProgressHandler(
+        [this, &name](const KARO::Backup::RsyncWrapper::TransferProgress& p) {
+          if (progress_) progress_(name, p);
+        });
     rc = rsyncer_.RunSync(task_.GetID(), name, "/", excludes_, status);
+    KARO::Backup::RsyncWrapper::setThreadProgressHandler({});
+    share.stats = KARO::Backup::RsyncWrapper::lastStats();
     share.seconds = Now() - t0;
     if (ShareStep(share, "transfer", rc, status)) {
       report_("share " + name + ": transferred in " +
@@ -307,8 +318,9 @@ std::string FailureText(int status) {
 
 TaskOutcome RunTask(const S2S::SyncTask& task,
                     const std::list<std::string>& excludes,
-                    unsigned int beacon_interval, const Reporter& report) {
-  Run run(task, excludes, report);
+                    unsigned int beacon_interval, const Reporter& report,
+                    const ProgressReporter& progress) {
+  Run run(task, excludes, report, progress);
   run.Go(beacon_interval);
   return run.outcome();
 }

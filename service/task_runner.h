@@ -21,6 +21,7 @@
 #include <vector>
 
 #include "S2S/sync_obj_task.h"
+#include "karo/rsync_wrapper.h"
 
 namespace s2s_service {
 
@@ -32,6 +33,8 @@ struct ShareOutcome {
   std::string cause;        // the status in words, with rsync's or the
                             // server's reason when either gave one
   double seconds = 0;       // time of the transfer
+  // rsync's --stats of the transfer (complete false when it printed none).
+  KARO::Backup::RsyncWrapper::TransferStats stats;
 };
 
 struct TaskOutcome {
@@ -46,13 +49,19 @@ struct TaskOutcome {
 };
 
 using Reporter = std::function<void(const std::string& line)>;
+// Called with the share's name at each progress line rsync prints while a
+// share transfers.
+using ProgressReporter = std::function<void(
+    const std::string& share,
+    const KARO::Backup::RsyncWrapper::TransferProgress& progress)>;
 
 // Runs `task`. `beacon_interval` is the least time between beacons sent from
 // the cancel checker during a transfer. REQUIRES: the task was checked
 // (CheckTaskSpec).
 TaskOutcome RunTask(const S2S::SyncTask& task,
                     const std::list<std::string>& excludes,
-                    unsigned int beacon_interval, const Reporter& report);
+                    unsigned int beacon_interval, const Reporter& report,
+                    const ProgressReporter& progress = nullptr);
 
 // What a status from the rsync wrapper or the server means, for people.
 std::string StatusText(int status);

@@ -410,6 +410,12 @@ TEST_F(ServiceTest, ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce) {
   EXPECT_EQ(1u, Runs(manual).size()) << "the second run was started";
   EXPECT_EQ(100u << 20,
             std::filesystem::file_size(app_.ServerShare("big") + "/blob"));
+  // rsync's --stats of the run: one file, all of it sent as data.
+  PObject big = Runs(manual)[0]["shares"].asArray()[0];
+  EXPECT_EQ(1u, big["files"].asUInt64());
+  EXPECT_EQ(100u << 20, big["bytes"].asUInt64());
+  EXPECT_EQ(0u, big["matched"].asUInt64());
+  EXPECT_LT(0u, big["speed"].asUInt64());
   EXPECT_EQ(0, StopDaemon());
 
   // At 12:10:30: the missed slots give one catch-up run; tasks and history
@@ -437,9 +443,22 @@ TEST_F(ServiceTest, CancelEndsALongTransferAndTheServerShowsTheTaskIdle) {
   WriteBlob(app_.ClientShare("big") + "/blob", 400);
   StartDaemon(0);
   unsigned long long id = Add("long", {"big"}, S2S::Schedule());
+  // 100 MiB/s: long enough for rsync to report its progress.
+  PObject limit = Action("update", id);
+  limit["task"] = PObject::Map();
+  limit["task"]["max_bandwidth"] = 102400u;
+  ASSERT_EQ(0u, Request(limit)["result"].asUInt64());
   ASSERT_EQ(0u, Request(Action("run", id))["result"].asUInt64());
   // Wait for the data transfer itself.
   ASSERT_TRUE(WaitFor([&] { return BigTransfersStarted() == 1; }, 30));
+  // rsync's progress shows in the running entry.
+  EXPECT_TRUE(WaitFor(
+      [&] {
+        PObject::Array running = Request(Action("status"))["running"].asArray();
+        return running.size() == 1 && running[0]["bytes_done"].asUInt64() > 0 &&
+               running[0]["share"].asString() == "big";
+      },
+      10));
   auto start = std::chrono::steady_clock::now();
   PObject cancel = Request(Action("cancel", id));
   EXPECT_EQ(1u, cancel["was_running"].asUInt64())

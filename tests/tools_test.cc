@@ -254,6 +254,10 @@ TEST_F(ToolsTest, SyncsAShareAndTheServerRecordsIt) {
             ReadFile(server_ + "/volume1/docs/sub/deeper/b.txt"));
   EXPECT_NE(std::string::npos, c.out.find("share docs: finished")) << c.out;
   EXPECT_NE(std::string::npos, c.out.find("1/1 shares synced")) << c.out;
+  // rsync's progress and its --stats: both files, 6 + 20 bytes of data.
+  EXPECT_TRUE(s2s_test::Has(c.out, "files checked")) << c.out;
+  EXPECT_TRUE(s2s_test::Has(c.out, "2 files and 26 B sent, 0 deleted"))
+      << c.out;
   EXPECT_EQ("CLIENT-A", ShareKey("docs", "CompleteID"));
   EXPECT_EQ("", ShareKey("docs", "RunningID"));
 

@@ -211,11 +211,19 @@ std::string FormatStatus(const S2S::PObject& reply) {
       TimeText(reply["started"].asUInt64()) + "), " + Text(reply["tasks"]) +
       " tasks, at most " + Text(reply["max_parallel"]) + " runs at once\n";
   std::vector<Row> running = {
-      {"ID", "NAME", "TRIGGER", "STARTED", "SHARE", "STEP"}};
+      {"ID", "NAME", "TRIGGER", "STARTED", "SHARE", "STEP", "PROGRESS"}};
   for (const S2S::PObject& r : reply["running"].asArray()) {
+    std::string progress = "-";
+    if (r.hasMember("bytes_total") && r["bytes_total"].asUInt64() > 0) {
+      unsigned long long left = r["seconds_left"].asUInt64();
+      progress = Bytes(r["bytes_done"].asUInt64()) + " of " +
+                 Bytes(r["bytes_total"].asUInt64()) + ", " +
+                 Bytes(r["rate"].asUInt64()) + "/s, " + Duration(left) +
+                 " left";
+    }
     running.push_back({Text(r["id"]), Text(r["name"]), Text(r["trigger"]),
                        TimeText(r["started"].asUInt64()), Text(r["share"]),
-                       Text(r["step"])});
+                       Text(r["step"]), progress});
   }
   std::vector<Row> next = {{"ID", "NAME", "NEXT RUN"}};
   for (const S2S::PObject& n : reply["next_runs"].asArray()) {

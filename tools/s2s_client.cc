@@ -12,6 +12,8 @@
 #include <string.h>
 #include <sys/stat.h>
 #include <syslog.h>
+#include <time.h>
+#include <unistd.h>
 
 #include <string>
 
@@ -56,9 +58,59 @@ bool MakeTempDir(std::string& error) {
   return true;
 }
 
+bool g_tty = false;        // standard output is a terminal
+bool g_live_line = false;  // a progress line is showing, without line break
+double g_last_progress = -1;
+
+// A plain progress line every this many seconds when not on a terminal.
+const double kProgressEvery = 10;
+
+double Monotonic() {
+  timespec ts;
+  clock_gettime(CLOCK_MONOTONIC, &ts);
+  return static_cast<double>(ts.tv_sec) + ts.tv_nsec / 1e9;
+}
+
+std::string Size(double bytes) {
+  const char* units[] = {"B", "KiB", "MiB", "GiB", "TiB"};
+  int u = 0;
+  for (; bytes >= 1024 && u < 4; ++u) bytes /= 1024;
+  char buf[32];
+  snprintf(buf, sizeof buf, u == 0 ? "%.0f %s" : "%.1f %s", bytes, units[u]);
+  return buf;
+}
+
 void Print(const std::string& line) {
-  printf("%s\n", line.c_str());
+  printf("%s%s\n", g_live_line ? "\n" : "", line.c_str());
+  g_live_line = false;
   fflush(stdout);
+}
+
+// One live line on a terminal, else a plain line now and then.
+void ShowProgress(const std::string& share,
+                  const KARO::Backup::RsyncWrapper::TransferProgress& p) {
+  double now = Monotonic();
+  if (!g_tty && g_last_progress >= 0 &&
+      now - g_last_progress < kProgressEvery) {
+    return;
+  }
+  g_last_progress = now;
+  char line[256];
+  snprintf(line, sizeof line,
+           "share %s: %s of %s (%u%%), %s/s, %u:%02u:%02u left, %llu/%llu "
+           "files checked",
+           share.c_str(), Size(p.bytes_done).c_str(),
+           Size(p.bytes_total).c_str(), p.percent,
+           Size(p.bytes_per_second).c_str(), p.seconds_left / 3600,
+           p.seconds_left / 60 % 60, p.seconds_left % 60, p.files_checked,
+           p.files_total);
+  if (g_tty) {
+    printf("\r%s\033[K", line);
+    g_live_line = true;
+    fflush(stdout);
+  } else {
+    Print(line);
+  }
 }
 
 void PrintSummary(const TaskSpec& spec, const TaskOutcome& out) {
@@ -72,7 +124,13 @@ void PrintSummary(const TaskSpec& spec, const TaskOutcome& out) {
       out.error.empty() ? "" : ": ", out.error.c_str());
   for (const ShareOutcome& s : out.shares) {
     if (s.ok) {
-      printf("  %-20s ok (%.2f s)\n", s.name.c_str(), s.seconds);
+      printf(
+          "  %-20s ok (%.2f s, %llu files and %s sent, %llu deleted, %s "
+          "matched, %s/s)\n",
+          s.name.c_str(), s.seconds, s.stats.files_transferred,
+          Size(s.stats.literal_bytes).c_str(), s.stats.files_deleted,
+          Size(s.stats.matched_bytes).c_str(),
+          Size(s.stats.bytes_per_second).c_str());
     } else {
       printf("  %-20s FAILED at %s: %s\n", s.name.c_str(),
              s.failed_step.c_str(), s.cause.c_str());
@@ -134,7 +192,10 @@ int main(int argc, char** argv) {
     setenv("S2S_RSYNC_PORT", std::to_string(o.spec.port).c_str(), 1);
   }
   S2S::SyncTask task = MakeSyncTask(o.spec, password);
-  TaskOutcome out = RunTask(task, o.spec.excludes, o.beacon_interval, Print);
+  g_tty = isatty(STDOUT_FILENO) == 1;
+  TaskOutcome out =
+      RunTask(task, o.spec.excludes, o.beacon_interval, Print, ShowProgress);
+  if (g_live_line) fputs("\n", stdout);
   PrintSummary(o.spec, out);
   return out.exit_code;
 }

@@ -84,6 +84,32 @@ class KARO_RSYNC_EXPORT RsyncWrapper {
   using LogHandler = void (*)(int priority, const char* message);
   static void setLogHandler(LogHandler handler);
 
+  // What rsync reports while a data transfer runs (--info=progress2): the
+  // whole transfer's figures, not one file's.
+  struct TransferProgress {
+    unsigned long long bytes_done = 0;   // file data sent or found in place
+    unsigned long long bytes_total = 0;  // estimate from the percentage
+    unsigned int percent = 0;
+    double bytes_per_second = 0;
+    unsigned int seconds_left = 0;         // rsync's estimate
+    unsigned long long files_checked = 0;  // of the file list so far
+    unsigned long long files_total = 0;    // grows while rsync recurses
+  };
+  // rsync's --stats at the end of a data transfer.
+  struct TransferStats {
+    bool complete = false;         // the whole block arrived
+    unsigned long long files = 0;  // in the file list
+    unsigned long long files_transferred = 0;
+    unsigned long long files_deleted = 0;
+    unsigned long long total_size = 0;
+    unsigned long long literal_bytes = 0;  // sent as data
+    unsigned long long matched_bytes = 0;  // found on the server already
+    unsigned long long bytes_sent = 0;     // on the wire
+    unsigned long long bytes_received = 0;
+    double bytes_per_second = 0;
+  };
+  using ProgressHandler = boost::function<void(const TransferProgress&)>;
+
   // Defaults: every switch off, time-out 600 s, debug log off.
   RsyncWrapper();
   virtual ~RsyncWrapper();
@@ -146,6 +172,15 @@ class KARO_RSYNC_EXPORT RsyncWrapper {
   // command's status. "" after a success or when neither said anything.
   // Like errno, it belongs to the thread and the next execute() replaces it.
   static std::string lastError();
+
+  // A handler for the calling thread: while it is set, every data transfer
+  // on the thread runs with --info=progress2 --stats, reports each progress
+  // line to it (on this thread, from within execute()) and leaves its final
+  // figures in lastStats(). An empty handler switches this off again.
+  static void setThreadProgressHandler(const ProgressHandler& handler);
+  // The --stats of the calling thread's last data transfer made with a
+  // progress handler; `complete` is false when rsync did not print them.
+  static TransferStats lastStats();
 
  private:
   std::unique_ptr<detail::RsyncSettings> settings_;

@@ -1,0 +1,111 @@
+#include "rsync_progress.h"
+
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+
+namespace KARO {
+namespace Backup {
+namespace detail {
+
+namespace {
+
+// "3,000,003" -> 3000003; stops at the first character that is neither a
+// digit nor a comma.
+unsigned long long Number(const char* p) {
+  unsigned long long n = 0;
+  for (; *p == ',' || (*p >= '0' && *p <= '9'); ++p) {
+    if (*p != ',') n = n * 10 + static_cast<unsigned>(*p - '0');
+  }
+  return n;
+}
+
+// The number after `label` at the start of `line`.
+bool Labelled(const std::string& line, const char* label,
+              unsigned long long* value) {
+  size_t n = strlen(label);
+  if (line.compare(0, n, label) != 0) return false;
+  *value = Number(line.c_str() + n);
+  return true;
+}
+
+}  // namespace
+
+bool ProgressParser::Feed(const std::string& line) {
+  return FeedProgress(line) || FeedStats(line);
+}
+
+// "      3,000,003 100%  476.84MB/s    0:00:00 (xfr#2, to-chk=0/4)"
+bool ProgressParser::FeedProgress(const std::string& line) {
+  size_t i = line.find_first_not_of(' ');
+  if (i == std::string::npos || i == 0 || line[i] < '0' || line[i] > '9') {
+    return false;
+  }
+  std::string words = line.substr(i);
+  for (char& c : words) {
+    if (c == ',') c = '_';
+  }
+  char done[32], unit[8];
+  unsigned percent = 0, h = 0, m = 0, s = 0;
+  double rate = 0;
+  if (sscanf(words.c_str(), "%31s %u%% %lf%7[kMGT]B/s %u:%u:%u", done, &percent,
+             &rate, unit, &h, &m, &s) != 7) {
+    return false;
+  }
+  RsyncWrapper::TransferProgress p;
+  p.bytes_done = Number(line.c_str() + i);
+  p.percent = percent;
+  double scale = 1024;
+  for (const char* u = "kMGT"; *u != '\0' && *u != unit[0]; ++u) scale *= 1024;
+  p.bytes_per_second = rate * scale;
+  p.seconds_left = h * 3600 + m * 60 + s;
+  p.bytes_total = percent > 0 ? p.bytes_done * 100 / percent : 0;
+  size_t chk = line.find("-chk=");
+  if (chk != std::string::npos) {
+    unsigned long long left = Number(line.c_str() + chk + 5);
+    size_t slash = line.find('/', chk);
+    if (slash != std::string::npos) {
+      p.files_total = Number(line.c_str() + slash + 1);
+      p.files_checked = p.files_total - std::min(left, p.files_total);
+    }
+  }
+  if (handler_) handler_(p);
+  return true;
+}
+
+bool ProgressParser::FeedStats(const std::string& line) {
+  RsyncWrapper::TransferStats& t = stats_;
+  unsigned long long ignored = 0;
+  if (Labelled(line, "Number of files: ", &t.files) ||
+      Labelled(line,
+               "Number of regular files transferred: ", &t.files_transferred) ||
+      Labelled(line, "Number of deleted files: ", &t.files_deleted) ||
+      Labelled(line, "Total file size: ", &t.total_size) ||
+      Labelled(line, "Literal data: ", &t.literal_bytes) ||
+      Labelled(line, "Matched data: ", &t.matched_bytes) ||
+      Labelled(line, "Total bytes sent: ", &t.bytes_sent) ||
+      Labelled(line, "Total bytes received: ", &t.bytes_received) ||
+      Labelled(line, "Number of created files: ", &ignored) ||
+      Labelled(line, "Total transferred file size: ", &ignored) ||
+      Labelled(line, "File list ", &ignored) ||
+      Labelled(line, "total size is ", &ignored)) {
+    return true;
+  }
+  // "sent 3,000,937 bytes  received 62 bytes  6,001,998.00 bytes/sec"
+  size_t rate = line.find("bytes  ", line.find("received "));
+  if (line.compare(0, 5, "sent ") == 0 && rate != std::string::npos &&
+      line.find("bytes/sec") != std::string::npos) {
+    std::string digits;
+    for (size_t k = rate + 7; k < line.size() && line[k] != ' '; ++k) {
+      if (line[k] != ',') digits += line[k];
+    }
+    t.bytes_per_second = strtod(digits.c_str(), nullptr);
+    t.complete = true;
+    return true;
+  }
+  return false;
+}
+
+}  // namespace detail
+}  // namespace Backup
+}  // namespace KARO
