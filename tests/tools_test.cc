@@ -467,8 +467,10 @@ TEST_F(ToolsTest, SigtermCancelsARunningTransfer) {
   bool signalled = false;
   for (int waited = 0; waited < 20000 && !signalled; waited += 2) {
     for (const std::string& cmd : AllCommandLines()) {
+      // This test's own client tree: tests running beside it push shares
+      // of the same name.
       if (cmd.find("rsync") == 0 && cmd.find("/big/") != std::string::npos &&
-          cmd.find("/volume1/big") != std::string::npos) {
+          cmd.find(client + "/volume1/big") != std::string::npos) {
         kill(c.pid, SIGTERM);
         signalled = true;
         break;
