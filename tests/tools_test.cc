@@ -6,6 +6,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <poll.h>
+#include <pwd.h>
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -267,6 +268,62 @@ TEST_F(ToolsTest, SyncsAShareAndTheServerRecordsIt) {
       << status.out;
   EXPECT_NE(std::string::npos, status.out.find("last completed by CLIENT-A"));
   EXPECT_NE(std::string::npos, status.out.find("task  t1"));
+}
+
+// A server that an ordinary user sets up and runs: its daemon cannot change
+// users (no setgroups) and must not store links as plain files (fake
+// super), yet syncs work and symbolic links arrive as links.
+TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
+  const passwd* nobody = getpwnam("nobody");
+  ASSERT_NE(nullptr, nobody);
+  // The programs and libraries go where that user may run them: the build
+  // tree may lie under a directory only root can enter.
+  std::string built = std::filesystem::path(S2S_SERVER_PROGRAM).parent_path();
+  std::string bin = tmp_.Sub("bin"), root = tmp_.Sub("userserver");
+  std::filesystem::create_directories(bin);
+  for (const char* file :
+       {"s2s-server", "s2s-cmd-handler", "libs2s.so.0", "libkarorsync.so.0"}) {
+    std::filesystem::copy(built + "/" + file, bin + "/" + file);
+  }
+  std::string pw = tmp_.Sub("userpassword");
+  std::filesystem::copy(pw_file_, pw);
+  ASSERT_EQ(0, chown(pw.c_str(), nobody->pw_uid, nobody->pw_gid));
+  ASSERT_EQ(0, mkdir(root.c_str(), 0755));
+  ASSERT_EQ(0, chown(root.c_str(), nobody->pw_uid, nobody->pw_gid));
+  ASSERT_EQ(0, chmod(tmp_.path().c_str(), 0755));
+  auto as_user = [&](std::vector<std::string> words) {
+    std::vector<std::string> argv = {
+        "/usr/bin/setpriv",
+        "--reuid=" + std::to_string(nobody->pw_uid),
+        "--regid=" + std::to_string(nobody->pw_gid),
+        "--clear-groups",
+        bin + "/s2s-server",
+        "--root",
+        root};
+    argv.insert(argv.end(), words.begin(), words.end());
+    return RunProgram(tmp_.path(), argv, {"LD_LIBRARY_PATH=" + bin});
+  };
+  Child init = as_user(
+      {"init", "--share", "docs", "--user", "s2s", "--password-file", pw});
+  ASSERT_EQ(0, init.code) << init.out << init.err;
+  Child start = as_user({"start"});
+  ASSERT_EQ(0, start.code) << start.out << start.err;
+  std::string port = start.out.substr(start.out.rfind(' ') + 1);
+  port.pop_back();
+
+  std::string client = MakeClient("client", "CLIENT-A");
+  ASSERT_EQ(
+      0, symlink("sub/deeper/b.txt", (client + "/volume1/docs/link").c_str()));
+  std::vector<std::string> argv = Client(client, "docs");
+  argv[3] = "--port=" + port;
+  Child c = RunProgram(tmp_.path(), argv);
+  EXPECT_EQ(kExitOk, c.code) << c.out << c.err;
+  struct stat st;
+  ASSERT_EQ(0, lstat((root + "/volume1/docs/link").c_str(), &st));
+  EXPECT_TRUE(S_ISLNK(st.st_mode));
+  EXPECT_EQ("bravo from CLIENT-A\n", ReadFile(root + "/volume1/docs/link"));
+  Child stop = as_user({"stop"});
+  EXPECT_EQ(0, stop.code) << stop.out << stop.err;
 }
 
 // A task file run with a beacon due at every poll: the beacons' own rsync
