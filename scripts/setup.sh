@@ -64,7 +64,7 @@ configure_and_build() {
   # The demo needs only the programs.
   local targets=()
   if [ "$job" = demo ]; then
-    targets=(--target s2s-client s2s-server s2s-cmd-handler)
+    targets=(--target s2s-client s2s-server s2s-cmd-handler s2sd s2sctl)
   fi
   cmake --build "$dir" -j "$(nproc)" "${targets[@]}"
 }
