@@ -13,6 +13,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <utility>
 
 #include "S2S/logger.h"
 #include "karo_process.h"
@@ -472,7 +473,7 @@ PObject Daemon::Handle(const PObject& request) {
   requests_.push_back(&pending);
   Wake(request_fd_);
   answered_.wait(lock, [&pending] { return pending.done; });
-  return pending.reply;
+  return std::move(pending.reply);
 }
 
 void Daemon::OnRequests() {

@@ -133,10 +133,10 @@ bool Daemon::Store(const StoredTask& stored, std::string& error) {
 
 PObject Daemon::DoList(const PObject&) {
   PObject reply = Ok(std::to_string(tasks_.size()) + " tasks");
-  PObject::Array list;
+  // Built in place: a list of many tasks is too large to copy around.
+  PObject::Array& list = reply["tasks"].asArray();
   list.reserve(tasks_.size());
   for (const auto& it : tasks_) list.push_back(TaskMap(it.first, it.second));
-  reply["tasks"] = list;
   return reply;
 }
 
