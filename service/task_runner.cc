@@ -201,12 +201,11 @@ void Run::Go(unsigned int beacon_interval) {
   rsyncer_.SetCancelChecker(CancelChecker);
   if (Probe() && Pair()) {
     SetBeaconHook([this] { Beacon("transfer running"); }, beacon_interval);
-    Beacon("task started");
     const std::list<std::string>& shares = task_.GetInfo().GetShareList();
-    size_t done = 0;
     for (const std::string& share : shares) {
       if (CancelRequested()) break;
-      if (done++ > 0) Beacon("next share");
+      // Between shares as during a transfer: once the interval has passed.
+      if (BeaconDue()) Beacon("next share");
       SyncShare(share);
     }
     SetBeaconHook(nullptr, 0);

@@ -4,9 +4,10 @@
 // each share announces the sync, pushes the data, carries an encrypted
 // share's key file and reports the share's end; beacons keep the task alive
 // on the server between shares and, during long transfers, from the cancel
-// checker's poll; the task's end is reported last. Each step is reported as
-// one line through the caller's reporter. A share that fails does not stop
-// the others; a failed probe or pairing, or a cancel, stops the task.
+// checker's poll, once their interval has passed; the task's end is
+// reported last. Each step is reported as one line through the caller's
+// reporter. A share that fails does not stop the others; a failed probe or
+// pairing, or a cancel, stops the task.
 //
 // RunTask runs on the calling thread with its own Rsyncer; a cancel comes
 // through the flag bound to that thread (service/cancel.h), and its beacons
@@ -55,9 +56,9 @@ using ProgressReporter = std::function<void(
     const std::string& share,
     const KARO::Backup::RsyncWrapper::TransferProgress& progress)>;
 
-// Runs `task`. `beacon_interval` is the least time between beacons sent from
-// the cancel checker during a transfer. REQUIRES: the task was checked
-// (CheckTaskSpec).
+// Runs `task`. `beacon_interval` is the least time between beacons (the
+// first once that much time has passed since the shares began). REQUIRES:
+// the task was checked (CheckTaskSpec).
 TaskOutcome RunTask(const S2S::SyncTask& task,
                     const std::list<std::string>& excludes,
                     unsigned int beacon_interval, const Reporter& report,
