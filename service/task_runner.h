@@ -9,6 +9,13 @@
 // reporter. A share that fails does not stop the others; a failed probe or
 // pairing, or a cancel, stops the task.
 //
+// A caller that runs the task again (the service) may hand in the session
+// of its last run (service/session.h): the probe and the pairing are then
+// skipped. When a share's step is answered in a way that session may have
+// caused (the service off, the server paired with another client or with
+// none, the share's sync gone, the address refusing or silent), the run
+// probes and pairs again at once and makes the share's steps again, once.
+//
 // RunTask runs on the calling thread with its own Rsyncer; a cancel comes
 // through the flag bound to that thread (service/cancel.h), and its beacons
 // are the thread's own, so several tasks may run at once on threads of
@@ -23,6 +30,7 @@
 
 #include "S2S/sync_obj_task.h"
 #include "karo/rsync_wrapper.h"
+#include "service/session.h"
 
 namespace s2s_service {
 
@@ -57,12 +65,15 @@ using ProgressReporter = std::function<void(
     const KARO::Backup::RsyncWrapper::TransferProgress& progress)>;
 
 // Runs `task`. `beacon_interval` is the least time between beacons (the
-// first once that much time has passed since the shares began). REQUIRES:
-// the task was checked (CheckTaskSpec).
+// first once that much time has passed since the shares began). `session`,
+// when given, is the task's last session on entry (an invalid one: probe
+// and pair) and this run's on return (invalid when the next run has to
+// probe again). REQUIRES: the task was checked (CheckTaskSpec).
 TaskOutcome RunTask(const S2S::SyncTask& task,
                     const std::list<std::string>& excludes,
                     unsigned int beacon_interval, const Reporter& report,
-                    const ProgressReporter& progress = nullptr);
+                    const ProgressReporter& progress = nullptr,
+                    Session* session = nullptr);
 
 // What a status from the rsync wrapper or the server means, for people.
 std::string StatusText(int status);
