@@ -7,6 +7,8 @@
 //     of a command's size, from a module of the same daemon without hooks;
 //     and against a tiny bare push to that module. BM_CommandVsFloor runs
 //     the three in turn and reports the command's ratio to each;
+//     BM_CommandCpuVsFloor compares the CPU time behind each, which the
+//     machine's load does not stretch;
 //   - a full task cycle (probe, pair, start, RunSync, finish share and task)
 //     on a tree of about 200 MB in 3000 files against bare rsync with the
 //     options the wrapper gives the transfer (-a -H --sparse --delete
@@ -20,6 +22,7 @@
 #include <benchmark/benchmark.h>
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -27,6 +30,7 @@
 #include <filesystem>
 #include <fstream>
 #include <memory>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -218,6 +222,29 @@ struct Bench {
   }
 };
 
+// CPU seconds used so far by this process, its waited-for children (the
+// client's rsync runs) and the children the server daemon `daemon` has
+// reaped (its connections, with the hooks they waited for).
+double Cpu(pid_t daemon) {
+  rusage self, children;
+  getrusage(RUSAGE_SELF, &self);
+  getrusage(RUSAGE_CHILDREN, &children);
+  auto seconds = [](const timeval& t) { return t.tv_sec + t.tv_usec / 1e6; };
+  double cpu = seconds(self.ru_utime) + seconds(self.ru_stime) +
+               seconds(children.ru_utime) + seconds(children.ru_stime);
+  std::ifstream in("/proc/" + std::to_string(daemon) + "/stat");
+  std::string stat((std::istreambuf_iterator<char>(in)), {});
+  size_t paren = stat.rfind(')');
+  if (paren == std::string::npos) return cpu;
+  // After the name: state and 11 fields, then utime, stime, cutime, cstime.
+  std::istringstream fields(stat.substr(paren + 2));
+  std::string field;
+  for (int i = 0; i < 13; ++i) fields >> field;
+  long cutime = 0, cstime = 0;
+  fields >> cutime >> cstime;
+  return cpu + static_cast<double>(cutime + cstime) / sysconf(_SC_CLK_TCK);
+}
+
 // Destroyed at exit: the daemon stopped, the tree removed.
 Bench& TheBench() {
   static Bench bench;
@@ -297,6 +324,43 @@ void BM_CommandVsFloor(benchmark::State& state) {
   state.counters["push_ms"] = push * 1e3 / state.iterations();
   state.counters["ratio"] = command / floor;
   state.counters["push_ratio"] = command / push;
+}
+
+// The CPU time behind a floor pull and behind a beacon, 20 of each per
+// repetition: "cpu_floor_ms" and "cpu_command_ms" per call, "cpu_ratio" the
+// one over the other. The daemon reaps its connections after they end, so
+// each batch is given a moment before it is read. Not counted: the cleaner
+// a command's hook leaves behind, which no process waits for.
+void BM_CommandCpuVsFloor(benchmark::State& state) {
+  const int kCalls = 20;
+  Bench& b = TheBench();
+  if (!b.ok) return state.SkipWithError("no server");
+  S2S::Rsyncer r;
+  if (r.Initialize(b.app.Info()) != 0) return state.SkipWithError("probe");
+  const pid_t daemon = b.app.daemon().pid();
+  double command = 0, floor = 0;
+  for (auto _ : state) {
+    double c0 = Cpu(daemon);
+    for (int i = 0; i < kCalls; ++i) {
+      if (!b.FloorPull()) return state.SkipWithError("pull failed");
+    }
+    usleep(300000);
+    double c1 = Cpu(daemon);
+    for (int i = 0; i < kCalls; ++i) {
+      int status = -1;
+      if (r.SendBeacon("bench", status) != 0 || status != 0) {
+        return state.SkipWithError("beacon failed");
+      }
+    }
+    usleep(300000);
+    double c2 = Cpu(daemon);
+    floor += c1 - c0;
+    command += c2 - c1;
+  }
+  double calls = static_cast<double>(kCalls) * state.iterations();
+  state.counters["cpu_floor_ms"] = floor * 1e3 / calls;
+  state.counters["cpu_command_ms"] = command * 1e3 / calls;
+  state.counters["cpu_ratio"] = command / floor;
 }
 
 // state.range(0): 1 for a first sync into an empty share, 0 for a re-sync.
@@ -379,6 +443,12 @@ BENCHMARK(BM_CommandVsFloor)
     ->Unit(benchmark::kMillisecond)
     ->Iterations(1)
     ->Repetitions(30)
+    ->ReportAggregatesOnly(true);
+BENCHMARK(BM_CommandCpuVsFloor)
+    ->UseRealTime()
+    ->Unit(benchmark::kMillisecond)
+    ->Iterations(1)
+    ->Repetitions(5)
     ->ReportAggregatesOnly(true);
 // Interleaved: first syncs, then re-syncs, each against its bare twin.
 BENCHMARK(BM_FullCycle)
