@@ -34,6 +34,11 @@ int Rsyncer::Initialize(const SyncInfo& info) {
   return TestServer();
 }
 
+void Rsyncer::Resume(const SyncInfo& probed, int serverVersion) {
+  syncInfo_ = probed;
+  serverVersion_ = serverVersion;
+}
+
 int Rsyncer::TestServer() {
   int status = kNothingTried;
   std::vector<std::string> candidates;

@@ -2,20 +2,27 @@
 // daemon in the same run:
 //   - one command round trip (a beacon, which writes the server's registry,
 //     and a version query, which does not) against the floor of a pull: a
-//     bare pull of one tiny file with the same transport options and an
-//     early input of a command's size, from a module of the same daemon
-//     without hooks; BM_CommandVsFloor runs the two in turn and reports
-//     their ratio. A tiny bare push to that module is the push floor;
+//     bare pull of one tiny file with the options the wrapper gives a
+//     command (transport, -v, --max-size, --info=skip1) and an early input
+//     of a command's size, from a module of the same daemon without hooks;
+//     and against a tiny bare push to that module. BM_CommandVsFloor runs
+//     the three in turn and reports the command's ratio to each;
+//     BM_CommandCpuVsFloor compares the CPU time behind each, which the
+//     machine's load does not stretch;
 //   - a full task cycle (probe, pair, start, RunSync, finish share and task)
 //     on a tree of about 200 MB in 3000 files against bare rsync with the
-//     transfer's own options (-a -H -A -X --delete --numeric-ids
-//     --whole-file and the transport options), for a first sync into an
-//     empty share and for a re-sync without changes;
+//     options the wrapper gives the transfer (-a -H --sparse --delete
+//     --numeric-ids --whole-file -A -X, transport, -v), for a first sync
+//     into an empty share and for a re-sync without changes;
 //   - RunSync alone on the re-sync.
+// Every bare rsync's output goes through a pipe that is read to its end, as
+// the wrapper reads it.
 // The bare pushes of the tree go to a second share whose sync the client
 // holds open, so that both pass the daemon's same guard hook.
 #include <benchmark/benchmark.h>
+#include <fcntl.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -23,6 +30,7 @@
 #include <filesystem>
 #include <fstream>
 #include <memory>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -78,10 +86,13 @@ void Empty(const std::string& dir) {
   }
 }
 
-// The options every rsync of the wrapper carries (the transport options of
-// a daemon connection).
-const std::vector<std::string> kTransport = {"--timeout=600", "--contimeout=60",
-                                             "--sockopts=TCP_NODELAY"};
+// The options the wrapper gives rsync over a daemon socket: its time-outs
+// (60 s for a command, 600 s for a transfer; the connection's at most 15 s)
+// and -v, since neither a command nor a transfer is a test task.
+std::vector<std::string> Transport(int timeout) {
+  return {"--timeout=" + std::to_string(timeout), "--contimeout=15",
+          "--sockopts=TCP_NODELAY", "-v"};
+}
 
 struct Bench {
   s2s_test::Appliances app{S2S_CMD_HANDLER};
@@ -89,12 +100,15 @@ struct Bench {
   std::string url;    // the bare pushes' destination
   std::string floor;  // the module without hooks
   std::string early;  // an early input of a command's size
+  std::string tiny;   // the tiny push's file
   bool ok = false;
 
   Bench() {
     KARO::Backup::RsyncWrapper::setLogHandler(QuietLog);
     ok = app.AddShare("cycle") && app.AddShare("bare") && app.StartServer() &&
          MakeTree(app.ClientShare("cycle")) && AddFloorModule();
+    tiny = app.client_root() + "/tiny";
+    std::ofstream(tiny) << "x";
     base = "rsync://" + app.user() +
            "@127.0.0.1:" + std::to_string(app.daemon().port()) + "/";
     url = base + "bare/";
@@ -131,7 +145,8 @@ struct Bench {
     return static_cast<bool>(out);
   }
 
-  // Runs rsync with `args` and the password in its environment only.
+  // Runs rsync with `args` and the password in its environment only, its
+  // output read to the end and dropped.
   int Rsync(const std::vector<std::string>& args) {
     std::vector<std::string> env_store = {"RSYNC_PASSWORD=" +
                                           app.Info().GetPassword()};
@@ -143,12 +158,21 @@ struct Bench {
     a.insert(a.begin(), "rsync");
     for (std::string& s : a) argv.push_back(&s[0]);
     argv.push_back(nullptr);
+    int out[2];
+    if (pipe2(out, O_CLOEXEC) != 0) return -1;
     pid_t pid = fork();
     if (pid < 0) return -1;
     if (pid == 0) {
+      dup2(out[1], 1);
+      dup2(out[1], 2);
       execvpe("rsync", argv.data(), env.data());
       _exit(127);
     }
+    close(out[1]);
+    char buf[4096];
+    while (read(out[0], buf, sizeof buf) > 0) {
+    }
+    close(out[0]);
     int st = 0;
     waitpid(pid, &st, 0);
     return WIFEXITED(st) ? WEXITSTATUS(st) : -1;
@@ -171,10 +195,10 @@ struct Bench {
   // The transfer's own options, as the wrapper gives them to RunSync.
   bool Bare() {
     std::vector<std::string> args = {
-        "-a", "-H", "-A", "-X", "--delete", "--numeric-ids", "--whole-file"};
-    args.insert(args.end(), kTransport.begin(), kTransport.end());
-    args.push_back(app.ClientShare("cycle") + "/");
-    args.push_back(url);
+        "-a",           "-H", "--sparse", "--delete", "--numeric-ids",
+        "--whole-file", "-A", "-X"};
+    for (const std::string& o : Transport(600)) args.push_back(o);
+    args.insert(args.end(), {"--", app.ClientShare("cycle") + "/", url});
     return Rsync(args) == 0;
   }
 
@@ -183,12 +207,43 @@ struct Bench {
   bool FloorPull() {
     std::string dest = app.client_root() + "/pulled";
     std::filesystem::remove_all(dest);
-    std::vector<std::string> args = kTransport;
+    std::vector<std::string> args = Transport(60);
     args.insert(args.end(),
-                {"--early-input=" + early, "--", base + "floor/tiny", dest});
+                {"--early-input=" + early, "--max-size=1048576", "--info=skip1",
+                 "--", base + "floor/tiny", dest + "/"});
+    return Rsync(args) == 0;
+  }
+
+  // The push floor: one tiny file into the module without hooks.
+  bool TinyPush() {
+    std::vector<std::string> args = Transport(60);
+    args.insert(args.end(), {"--", tiny, base + "floor/pushed"});
     return Rsync(args) == 0;
   }
 };
+
+// CPU seconds used so far by this process, its waited-for children (the
+// client's rsync runs) and the children the server daemon `daemon` has
+// reaped (its connections, with the hooks they waited for).
+double Cpu(pid_t daemon) {
+  rusage self, children;
+  getrusage(RUSAGE_SELF, &self);
+  getrusage(RUSAGE_CHILDREN, &children);
+  auto seconds = [](const timeval& t) { return t.tv_sec + t.tv_usec / 1e6; };
+  double cpu = seconds(self.ru_utime) + seconds(self.ru_stime) +
+               seconds(children.ru_utime) + seconds(children.ru_stime);
+  std::ifstream in("/proc/" + std::to_string(daemon) + "/stat");
+  std::string stat((std::istreambuf_iterator<char>(in)), {});
+  size_t paren = stat.rfind(')');
+  if (paren == std::string::npos) return cpu;
+  // After the name: state and 11 fields, then utime, stime, cutime, cstime.
+  std::istringstream fields(stat.substr(paren + 2));
+  std::string field;
+  for (int i = 0; i < 13; ++i) fields >> field;
+  long cutime = 0, cstime = 0;
+  fields >> cutime >> cstime;
+  return cpu + static_cast<double>(cutime + cstime) / sysconf(_SC_CLK_TCK);
+}
 
 // Destroyed at exit: the daemon stopped, the tree removed.
 Bench& TheBench() {
@@ -233,25 +288,22 @@ void BM_BarePullFloor(benchmark::State& state) {
 void BM_BareTinyPush(benchmark::State& state) {
   Bench& b = TheBench();
   if (!b.ok) return state.SkipWithError("no server");
-  std::string tiny = b.app.client_root() + "/tiny";
-  std::ofstream(tiny) << "x";
-  std::vector<std::string> args = kTransport;
-  args.insert(args.end(), {"--", tiny, b.base + "floor/pushed"});
   for (auto _ : state) {
-    if (b.Rsync(args) != 0) return state.SkipWithError("push failed");
+    if (!b.TinyPush()) return state.SkipWithError("push failed");
   }
 }
 
-// A beacon and a floor pull in turn: the time is the beacon's, "floor_ms"
-// the pull's, "ratio" the one over the other, so that both see the same
-// load.
+// A floor pull, a beacon and a tiny push in turn, so that all three see the
+// same load: the time is the beacon's, "floor_ms" the pull's, "push_ms" the
+// push's, "ratio" and "push_ratio" the beacon's over each. With one
+// iteration per repetition, the median of "ratio" is the median pair's.
 void BM_CommandVsFloor(benchmark::State& state) {
   using Clock = std::chrono::steady_clock;
   Bench& b = TheBench();
   if (!b.ok) return state.SkipWithError("no server");
   S2S::Rsyncer r;
   if (r.Initialize(b.app.Info()) != 0) return state.SkipWithError("probe");
-  double command = 0, floor = 0;
+  double command = 0, floor = 0, push = 0;
   for (auto _ : state) {
     auto t0 = Clock::now();
     if (!b.FloorPull()) return state.SkipWithError("pull failed");
@@ -261,12 +313,54 @@ void BM_CommandVsFloor(benchmark::State& state) {
       return state.SkipWithError("beacon failed");
     }
     auto t2 = Clock::now();
+    if (!b.TinyPush()) return state.SkipWithError("push failed");
+    auto t3 = Clock::now();
     floor += std::chrono::duration<double>(t1 - t0).count();
     command += std::chrono::duration<double>(t2 - t1).count();
+    push += std::chrono::duration<double>(t3 - t2).count();
     state.SetIterationTime(std::chrono::duration<double>(t2 - t1).count());
   }
   state.counters["floor_ms"] = floor * 1e3 / state.iterations();
+  state.counters["push_ms"] = push * 1e3 / state.iterations();
   state.counters["ratio"] = command / floor;
+  state.counters["push_ratio"] = command / push;
+}
+
+// The CPU time behind a floor pull and behind a beacon, 20 of each per
+// repetition: "cpu_floor_ms" and "cpu_command_ms" per call, "cpu_ratio" the
+// one over the other. The daemon reaps its connections after they end, so
+// each batch is given a moment before it is read. Not counted: the cleaner
+// a command's hook leaves behind, which no process waits for.
+void BM_CommandCpuVsFloor(benchmark::State& state) {
+  const int kCalls = 20;
+  Bench& b = TheBench();
+  if (!b.ok) return state.SkipWithError("no server");
+  S2S::Rsyncer r;
+  if (r.Initialize(b.app.Info()) != 0) return state.SkipWithError("probe");
+  const pid_t daemon = b.app.daemon().pid();
+  double command = 0, floor = 0;
+  for (auto _ : state) {
+    double c0 = Cpu(daemon);
+    for (int i = 0; i < kCalls; ++i) {
+      if (!b.FloorPull()) return state.SkipWithError("pull failed");
+    }
+    usleep(300000);
+    double c1 = Cpu(daemon);
+    for (int i = 0; i < kCalls; ++i) {
+      int status = -1;
+      if (r.SendBeacon("bench", status) != 0 || status != 0) {
+        return state.SkipWithError("beacon failed");
+      }
+    }
+    usleep(300000);
+    double c2 = Cpu(daemon);
+    floor += c1 - c0;
+    command += c2 - c1;
+  }
+  double calls = static_cast<double>(kCalls) * state.iterations();
+  state.counters["cpu_floor_ms"] = floor * 1e3 / calls;
+  state.counters["cpu_command_ms"] = command * 1e3 / calls;
+  state.counters["cpu_ratio"] = command / floor;
 }
 
 // state.range(0): 1 for a first sync into an empty share, 0 for a re-sync.
@@ -349,6 +443,12 @@ BENCHMARK(BM_CommandVsFloor)
     ->Unit(benchmark::kMillisecond)
     ->Iterations(1)
     ->Repetitions(30)
+    ->ReportAggregatesOnly(true);
+BENCHMARK(BM_CommandCpuVsFloor)
+    ->UseRealTime()
+    ->Unit(benchmark::kMillisecond)
+    ->Iterations(1)
+    ->Repetitions(5)
     ->ReportAggregatesOnly(true);
 // Interleaved: first syncs, then re-syncs, each against its bare twin.
 BENCHMARK(BM_FullCycle)

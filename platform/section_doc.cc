@@ -10,6 +10,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <functional>
 #include <memory>
 #include <string_view>
 
@@ -81,6 +83,26 @@ void LoadPair(SectionPairs* pairs, std::unique_ptr<KeyIndex>* index,
   }
 }
 
+// A line "\tkey=\"value\"" exactly as the writers produce it: a line that
+// reads as that pair and that the writers would write the same.
+bool WritersPair(std::string_view line, std::string_view* key,
+                 std::string_view* value) {
+  if (line.size() < 5 || line[0] != '\t') return false;
+  size_t eq = line.find('=');
+  if (eq == std::string_view::npos || eq < 2) return false;
+  std::string_view k = line.substr(1, eq - 1);
+  // '#' would make a comment of the line, '[' a section.
+  if (IsBlank(k.front()) || IsBlank(k.back()) || k.front() == '#' ||
+      k.front() == '[') {
+    return false;
+  }
+  std::string_view v = line.substr(eq + 1);
+  if (v.size() < 2 || v.front() != '"' || v.back() != '"') return false;
+  *key = k;
+  *value = v.substr(1, v.size() - 2);
+  return true;
+}
+
 bool WriteAll(int fd, const std::string& text) {
   size_t done = 0;
   while (done < text.size()) {
@@ -126,20 +148,81 @@ bool SectionValueHoldable(const char* s) {
   return strpbrk(s, "\r\n") == nullptr;
 }
 
-int SectionDoc::Load(const char* file) {
+void SectionDoc::Clear() {
   sections_.clear();
-  index_.clear();
-  std::string text;
-  if (!ReadAll(file, &text)) return -1;
-  if (text.find('\0') != std::string::npos) {
+  slots_.clear();
+}
+
+// The slot of `name`, or the free slot where it would go.
+size_t SectionDoc::Slot(std::string_view name) const {
+  const size_t mask = slots_.size() - 1;
+  for (size_t i = std::hash<std::string_view>()(name) & mask;;
+       i = (i + 1) & mask) {
+    if (slots_[i] == 0 || sections_[slots_[i] - 1].name == name) return i;
+  }
+}
+
+// The place of section `name`, made at the end when new; and whether it is.
+std::pair<size_t, bool> SectionDoc::Intern(std::string_view name) {
+  // At most half full, so that probes stay short.
+  if (2 * (sections_.size() + 1) > slots_.size()) {
+    slots_.assign(std::max<size_t>(64, 2 * slots_.size()), 0);
+    for (size_t i = 0; i < sections_.size(); ++i) {
+      slots_[Slot(sections_[i].name)] = static_cast<uint32_t>(i + 1);
+    }
+  }
+  size_t slot = Slot(name);
+  if (slots_[slot] != 0) return {slots_[slot] - 1, false};
+  sections_.emplace_back();
+  sections_.back().name.assign(name);
+  slots_[slot] = static_cast<uint32_t>(sections_.size());
+  return {sections_.size() - 1, true};
+}
+
+int SectionDoc::Load(const char* file) {
+  Clear();
+  text_.clear();
+  if (!ReadAll(file, &text_)) {
+    text_.clear();
+    return -1;
+  }
+  if (text_.find('\0') != std::string::npos) {
+    text_.clear();
     KLIBCErrSet(KERR_FILE_FORMAT);
     return -1;
   }
+  if (IndexWritersForm(nullptr)) return 0;
+  // What a person typed: parsed whole, and written back in the writers'
+  // form.
+  std::string text;
+  text.swap(text_);
+  return Parse(text, nullptr);
+}
+
+int SectionDoc::LoadOne(const char* file, const std::string& name) {
+  Clear();
+  text_.clear();
+  if (!ReadAll(file, &text_)) {
+    text_.clear();
+    return -1;
+  }
+  if (text_.find('\0') != std::string::npos) {
+    text_.clear();
+    KLIBCErrSet(KERR_FILE_FORMAT);
+    return -1;
+  }
+  if (IndexWritersForm(&name)) return 0;
+  std::string text;
+  text.swap(text_);
+  return Parse(text, &name);
+}
+
+// Parses `text` whole, keeping only section `*only` when `only` is given.
+int SectionDoc::Parse(const std::string& text, const std::string* only) {
+  Clear();
   const std::string_view all(text);
-  // Most sections take a few lines of some 20 bytes: reserving for that
-  // spares the index its rehashes.
-  index_.reserve(text.size() / 128);
-  sections_.reserve(text.size() / 128);
+  // Most sections take a few lines of some 20 bytes.
+  if (only == nullptr) sections_.reserve(text.size() / 64);
   std::vector<std::unique_ptr<KeyIndex>> keys;  // per section, when large
   long current = -1;
   for (size_t pos = 0; pos < all.size();) {
@@ -148,9 +231,8 @@ int SectionDoc::Load(const char* file) {
     std::string_view line = Trim(all.substr(pos, end - pos));
     pos = end + 1;
     if (line.empty() || line[0] == '#') continue;
-    if (!ParseLine(line, &keys, &current)) {
-      sections_.clear();
-      index_.clear();
+    if (!ParseLine(line, only, &keys, &current)) {
+      Clear();
       KLIBCErrSet(KERR_FILE_FORMAT);
       return -1;
     }
@@ -158,27 +240,91 @@ int SectionDoc::Load(const char* file) {
   return 0;
 }
 
+// Indexes text_ (its section `*only` alone, when given) when it is in the
+// writers' form: "[name]" and "\tkey=\"value\"" lines only, every line
+// ended, each section kept once and each of its keys once. False (the index
+// half made) for any other text.
+bool SectionDoc::IndexWritersForm(const std::string* only) {
+  const std::string_view all(text_);
+  if (!all.empty() && all.back() != '\n') return false;
+  if (only == nullptr) {
+    // Sections of a few lines of some 20 bytes; the slots twice as many.
+    sections_.reserve(all.size() / 64);
+    size_t slots = 64;
+    while (slots < all.size() / 16) slots *= 2;
+    slots_.assign(slots, 0);
+  }
+  std::vector<std::string_view> keys;  // the kept section's
+  bool in_section = false, kept = false;
+  for (size_t pos = 0; pos < all.size();) {
+    size_t end = all.find('\n', pos);
+    std::string_view line = all.substr(pos, end - pos);
+    pos = end + 1;
+    if (line.size() >= 3 && line.front() == '[' && line.back() == ']') {
+      std::string_view name = line.substr(1, line.size() - 2);
+      if (IsBlank(name.front()) || IsBlank(name.back())) return false;
+      in_section = true;
+      kept = only == nullptr || name == *only;
+      if (!kept) continue;
+      if (!Intern(name).second) return false;
+      Section& s = sections_.back();
+      s.parsed = false;
+      s.begin = s.end = pos;
+      keys.clear();
+      continue;
+    }
+    std::string_view key, value;
+    if (!in_section || !WritersPair(line, &key, &value)) return false;
+    if (!kept) continue;
+    // Beyond kScanLimit keys the parse's key index does better.
+    if (keys.size() >= kScanLimit) return false;
+    for (std::string_view k : keys) {
+      if (k == key) return false;
+    }
+    keys.push_back(key);
+    sections_.back().end = pos;
+  }
+  return true;
+}
+
+// The pairs of section `i`, parsed from text_ the first time.
+SectionPairs* SectionDoc::Pairs(size_t i) const {
+  Section& s = sections_[i];
+  if (!s.parsed) {
+    const std::string_view all(text_);
+    for (size_t pos = s.begin; pos < s.end;) {
+      size_t end = all.find('\n', pos);
+      std::string_view key, value;
+      WritersPair(all.substr(pos, end - pos), &key, &value);
+      s.pairs.emplace_back(std::string(key), std::string(value));
+      pos = end + 1;
+    }
+    s.parsed = true;
+  }
+  return &s.pairs;
+}
+
 // One trimmed, non-blank, non-comment line; `current` is the section that
-// pairs go to (-1 before the first one).
-bool SectionDoc::ParseLine(std::string_view line,
+// pairs go to (-1 before the first one, -2 in a section not kept).
+bool SectionDoc::ParseLine(std::string_view line, const std::string* only,
                            std::vector<std::unique_ptr<KeyIndex>>* keys,
                            long* current) {
   if (line[0] == '[') {
     if (line.back() != ']') return false;
     std::string_view name = Trim(line.substr(1, line.size() - 2));
     if (name.empty()) return false;
-    // A section named twice is read as one.
-    auto it = index_.emplace(std::string(name), sections_.size());
-    if (it.second) {
-      sections_.push_back(Section{it.first->first, {}});
-      sections_.back().pairs.reserve(8);
-      keys->emplace_back();
+    if (only != nullptr && name != *only) {
+      *current = -2;
+      return true;
     }
-    *current = static_cast<long>(it.first->second);
+    // A section named twice is read as one.
+    std::pair<size_t, bool> at = Intern(name);
+    if (at.second) keys->emplace_back();
+    *current = static_cast<long>(at.first);
     return true;
   }
   size_t eq = line.find('=');
-  if (*current < 0 || eq == std::string_view::npos) return false;
+  if (*current == -1 || eq == std::string_view::npos) return false;
   std::string_view key = Trim(line.substr(0, eq));
   std::string_view value = Trim(line.substr(eq + 1));
   if (key.empty()) return false;
@@ -186,6 +332,7 @@ bool SectionDoc::ParseLine(std::string_view line,
     if (value.size() < 2 || value.back() != '"') return false;
     value = value.substr(1, value.size() - 2);
   }
+  if (*current == -2) return true;
   const size_t sec = static_cast<size_t>(*current);
   LoadPair(&sections_[sec].pairs, &(*keys)[sec], key, value);
   return true;
@@ -226,19 +373,18 @@ int SectionDoc::Store(const char* file) const {
 }
 
 const SectionPairs* SectionDoc::Find(const std::string& name) const {
-  auto it = index_.find(name);
-  return it == index_.end() ? nullptr : &sections_[it->second].pairs;
+  if (slots_.empty()) return nullptr;
+  uint32_t at = slots_[Slot(name)];
+  return at == 0 ? nullptr : Pairs(at - 1);
 }
 
 SectionPairs* SectionDoc::Find(const std::string& name) {
-  auto it = index_.find(name);
-  return it == index_.end() ? nullptr : &sections_[it->second].pairs;
+  return const_cast<SectionPairs*>(
+      static_cast<const SectionDoc*>(this)->Find(name));
 }
 
 SectionPairs* SectionDoc::Add(const std::string& name) {
-  auto it = index_.emplace(name, sections_.size());
-  if (it.second) sections_.push_back(Section{name, {}});
-  return &sections_[it.first->second].pairs;
+  return Pairs(Intern(name).first);
 }
 
 const std::string* SectionDoc::Value(const std::string& name,
@@ -280,13 +426,14 @@ void SectionDoc::Set(SectionPairs* pairs, const std::string& key,
 std::string SectionDoc::Render() const {
   size_t size = 0;
   for (const auto& s : sections_) {
-    size += s.name.size() + 3;
+    size += s.name.size() + 3 + (s.parsed ? 0 : s.end - s.begin);
     for (const auto& p : s.pairs) size += p.first.size() + p.second.size() + 5;
   }
   std::string text;
   text.reserve(size);
   for (const auto& s : sections_) {
     text.append("[").append(s.name).append("]\n");
+    if (!s.parsed) text.append(text_, s.begin, s.end - s.begin);
     for (const auto& p : s.pairs) {
       text.append("\t").append(p.first).append("=\"");
       text.append(p.second).append("\"\n");

@@ -4,12 +4,20 @@
 // instead of a section call (a whole parse) per key. Not part of the C API.
 //
 // Loading is linear in the file's size: sections are indexed by name, and
-// keys by section and name, while the file is read. The grammar, the refused
-// names and values, and the atomic replace are those of karo_section.h.
+// keys by section and name, while the file is read. A file in the very form
+// the writers produce is only indexed by section: a section's pairs are read
+// when it is first looked at, and a section never looked at is written back
+// as it was read, so that a command touching one section of thousands pays
+// for a scan and a copy of the rest, not for parsing it. The grammar, the
+// refused names and values, and the atomic replace are those of
+// karo_section.h.
+//
+// Not thread-safe, not even for lookups, which may parse a section.
 #ifndef KARO_SECTION_DOC_H_
 #define KARO_SECTION_DOC_H_
 
 #include <stddef.h>
+#include <stdint.h>
 
 #include <memory>
 #include <string>
@@ -30,6 +38,9 @@ class SectionDoc {
   // error set: KERR_FILE_NOT_FOUND (the content is then empty),
   // KERR_SYSTEM, KERR_FILE_FORMAT.
   int Load(const char* file);
+  // The same for a reader of one section: the content is section `name` of
+  // `file` alone (or nothing); the rest of the file is checked, not kept.
+  int LoadOne(const char* file, const std::string& name);
 
   // Writes the content to `file` through a temporary file that is fsynced
   // and renamed over it (an existing file keeps its mode, a new one gets
@@ -67,15 +78,28 @@ class SectionDoc {
 
  private:
   using KeyIndex = std::unordered_map<std::string, size_t>;
-  bool ParseLine(std::string_view line,
+  bool IndexWritersForm(const std::string* only);
+  int Parse(const std::string& text, const std::string* only);
+  bool ParseLine(std::string_view line, const std::string* only,
                  std::vector<std::unique_ptr<KeyIndex>>* keys, long* current);
+  SectionPairs* Pairs(size_t i) const;
+  size_t Slot(std::string_view name) const;
+  std::pair<size_t, bool> Intern(std::string_view name);
+  void Clear();
 
   struct Section {
     std::string name;
     SectionPairs pairs;
+    // While not parsed, the pairs are the lines text_[begin, end).
+    bool parsed = true;
+    size_t begin = 0, end = 0;
   };
-  std::vector<Section> sections_;
-  std::unordered_map<std::string, size_t> index_;
+  // Lookups parse sections on the way.
+  mutable std::vector<Section> sections_;
+  // The sections by name, open addressing: 0 for a free slot, else the
+  // section's place + 1. No allocation per section.
+  std::vector<uint32_t> slots_;
+  std::string text_;  // the file as read, while a section is not parsed
 };
 
 // Whether the format can hold a section name, a key, a value: see the

@@ -1,7 +1,8 @@
-// The C section calls: each reads the whole file into a SectionDoc, changes
-// it there, and writes it back through a temporary file that is renamed over
-// the old one. Comments and the spacing a person typed are not preserved by a
-// rewrite; the content is.
+// The C section calls: each reads the whole file into a SectionDoc (a
+// reader of one section keeps only that one), changes it there, and writes
+// it back through a temporary file that is renamed over the old one. Comments
+// and the spacing a person typed are not preserved by a rewrite; the content
+// is.
 #include <string.h>
 #include <unistd.h>
 
@@ -60,7 +61,7 @@ extern "C" int KLIBCFileGetSection(const char* file, const char* section,
     return -1;
   }
   SectionDoc doc;
-  if (doc.Load(file) != 0) return -1;
+  if (doc.LoadOne(file, section) != 0) return -1;
   const SectionPairs* pairs = doc.Find(section);
   if (pairs == nullptr) return 0;
   for (const auto& p : *pairs) {
@@ -79,7 +80,7 @@ extern "C" int KLIBCFileGetSectionValue(const char* file, const char* section,
     return -1;
   }
   SectionDoc doc;
-  if (doc.Load(file) != 0) return -1;
+  if (doc.LoadOne(file, section) != 0) return -1;
   return doc.CopyValue(section, key, buf, size);
 }
 

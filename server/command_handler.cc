@@ -223,6 +223,19 @@ int SyncStart(const CommandFile& cmd, const HandlerContext& ctx) {
   }
   int status = kOk;
   if (!ServiceEnabled(&status)) return status;
+  // A server bound to one client syncs that client only; a server of the
+  // single-client protocol syncs nobody until a client has paired.
+  int single = S2SServerIfOldClientPaired();
+  if (single < 0) return kRegistryFailure;
+  if (single == 1) {
+    Hash pair = ReadSection(kPairSection);
+    if (!pair) return kRegistryFailure;
+    if (ValueOr(pair.get(), "clientID") != cmd.client_id) {
+      return kPairedElsewhere;
+    }
+  } else if (ctx.old_server) {
+    return kNotPaired;
+  }
   if (!ShareExists(*share)) return kUnknownShare;
   std::string conflicts;
   int rc = Conflicts({*share}, cmd.client_id, &conflicts);

@@ -24,6 +24,7 @@ enum Status : int {
   kServiceDisabled = 244,    // the service is switched off
   kPairedElsewhere = 245,    // bound to another single client
   kNotSyncing = 246,         // finish of a sync this client does not hold
+  kNotPaired = 247,          // an old server not paired with this client
 };
 
 // Largest command file the handler reads (early input is at most 5120

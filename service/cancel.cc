@@ -31,7 +31,7 @@ bool CancelRequested() { return t_flag != nullptr && t_flag->IsSet(); }
 bool CancelChecker() {
   if (CancelRequested()) return true;
   Beacon& b = t_beacon;
-  if (b.hook && !b.inside && Now() - b.last >= b.interval) {
+  if (!b.inside && BeaconDue()) {
     b.inside = true;
     b.hook();
     BeaconSent();
@@ -44,6 +44,11 @@ void SetBeaconHook(std::function<void()> hook, unsigned int interval_s) {
   t_beacon.hook = std::move(hook);
   t_beacon.interval = interval_s;
   BeaconSent();
+}
+
+bool BeaconDue() {
+  const Beacon& b = t_beacon;
+  return b.hook && Now() - b.last >= b.interval;
 }
 
 void BeaconSent() { t_beacon.last = Now(); }

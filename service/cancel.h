@@ -47,6 +47,9 @@ bool CancelChecker();
 // Installs `hook` (empty to remove) for the calling thread, to run at most
 // every `interval_s` seconds from CancelChecker; the clock starts now.
 void SetBeaconHook(std::function<void()> hook, unsigned int interval_s);
+// Whether the calling thread has a beacon hook whose interval has passed
+// since its last beacon: for a beacon between rsync runs.
+bool BeaconDue();
 // Restarts the calling thread's beacon clock (after a beacon sent outside
 // the poll).
 void BeaconSent();

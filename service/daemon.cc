@@ -282,6 +282,7 @@ void Daemon::Reload(std::vector<std::string>& errors) {
   for (auto it = tasks_.begin(); it != tasks_.end();) {
     if (loaded.count(it->first) == 0) {
       scheduler_.Remove(it->first);
+      sessions_.Drop(it->first);
       it = tasks_.erase(it);
     } else {
       ++it;
@@ -412,6 +413,7 @@ void Daemon::Start(unsigned long long id, const std::string& trigger) {
   run->trigger = trigger;
   run->started = clock_.WallSeconds();
   run->beacon_interval = config_.beacon_interval;
+  run->sessions = &sessions_;
   runs_[id] = run;
   StartRun(run, [this](unsigned long long ended) {
     {

@@ -34,6 +34,7 @@
 #include "service/history.h"
 #include "service/run_worker.h"
 #include "service/scheduler.h"
+#include "service/session.h"
 #include "service/task_store.h"
 
 namespace s2s_service {
@@ -113,6 +114,7 @@ class Daemon {
   Scheduler scheduler_;
   std::map<unsigned long long, Task> tasks_;
   std::deque<unsigned long long> queue_;  // waiting for a slot or a share
+  SessionCache sessions_;  // each task's probe and pairing, for its next run
   std::map<unsigned long long, std::shared_ptr<ActiveRun>> runs_;
   bool stopping_ = false;
   ControlServer control_;

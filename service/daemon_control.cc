@@ -219,6 +219,7 @@ PObject Daemon::DoUpdate(const PObject& request) {
   }
   if (!CheckTask(stored, error)) return MakeReply(kResultInvalidTask, error);
   if (!Store(stored, error)) return MakeReply(kResultInternal, error);
+  sessions_.Drop(id);
   reply = Ok(Named(id, name) + " updated");
   reply["task"] = TaskMap(id, tasks_[id]);
   return reply;
@@ -239,6 +240,7 @@ PObject Daemon::DoDelete(const PObject& request) {
   queue_.erase(std::remove(queue_.begin(), queue_.end(), id), queue_.end());
   tasks_.erase(id);
   scheduler_.Remove(id);
+  sessions_.Drop(id);
   history_.Remove(id);
   return Ok(Named(id, name) + " deleted");
 }

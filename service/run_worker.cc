@@ -61,6 +61,10 @@ void StartRun(std::shared_ptr<ActiveRun> run,
         }
       }
       if (locked) {
+        Session session;
+        if (run->sessions != nullptr) {
+          session = run->sessions->Get(run->task.task, SessionClock());
+        }
         run->outcome = RunTask(
             run->task.task, run->task.excludes, run->beacon_interval,
             [&run](const std::string& line) { run->Note(line); },
@@ -70,7 +74,10 @@ void StartRun(std::shared_ptr<ActiveRun> run,
               run->share_ = share;
               run->step_ = "transfer";
               run->transfer_ = p;
-            });
+            },
+            &session);
+        if (run->sessions != nullptr)
+          run->sessions->Put(run->task.task, session);
       }
     }
     BindCancelFlag(nullptr);

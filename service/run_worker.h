@@ -12,6 +12,7 @@
 #include <thread>
 
 #include "service/cancel.h"
+#include "service/session.h"
 #include "service/task_map.h"
 #include "service/task_runner.h"
 
@@ -23,6 +24,8 @@ struct ActiveRun {
   std::string trigger;
   long started = 0;  // wall clock
   unsigned int beacon_interval = 30;
+  // Where the task's session is kept between runs; null: none is kept.
+  SessionCache* sessions = nullptr;
   CancelFlag cancel;
   TaskOutcome outcome;  // written by the run's thread before it reports
 

@@ -16,6 +16,28 @@ namespace {
 const int kConflictStatus = 214;
 const int kServiceDisabled = 244;
 const int kPairedElsewhere = 245;
+const int kNotSyncing = 246;
+const int kNotPaired = 247;
+
+// Answers that a session from an earlier run may have caused: the service
+// switched off, the server bound to another client or to none, the share's
+// running sync gone; or the address the probe found refusing or not
+// answering.
+bool Stale(int status) {
+  switch (status) {
+    case 5:
+    case 10:
+    case 30:
+    case 35:
+    case kServiceDisabled:
+    case kPairedElsewhere:
+    case kNotSyncing:
+    case kNotPaired:
+      return true;
+    default:
+      return false;
+  }
+}
 
 double Now() {
   timespec ts;
@@ -39,18 +61,23 @@ std::string Format(const char* format, double value) {
 class Run {
  public:
   Run(const S2S::SyncTask& task, const std::list<std::string>& excludes,
-      const Reporter& report, const ProgressReporter& progress)
+      const Reporter& report, const ProgressReporter& progress,
+      Session* session)
       : task_(task),
         excludes_(excludes),
         report_(report),
-        progress_(progress) {}
+        progress_(progress),
+        session_(session != nullptr ? session : &own_session_) {}
 
   void Go(unsigned int beacon_interval);
   TaskOutcome& outcome() { return out_; }
 
  private:
+  bool Connect();
+  bool ProbeAndPair();
   bool Probe();
   bool Pair();
+  bool Renew(const ShareOutcome& share);
   void Beacon(const char* when);
   void SyncShare(const std::string& share);
   bool ShareStep(ShareOutcome& share, const char* step, int rc, int status);
@@ -61,7 +88,11 @@ class Run {
   const std::list<std::string>& excludes_;
   const Reporter& report_;
   const ProgressReporter& progress_;
+  Session own_session_;
+  Session* session_;
   S2S::Rsyncer rsyncer_;
+  bool reused_ = false;  // the session came from an earlier run, unproven
+  bool lost_ = false;    // probing or pairing again failed
   TaskOutcome out_;
 };
 
@@ -74,6 +105,45 @@ bool Run::Stop(int code, const std::string& error) {
     out_.error = error;
   }
   report_("error: " + out_.error);
+  return false;
+}
+
+bool Run::Connect() {
+  if (!session_->valid) return ProbeAndPair();
+  rsyncer_.Resume(session_->probed, session_->server_version);
+  reused_ = true;
+  out_.server_ip = session_->probed.GetServerIP();
+  out_.server_version = session_->server_version;
+  report_("session: " + out_.server_ip + ", protocol version " +
+          std::to_string(out_.server_version) + ", probed and paired " +
+          Format("%.0f s ago", SessionClock() - session_->made));
+  return true;
+}
+
+bool Run::ProbeAndPair() {
+  // A version held would survive a probe whose every address fails.
+  rsyncer_.Resume(S2S::SyncInfo(), -1);
+  session_->valid = false;
+  if (!Probe() || !Pair()) return false;
+  session_->valid = true;
+  session_->probed = rsyncer_.GetSyncInfo();
+  session_->server_version = rsyncer_.GetServerVersionValue();
+  session_->made = SessionClock();
+  return true;
+}
+
+// A share that failed on a session from an earlier run, with an answer that
+// session may have caused, gets a new probe and pairing at once; once per
+// run. True when the share's steps may be made again.
+bool Run::Renew(const ShareOutcome& share) {
+  if (share.ok || !Stale(share.status)) return false;
+  // Whatever comes of it, the next run starts afresh.
+  session_->valid = false;
+  if (!reused_ || CancelRequested()) return false;
+  reused_ = false;
+  report_("session: probing and pairing again after " + share.cause);
+  if (ProbeAndPair()) return true;
+  lost_ = true;
   return false;
 }
 
@@ -184,6 +254,7 @@ void Run::FinishTask() {
   int status = 0;
   const std::string& name = task_.GetInfo().GetName();
   int rc = rsyncer_.FinishSync("task", name, status);
+  if (rc == 0 && Stale(status)) session_->valid = false;
   if (rc == 0 && status == 0) {
     report_("task " + name + ": finished");
   } else {
@@ -199,29 +270,36 @@ void Run::FinishTask() {
 void Run::Go(unsigned int beacon_interval) {
   double t0 = Now();
   rsyncer_.SetCancelChecker(CancelChecker);
-  if (Probe() && Pair()) {
+  if (Connect()) {
     SetBeaconHook([this] { Beacon("transfer running"); }, beacon_interval);
-    Beacon("task started");
     const std::list<std::string>& shares = task_.GetInfo().GetShareList();
-    size_t done = 0;
     for (const std::string& share : shares) {
       if (CancelRequested()) break;
-      if (done++ > 0) Beacon("next share");
+      // Between shares as during a transfer: once the interval has passed.
+      if (BeaconDue()) Beacon("next share");
       SyncShare(share);
+      if (Renew(out_.shares.back())) {
+        out_.shares.pop_back();
+        SyncShare(share);
+      }
+      if (lost_) break;
     }
     SetBeaconHook(nullptr, 0);
     size_t failed = 0;
     for (const ShareOutcome& s : out_.shares) failed += s.ok ? 0 : 1;
-    if (CancelRequested()) {
-      out_.exit_code = kExitCancelled;
-      out_.error = "cancelled";
-      report_("error: cancelled");
-    } else if (failed > 0) {
-      out_.exit_code = kExitShare;
-      out_.error = std::to_string(failed) + " of " +
-                   std::to_string(shares.size()) + " shares failed";
+    // A run whose second probe or pairing failed has stopped already.
+    if (!lost_) {
+      if (CancelRequested()) {
+        out_.exit_code = kExitCancelled;
+        out_.error = "cancelled";
+        report_("error: cancelled");
+      } else if (failed > 0) {
+        out_.exit_code = kExitShare;
+        out_.error = std::to_string(failed) + " of " +
+                     std::to_string(shares.size()) + " shares failed";
+      }
+      FinishTask();
     }
-    FinishTask();
   }
   out_.seconds = Now() - t0;
 }
@@ -286,6 +364,9 @@ std::string StatusText(int status) {
     case 246:
       text = "the server holds no sync of this client";
       break;
+    case 247:
+      text = "the server is not paired with this client";
+      break;
     case 250:
       text = "rsync could not be started";
       break;
@@ -319,8 +400,8 @@ std::string FailureText(int status) {
 TaskOutcome RunTask(const S2S::SyncTask& task,
                     const std::list<std::string>& excludes,
                     unsigned int beacon_interval, const Reporter& report,
-                    const ProgressReporter& progress) {
-  Run run(task, excludes, report, progress);
+                    const ProgressReporter& progress, Session* session) {
+  Run run(task, excludes, report, progress, session);
   run.Go(beacon_interval);
   return run.outcome();
 }

@@ -4,9 +4,17 @@
 // each share announces the sync, pushes the data, carries an encrypted
 // share's key file and reports the share's end; beacons keep the task alive
 // on the server between shares and, during long transfers, from the cancel
-// checker's poll; the task's end is reported last. Each step is reported as
-// one line through the caller's reporter. A share that fails does not stop
-// the others; a failed probe or pairing, or a cancel, stops the task.
+// checker's poll, once their interval has passed; the task's end is
+// reported last. Each step is reported as one line through the caller's
+// reporter. A share that fails does not stop the others; a failed probe or
+// pairing, or a cancel, stops the task.
+//
+// A caller that runs the task again (the service) may hand in the session
+// of its last run (service/session.h): the probe and the pairing are then
+// skipped. When a share's step is answered in a way that session may have
+// caused (the service off, the server paired with another client or with
+// none, the share's sync gone, the address refusing or silent), the run
+// probes and pairs again at once and makes the share's steps again, once.
 //
 // RunTask runs on the calling thread with its own Rsyncer; a cancel comes
 // through the flag bound to that thread (service/cancel.h), and its beacons
@@ -22,6 +30,7 @@
 
 #include "S2S/sync_obj_task.h"
 #include "karo/rsync_wrapper.h"
+#include "service/session.h"
 
 namespace s2s_service {
 
@@ -55,13 +64,16 @@ using ProgressReporter = std::function<void(
     const std::string& share,
     const KARO::Backup::RsyncWrapper::TransferProgress& progress)>;
 
-// Runs `task`. `beacon_interval` is the least time between beacons sent from
-// the cancel checker during a transfer. REQUIRES: the task was checked
-// (CheckTaskSpec).
+// Runs `task`. `beacon_interval` is the least time between beacons (the
+// first once that much time has passed since the shares began). `session`,
+// when given, is the task's last session on entry (an invalid one: probe
+// and pair) and this run's on return (invalid when the next run has to
+// probe again). REQUIRES: the task was checked (CheckTaskSpec).
 TaskOutcome RunTask(const S2S::SyncTask& task,
                     const std::list<std::string>& excludes,
                     unsigned int beacon_interval, const Reporter& report,
-                    const ProgressReporter& progress = nullptr);
+                    const ProgressReporter& progress = nullptr,
+                    Session* session = nullptr);
 
 // What a status from the rsync wrapper or the server means, for people.
 std::string StatusText(int status);

@@ -154,6 +154,36 @@ TEST_F(SectionFileTest, ReadsWhatAPersonTypes) {
   }
 }
 
+// A file in the writers' own form is written back as it was but for the
+// section changed; anything that reads otherwise than it looks is rewritten
+// whole in that form.
+TEST_F(SectionFileTest, RewriteKeepsTheWritersFormAndNormalisesTheRest) {
+  const struct {
+    const char* in;
+    const char* out;
+  } cases[] = {
+      {"[A]\n\tk=\"1\"\n[B]\n\tk=\"2\"\n[C]\n\tx=\"y = \"z\"\"\n",
+       "[A]\n\tk=\"1\"\n[B]\n\tk=\"3\"\n[C]\n\tx=\"y = \"z\"\"\n"},
+      {"[A]\n\t#k=\"1\"\n[B]\n\tk=\"2\"\n", "[A]\n[B]\n\tk=\"3\"\n"},
+      {"[A]\n\tk=\"1\"\n\tk=\"9\"\n[B]\n", "[A]\n\tk=\"9\"\n[B]\n\tk=\"3\"\n"},
+      {"[A]\n\tk=\"1\"\n[B]\n\tk=\"2\"", "[A]\n\tk=\"1\"\n[B]\n\tk=\"3\"\n"},
+      {"[A]\n\tk=\"1\"\n[B]\n[A]\n\tj=\"3\"\n",
+       "[A]\n\tk=\"1\"\n\tj=\"3\"\n[B]\n\tk=\"3\"\n"},
+      {"[A]\n\tk =\"1\"\n[B]\n", "[A]\n\tk=\"1\"\n[B]\n\tk=\"3\"\n"},
+  };
+  auto mod = MakeHash({{"k", "3"}});
+  for (const auto& c : cases) {
+    ASSERT_TRUE(WriteFile(file_, c.in));
+    EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "B", 0, mod.get(), 0, 0),
+              1)
+        << c.in;
+    EXPECT_EQ(ReadFile(file_), c.out) << c.in;
+  }
+  EXPECT_EQ(Value(file_, "A", "k"), "1");
+  ASSERT_TRUE(WriteFile(file_, cases[0].in));
+  EXPECT_EQ(Value(file_, "C", "x"), "y = \"z\"");
+}
+
 TEST_F(SectionFileTest, RefusesWhatTheFormatCannotHold) {
   auto good = MakeHash({{"k", "v"}});
   ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "A", good.get(), nullptr), 1);

@@ -19,6 +19,7 @@
 #include <vector>
 
 #include "S2S/ipc.h"
+#include "S2S/is_syncedshare.h"
 #include "S2S/sync_obj_pobject.h"
 #include "appliances.h"
 #include "gtest/gtest.h"
@@ -348,6 +349,36 @@ class ServiceTest : public ::testing::Test {
     return out;
   }
 
+  // Runs the task now and waits for that run's end; its outcome.
+  std::string RunOnce(unsigned long long id) {
+    size_t before = Runs(id).size();
+    EXPECT_EQ(0u, Request(Action("run", id))["result"].asUInt64());
+    std::string outcome;
+    WaitFor(
+        [&] {
+          PObject::Array runs = Runs(id);
+          outcome = runs.size() > before ? runs[0]["outcome"].asString() : "";
+          return outcome != "" && outcome != "running";
+        },
+        30);
+    return outcome;
+  }
+
+  // What the server's daemon has served, from the connections it logs as
+  // let into a module: {commands (the command module, whose hooks run the
+  // handler), data transfers (any other module)}.
+  std::pair<int, int> Served() {
+    std::string log = app_.DaemonLog();
+    std::pair<int, int> n;
+    const std::string let_in = "access on module ";
+    for (size_t at = log.find(let_in); at != std::string::npos;
+         at = log.find(let_in, at + 1)) {
+      ++(log.compare(at + let_in.size(), 7, "s2scmd ") == 0 ? n.first
+                                                            : n.second);
+    }
+    return n;
+  }
+
   // How many transfers of share big have started.
   size_t BigTransfersStarted() {
     std::string log = ReadFile(rsync_log_);
@@ -513,6 +544,42 @@ TEST_F(ServiceTest, SharedShareNeverAtOnceAndNoMoreThanMaxParallelRuns) {
     most = std::max(most, at_once);
   }
   EXPECT_EQ(2u, most) << "runs at once";
+}
+
+// The second run reuses the first one's probe and pairing: per share its
+// start, transfer and end, then the task's end; no beacon before its time.
+TEST_F(ServiceTest, SteadyRunsSendOnlyTheCommandsTheirSharesNeed) {
+  StartDaemon(0);
+  unsigned long long id = Add("steady", {"docs", "photos"}, S2S::Schedule());
+  const std::pair<int, int> expected[] = {{3 + 2 * 2 + 1, 2}, {2 * 2 + 1, 2}};
+  for (const auto& want : expected) {
+    std::pair<int, int> before = Served();
+    ASSERT_EQ("ok", RunOnce(id)) << ReadFile(tmp_.Sub("s2sd.log"));
+    std::pair<int, int> after = Served();
+    EXPECT_EQ(want.first, after.first - before.first) << app_.DaemonLog();
+    EXPECT_EQ(want.second, after.second - before.second);
+  }
+}
+
+// A server of the single-client protocol that forgot its client between
+// runs refuses the reused session's sync start; the run pairs again and
+// goes on.
+TEST_F(ServiceTest, AClientItsServerForgotPairsAgainWithinTheRun) {
+  ASSERT_TRUE(app_.StartServer(/*old_server=*/true)) << app_.DaemonLog();
+  StartDaemon(0);
+  unsigned long long id = Add("forgotten", {"docs"}, S2S::Schedule());
+  ASSERT_EQ("ok", RunOnce(id)) << ReadFile(tmp_.Sub("s2sd.log"));
+  {
+    s2s_test::ScopedEnv root("S2S_ROOT", app_.server_root());
+    ASSERT_EQ(0, s2s_svr_reset_pair());
+  }
+  ASSERT_NE("CLIENT-A", app_.ServerRegistry("PairedClientInfo", "clientID"));
+  WriteFile(app_.ClientShare("docs") + "/after.txt", "again\n");
+  ASSERT_EQ("ok", RunOnce(id)) << ReadFile(tmp_.Sub("s2sd.log"));
+  EXPECT_TRUE(s2s_test::Has(ReadFile(tmp_.Sub("s2sd.log")),
+                            "not paired with this client [247]"));
+  EXPECT_EQ("CLIENT-A", app_.ServerRegistry("PairedClientInfo", "clientID"));
+  EXPECT_EQ("again\n", ReadFile(app_.ServerShare("docs") + "/after.txt"));
 }
 
 }  // namespace

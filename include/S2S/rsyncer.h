@@ -49,14 +49,14 @@ class S2S_EXPORT Rsyncer {
     const std::string& GetUser() const { return user_; }
     const std::string& GetServerIP() const { return serverIP_; }
 
-    void SetSSH(bool on);                     // setSsh
-    void SetServerPort(unsigned int port);    // setPort
-    void SetCompression(bool on);             // setCompress
-    void SetBlockLevelSync(bool on);          // setDeltaCopy
-    void SetListOnly(bool on);                // setListOnly
-    void SetRelativePath(bool on);            // setRelativePath
-    void SetSyncACL(bool on);                 // setKaroAcl
-    void SetTestTask(bool on);                // setDebugLog(!on)
+    void SetSSH(bool on);                   // setSsh
+    void SetServerPort(unsigned int port);  // setPort
+    void SetCompression(bool on);           // setCompress
+    void SetBlockLevelSync(bool on);        // setDeltaCopy
+    void SetListOnly(bool on);              // setListOnly
+    void SetRelativePath(bool on);          // setRelativePath
+    void SetSyncACL(bool on);               // setKaroAcl
+    void SetTestTask(bool on);              // setDebugLog(!on)
 
     // Sends `commands` (a command file's lines) to the server's daemon with a
     // 60 s time-out. Returns the wrapper's status unchanged. A null `cancel`
@@ -116,6 +116,13 @@ class S2S_EXPORT Rsyncer {
   // status (213 when no address was tried).
   int Initialize(const SyncInfo& info);
   int TestServer();
+  // Takes over what an earlier probe found, without running anything:
+  // `probed` is that probe's GetSyncInfo() (its server IP the address that
+  // answered) and `serverVersion` its GetServerVersionValue(). For a caller
+  // that keeps a probe for later runs. Resume(SyncInfo(), -1) forgets the
+  // version held, which would otherwise survive a probe whose every address
+  // fails.
+  void Resume(const SyncInfo& probed, int serverVersion);
   // A dry-run single pairing. 0 when it ran (`status` 0: reachable; 207 is
   // reported as 0), -1 when the request could not be built.
   int TestProtocol(int& status) const;
@@ -159,10 +166,9 @@ class S2S_EXPORT Rsyncer {
 
  private:
   // Appends the two fixed lines and `params` as key="value" lines.
-  int WriteCommand(
-      const std::string& command,
-      const std::list<std::pair<std::string, std::string>>& params,
-      std::list<std::string>& out) const;
+  int WriteCommand(const std::string& command,
+                   const std::list<std::pair<std::string, std::string>>& params,
+                   std::list<std::string>& out) const;
 
   int serverVersion_;
   bool (*cancel_)();

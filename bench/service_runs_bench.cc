@@ -1,0 +1,113 @@
+// Runs of a task as the client service makes them when nothing has changed:
+// 1, 10 and 50 shares of ten small files each through the task runner, each
+// run reusing the session (probe and pairing) of the run before, as s2sd
+// does for ten minutes. Beside the time, per run: the commands and the data
+// transfers the server's daemon served (counted in its log), and their sum,
+// the rsync invocations.
+#include <benchmark/benchmark.h>
+
+#include <fstream>
+#include <string>
+
+#include "appliances.h"
+#include "karo/rsync_wrapper.h"
+#include "service/task_runner.h"
+
+namespace {
+
+const int kShares = 50;
+
+void QuietLog(int, const char*) {}
+void QuietReport(const std::string&) {}
+
+std::string ShareName(int i) { return "share" + std::to_string(i); }
+
+size_t Count(const std::string& text, const std::string& what) {
+  size_t n = 0;
+  for (size_t at = text.find(what); at != std::string::npos;
+       at = text.find(what, at + 1)) {
+    ++n;
+  }
+  return n;
+}
+
+struct Server {
+  s2s_test::Appliances app{S2S_CMD_HANDLER};
+  bool ok = true;
+
+  Server() {
+    KARO::Backup::RsyncWrapper::setLogHandler(QuietLog);
+    for (int i = 0; i < kShares && ok; ++i) ok = app.AddShare(ShareName(i));
+    ok = ok && app.StartServer();
+    for (int i = 0; i < kShares && ok; ++i) {
+      for (int f = 0; f < 10; ++f) {
+        std::ofstream(app.ClientShare(ShareName(i)) + "/f" + std::to_string(f))
+            << "file " << f << " of share " << i << "\n";
+      }
+    }
+  }
+
+  // {commands, data transfers} the daemon has served so far: it logs every
+  // connection it lets into a module.
+  std::pair<size_t, size_t> Served() const {
+    std::string log = app.DaemonLog();
+    size_t commands = Count(log, "access on module s2scmd ");
+    return {commands, Count(log, "access on module ") - commands};
+  }
+};
+
+Server& TheServer() {
+  static Server server;
+  return server;
+}
+
+void BM_NoChangeRun(benchmark::State& state) {
+  Server& s = TheServer();
+  if (!s.ok) return state.SkipWithError("no server");
+  const int n = static_cast<int>(state.range(0));
+  S2S::SyncTask task;
+  task.SetID(static_cast<unsigned long long>(n));
+  task.GetInfo().SetName("bench-" + std::to_string(n));
+  std::list<std::string> shares;
+  for (int i = 0; i < n; ++i) shares.push_back(ShareName(i));
+  task.GetInfo().SetShareList(shares);
+  task.GetInfo().SetSyncInfo(s.app.Info());
+  s2s_service::Session session;
+  // The first sync, and the session the runs below reuse.
+  if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr, &session)
+          .exit_code != 0) {
+    return state.SkipWithError("first run failed");
+  }
+  std::pair<size_t, size_t> before = s.Served();
+  for (auto _ : state) {
+    if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr, &session)
+            .exit_code != 0) {
+      return state.SkipWithError("run failed");
+    }
+  }
+  std::pair<size_t, size_t> after = s.Served();
+  double runs = static_cast<double>(state.iterations());
+  state.counters["commands"] = (after.first - before.first) / runs;
+  state.counters["transfers"] = (after.second - before.second) / runs;
+  state.counters["invocations"] =
+      (after.first + after.second - before.first - before.second) / runs;
+}
+
+// One run per repetition, so that the median is the median run.
+BENCHMARK(BM_NoChangeRun)
+    ->Arg(1)
+    ->Arg(10)
+    ->UseRealTime()
+    ->Unit(benchmark::kMillisecond)
+    ->Iterations(1)
+    ->Repetitions(10)
+    ->ReportAggregatesOnly(true);
+BENCHMARK(BM_NoChangeRun)
+    ->Arg(50)
+    ->UseRealTime()
+    ->Unit(benchmark::kMillisecond)
+    ->Iterations(1)
+    ->Repetitions(5)
+    ->ReportAggregatesOnly(true);
+
+}  // namespace
