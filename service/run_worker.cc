@@ -70,7 +70,8 @@ void StartRun(std::shared_ptr<ActiveRun> run,
               run->share_ = share;
               run->step_ = "transfer";
               run->transfer_ = p;
-            });
+            },
+            run->options);
       }
     }
     BindCancelFlag(nullptr);

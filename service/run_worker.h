@@ -21,7 +21,8 @@ struct ActiveRun {
   unsigned long long id = 0;
   StoredTask task;  // a copy: an update applies from the next run
   std::string trigger;
-  long started = 0;  // wall clock
+  RunOptions options;  // dry run, confirmed deletions, the task's guard
+  long started = 0;    // wall clock
   unsigned int beacon_interval = 30;
   CancelFlag cancel;
   TaskOutcome outcome;  // written by the run's thread before it reports
