@@ -74,13 +74,15 @@ void BM_NoChangeRun(benchmark::State& state) {
   task.GetInfo().SetSyncInfo(s.app.Info());
   s2s_service::Session session;
   // The first sync, and the session the runs below reuse.
-  if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr, &session)
+  if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr,
+                           s2s_service::RunOptions(), &session)
           .exit_code != 0) {
     return state.SkipWithError("first run failed");
   }
   std::pair<size_t, size_t> before = s.Served();
   for (auto _ : state) {
-    if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr, &session)
+    if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr,
+                             s2s_service::RunOptions(), &session)
             .exit_code != 0) {
       return state.SkipWithError("run failed");
     }

@@ -12,6 +12,7 @@ namespace detail {
 const char kKeyModule[] = "s2skeys";
 const char kCommandModule[] = "s2scmd";
 const char kSpoolModule[] = "s2sspool";
+const char kPartialDir[] = ".s2s-partial";
 
 namespace {
 
@@ -121,7 +122,8 @@ std::string RemoteSpec(const RsyncSettings& s, const std::string& module,
          where;
 }
 
-std::vector<std::string> DataTransferArgs(const RsyncSettings& s) {
+std::vector<std::string> DataTransferArgs(
+    const RsyncSettings& s, const RsyncWrapper::TransferMode& mode) {
   // -H: a share's hard links stay links on the server, not copies.
   // --sparse: a disk image's holes stay holes instead of blocks of zeros.
   std::vector<std::string> args = {"rsync", "-a", "-H", "--sparse"};
@@ -133,7 +135,18 @@ std::vector<std::string> DataTransferArgs(const RsyncSettings& s) {
   }
   if (s.compress) args.push_back("-z");
   if (s.bwlimit > 0) args.push_back("--bwlimit=" + std::to_string(s.bwlimit));
-  args.push_back(s.delta_copy ? "--no-whole-file" : "--whole-file");
+  args.push_back(s.delta_copy || mode.resume ? "--no-whole-file"
+                                             : "--whole-file");
+  // A relative partial directory lies beside each file, inside the module;
+  // rsync protects it from --delete and never sends one. Not for the key
+  // module, which holds plain files only, nor for a listing.
+  if (!s.list_only && !s.module.empty() && s.module[0] != '/') {
+    args.push_back(std::string("--partial-dir=") + kPartialDir);
+  }
+  if (mode.dry_run) args.insert(args.end(), {"--dry-run", "--itemize-changes"});
+  if (mode.max_delete >= 0) {
+    args.push_back("--max-delete=" + std::to_string(mode.max_delete));
+  }
   if (s.list_only) args.push_back("--list-only");
   if (s.relative) args.push_back("-R");
   if (s.acl) args.insert(args.end(), {"-A", "-X"});

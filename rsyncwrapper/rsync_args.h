@@ -7,6 +7,8 @@
 #include <string>
 #include <vector>
 
+#include "karo/rsync_wrapper.h"
+
 namespace KARO {
 namespace Backup {
 namespace detail {
@@ -16,6 +18,9 @@ extern const char kKeyModule[];
 // Command channel modules of the server's daemon.
 extern const char kCommandModule[];
 extern const char kSpoolModule[];
+// Where a share's module keeps what interrupted transfers had sent,
+// relative to each file's directory.
+extern const char kPartialDir[];
 
 struct RsyncSettings {
   bool del = false;
@@ -60,8 +65,10 @@ std::vector<std::string> TransportOptions(const RsyncSettings& s);
 std::string RemoteSpec(const RsyncSettings& s, const std::string& module,
                        const std::string& path);
 
-// The whole vector of a data transfer, "rsync" first.
-std::vector<std::string> DataTransferArgs(const RsyncSettings& s);
+// The whole vector of a data transfer in `mode`, "rsync" first, the source
+// and the destination last after "--".
+std::vector<std::string> DataTransferArgs(
+    const RsyncSettings& s, const RsyncWrapper::TransferMode& mode);
 
 }  // namespace detail
 }  // namespace Backup

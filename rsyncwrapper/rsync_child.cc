@@ -26,6 +26,7 @@ const int kKillGraceMs = 500;
 namespace {
 
 const int kPollMs = 50;
+const int kDeleteLimitStatus = 25;
 const size_t kMaxOutput = 64 * 1024;
 const size_t kMaxErrorLine = 300;
 
@@ -305,6 +306,12 @@ int RunAndLog(const std::vector<std::string>& args, const RsyncSettings& s,
               ProgressParser* progress) {
   ChildOutcome outcome =
       RunRsync(args, s.password, cancel, max_file_size, progress);
+  // rsync's 25 says only that --max-delete held deletions back, which is
+  // what it was asked to do (a daemon's client exits 0 for it).
+  if (outcome.status == kDeleteLimitStatus && progress != nullptr &&
+      progress->stats().deletions_skipped > 0) {
+    outcome.status = 0;
+  }
   if (output != nullptr) *output = outcome.output;
   std::string last;
   size_t start = 0;

@@ -32,7 +32,34 @@ bool Labelled(const std::string& line, const char* label,
 }  // namespace
 
 bool ProgressParser::Feed(const std::string& line) {
-  return FeedProgress(line) || FeedStats(line);
+  return FeedProgress(line) || FeedStats(line) || (itemized_ && FeedItem(line));
+}
+
+// "<f+++++++++ dir/file", "cd+++++++++ dir/", "*deleting   old/file":
+// eleven characters of change flags, a blank, the name; "cL..." adds
+// " -> TARGET" and "hf..." " => LINK".
+bool ProgressParser::FeedItem(const std::string& line) {
+  if (line.size() < 13 || line[11] != ' ') return false;
+  bool deleting = line.compare(0, 11, "*deleting  ") == 0;
+  char update = line[0];
+  if (!deleting && (strchr("<>ch.", update) == nullptr ||
+                    strchr("fdLDS", line[1]) == nullptr)) {
+    return false;
+  }
+  // Attributes only ('.'): no data goes, nothing is created.
+  if (update == '.') return true;
+  std::string path = line.substr(12);
+  const char* arrow = line[1] == 'L' ? " -> " : update == 'h' ? " => " : "";
+  if (*arrow != '\0') path = path.substr(0, path.find(arrow));
+  unsigned long long& count =
+      deleting ? stats_.would_delete : stats_.would_send;
+  std::vector<std::string>& paths =
+      deleting ? stats_.delete_paths : stats_.send_paths;
+  ++count;
+  if (paths.size() < RsyncWrapper::TransferStats::kListedPaths) {
+    paths.push_back(path);
+  }
+  return true;
 }
 
 // "      3,000,003 100%  476.84MB/s    0:00:00 (xfr#2, to-chk=0/4)"
@@ -85,7 +112,10 @@ bool ProgressParser::FeedStats(const std::string& line) {
       Labelled(line, "Matched data: ", &t.matched_bytes) ||
       Labelled(line, "Total bytes sent: ", &t.bytes_sent) ||
       Labelled(line, "Total bytes received: ", &t.bytes_received) ||
-      Labelled(line, "Number of created files: ", &ignored) ||
+      Labelled(line, "Number of created files: ", &t.files_created) ||
+      // Printed when --max-delete held deletions back.
+      Labelled(line, "Deletions stopped due to --max-delete limit (",
+               &t.deletions_skipped) ||
       Labelled(line, "Total transferred file size: ", &ignored) ||
       Labelled(line, "File list ", &ignored) ||
       Labelled(line, "total size is ", &ignored)) {

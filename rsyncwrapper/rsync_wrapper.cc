@@ -12,6 +12,7 @@ namespace {
 
 thread_local RsyncWrapper::ProgressHandler t_progress;
 thread_local RsyncWrapper::TransferStats t_stats;
+thread_local RsyncWrapper::TransferMode t_mode;
 
 }  // namespace
 
@@ -99,11 +100,13 @@ int RsyncWrapper::execute(boost::function<bool()> cancel) {
     return kBadSettings;
   }
   if (command) return detail::RunCommand(s, cancel);
-  std::vector<std::string> args = detail::DataTransferArgs(s);
-  if (!t_progress) return detail::RunAndLog(args, s, cancel, "transfer");
+  std::vector<std::string> args = detail::DataTransferArgs(s, t_mode);
+  if (!t_progress && !t_mode.dry_run && t_mode.max_delete < 0) {
+    return detail::RunAndLog(args, s, cancel, "transfer");
+  }
   // Before "--", the source and the destination, which end the vector.
   args.insert(args.end() - 3, {"--info=progress2", "--stats"});
-  detail::ProgressParser parser(t_progress);
+  detail::ProgressParser parser(t_progress, t_mode.dry_run);
   t_stats = RsyncWrapper::TransferStats();
   int status =
       detail::RunAndLog(args, s, cancel, "transfer", nullptr, 0, &parser);
@@ -115,9 +118,14 @@ std::string RsyncWrapper::lastError() { return detail::LastError(); }
 
 void RsyncWrapper::setThreadProgressHandler(const ProgressHandler& handler) {
   t_progress = handler;
+  t_stats = TransferStats();
 }
 
 RsyncWrapper::TransferStats RsyncWrapper::lastStats() { return t_stats; }
+
+void RsyncWrapper::setThreadTransferMode(const TransferMode& mode) {
+  t_mode = mode;
+}
 
 }  // namespace Backup
 }  // namespace KARO

@@ -390,6 +390,41 @@ bool MayPushShare(const std::string& share, const HandlerContext& ctx,
   return true;
 }
 
+bool MayDryRunShare(const std::string& share, const HandlerContext& ctx,
+                    std::string* why) {
+  int status = kOk;
+  if (!IsValidShareName(share)) {
+    *why = "not a share module";
+    return false;
+  }
+  if (!ServiceEnabled(&status)) {
+    *why = status == kServiceDisabled ? "the service is switched off"
+                                      : "the registry cannot be read";
+    return false;
+  }
+  Hash record = ReadSection("SHARE_" + share);
+  Hash pair = ReadSection(kPairSection);
+  if (!record || !pair) {
+    *why = "the registry cannot be read";
+    return false;
+  }
+  // Who feeds the share, as a sync start sees it: its running sync, else
+  // its last completed one, else the single client of an old pairing.
+  std::string feeder = ValueOr(record.get(), "RunningID");
+  if (feeder.empty()) feeder = ValueOr(record.get(), "CompleteID");
+  if (feeder.empty() && S2SServerIfOldClientPaired() == 1) {
+    feeder = ValueOr(pair.get(), "clientID");
+  }
+  if (feeder.empty()) return true;
+  std::string user;
+  if (!IsValidClientId(feeder) || !BoundUser(feeder, &user) || user.empty() ||
+      user != ctx.peer_user) {
+    *why = "the share is fed by another client";
+    return false;
+  }
+  return true;
+}
+
 int MarkRegistryInitialised() {
   std::string marker = KaroRootPath(kInitialisedMarker);
   int fd = open(marker.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);

@@ -48,6 +48,13 @@ int HandleCommand(const CommandFile& cmd, const HandlerContext& ctx,
 bool MayPushShare(const std::string& share, const HandlerContext& ctx,
                   std::string* why);
 
+// Whether the peer may run a dry run (a push that changes nothing) into the
+// data module of `share`: the service is on and the share is fed by no
+// client, or by one bound to the peer's daemon user. Returns true when
+// allowed; `why` says why not.
+bool MayDryRunShare(const std::string& share, const HandlerContext& ctx,
+                    std::string* why);
+
 // Records that this root has a registry (a marker beside it), so that its
 // disappearance is noticed. Returns 0, or -1 (logged).
 int MarkRegistryInitialised();

@@ -26,6 +26,9 @@ namespace server {
 
 namespace {
 
+// More arguments than any client of ours sends.
+const size_t kMaxHookArgs = 1024;
+
 std::string Env(const char* name) {
   const char* v = getenv(name);
   return v != nullptr ? v : "";
@@ -153,7 +156,32 @@ HookEnv HookEnv::FromEnvironment() {
   e.module = Env("RSYNC_MODULE_NAME");
   e.host_addr = Env("RSYNC_HOST_ADDR");
   e.user = Env("RSYNC_USER_NAME");
+  for (size_t i = 0; i < kMaxHookArgs; ++i) {
+    const char* arg = getenv(("RSYNC_ARG" + std::to_string(i)).c_str());
+    if (arg == nullptr) break;
+    e.args.push_back(arg);
+  }
   return e;
+}
+
+bool IsDryRunReceiver(const std::vector<std::string>& args) {
+  // rsync's short options that take no value; any other letter either
+  // takes the rest of the cluster as its value (B e @ T f M) or is unknown.
+  static const char kNoValue[] =
+      "0468ACDEFHIJKLNOPRSUVWXabcdghiklmnopqrstuvxyz";
+  if (args.size() < 3 || args[1] != "--server") return false;
+  for (const std::string& a : args) {
+    if (a == "--sender") return false;
+  }
+  const std::string& cluster = args[2];
+  if (cluster.size() < 2 || cluster[0] != '-' || cluster[1] == '-') {
+    return false;
+  }
+  for (size_t i = 1; i < cluster.size(); ++i) {
+    if (cluster[i] == '\0' || strchr(kNoValue, cluster[i]) == nullptr) break;
+    if (cluster[i] == 'n') return true;
+  }
+  return false;
 }
 
 std::string EarlyDir() { return KaroRootPath("/var/spool/s2s/early"); }
@@ -341,9 +369,13 @@ int DataHook(const HookEnv& env, FILE* out) {
   ctx.peer_address = env.host_addr;
   ctx.peer_user = env.user;
   std::string why;
-  if (!MayPushShare(share, ctx, &why)) {
-    LOG_WARNING("refused a push into '%s' from %s: %s", env.module.c_str(),
-                env.host_addr.c_str(), why.c_str());
+  // A dry run holds no sync: the client shows what a sync would do before
+  // it starts one, and the daemon changes nothing.
+  bool dry = IsDryRunReceiver(env.args);
+  if (dry ? !MayDryRunShare(share, ctx, &why)
+          : !MayPushShare(share, ctx, &why)) {
+    LOG_WARNING("refused a %s into '%s' from %s: %s", dry ? "dry run" : "push",
+                env.module.c_str(), env.host_addr.c_str(), why.c_str());
     fprintf(out, "%s\n", why.c_str());
     return 1;
   }

@@ -8,7 +8,8 @@
 //          exec) removes the spool, upload and reply; the handler now does
 //          that after "pre" in a process of its own (CleanUpAfterConnection)
 //   data   (share modules, pre-xfer exec) lets a push through only from the
-//          client holding the share's running sync
+//          client holding the share's running sync, and a dry run from the
+//          client that feeds the share
 //   keys   (s2skeys, pre-xfer exec) the same for the key file of one share,
 //          "s2skeys/<share>"
 //   keys-done (s2skeys, post-xfer exec) removes from the key directory
@@ -22,7 +23,8 @@
 // key hooks before they start, and by a command's cleaner after it.
 //
 // Inputs come from the daemon's environment (RSYNC_PID, RSYNC_REQUEST,
-// RSYNC_MODULE_NAME, RSYNC_HOST_ADDR, RSYNC_USER_NAME) and are validated
+// RSYNC_MODULE_NAME, RSYNC_HOST_ADDR, RSYNC_USER_NAME, RSYNC_ARG#: the
+// arguments the client gave the daemon's rsync) and are validated
 // before use. Each returns the hook's exit code: 0 lets the transfer go on.
 #ifndef S2S_SERVER_HOOKS_H_
 #define S2S_SERVER_HOOKS_H_
@@ -30,6 +32,7 @@
 #include <stdio.h>
 
 #include <string>
+#include <vector>
 
 #include "command_handler.h"
 
@@ -38,13 +41,22 @@ namespace server {
 
 // The daemon's environment as the hooks see it.
 struct HookEnv {
-  std::string pid;        // RSYNC_PID
-  std::string request;    // RSYNC_REQUEST ("module/path")
-  std::string module;     // RSYNC_MODULE_NAME
-  std::string host_addr;  // RSYNC_HOST_ADDR
-  std::string user;       // RSYNC_USER_NAME
+  std::string pid;                // RSYNC_PID
+  std::string request;            // RSYNC_REQUEST ("module/path")
+  std::string module;             // RSYNC_MODULE_NAME
+  std::string host_addr;          // RSYNC_HOST_ADDR
+  std::string user;               // RSYNC_USER_NAME
+  std::vector<std::string> args;  // RSYNC_ARG0, RSYNC_ARG1, ...
   static HookEnv FromEnvironment();
 };
+
+// Whether the daemon's rsync, started with `args`, receives and runs dry:
+// it parses "--server" and then a cluster of short options, of which every
+// letter up to the first that takes a value is an option; an 'n' among
+// those is --dry-run, which no later option undoes. An 'n' elsewhere (in a
+// value such as "-e.n", a path, a later argument) does not count, and any
+// "--sender" (the daemon sends) makes it false.
+bool IsDryRunReceiver(const std::vector<std::string>& args);
 
 // The spool directories under the root: early input, uploads, replies.
 std::string EarlyDir();

@@ -54,7 +54,27 @@ void Drain(int fd) {
 std::string OutcomeOf(const TaskOutcome& out) {
   if (out.exit_code == kExitOk) return "ok";
   if (out.exit_code == kExitCancelled) return "cancelled";
+  if (out.exit_code == kExitDeletions) return "held";
   return "failed";
+}
+
+// Paths of a dry run's listing are cut to this many bytes.
+const size_t kMaxListedPath = 1024;
+
+// What a dry run would send and delete: the counts and the first paths.
+void AddListing(const KARO::Backup::RsyncWrapper::TransferStats& s,
+                PObject& share) {
+  share["would_send"] = s.would_send;
+  share["would_delete"] = s.would_delete;
+  PObject::Array send, del;
+  for (const std::string& p : s.send_paths) {
+    send.emplace_back(p.substr(0, kMaxListedPath));
+  }
+  for (const std::string& p : s.delete_paths) {
+    del.emplace_back(p.substr(0, kMaxListedPath));
+  }
+  share["send_paths"] = send;
+  share["delete_paths"] = del;
 }
 
 // The task's state numbers as the history carries them.
@@ -319,7 +339,8 @@ void Daemon::CatchUp() {
   }
 }
 
-bool Daemon::Queue(unsigned long long id, const std::string& trigger) {
+bool Daemon::Queue(unsigned long long id, const std::string& trigger,
+                   const RunOptions& options) {
   auto it = tasks_.find(id);
   if (stopping_ || it == tasks_.end() || it->second.queued ||
       runs_.count(id) != 0) {
@@ -327,6 +348,7 @@ bool Daemon::Queue(unsigned long long id, const std::string& trigger) {
   }
   it->second.queued = true;
   it->second.queued_trigger = trigger;
+  it->second.queued_options = options;
   queue_.push_back(id);
   StartQueued();
   return true;
@@ -370,6 +392,7 @@ PObject Daemon::RunMap(const ActiveRun& run, bool ended) const {
   map["end"] =
       static_cast<unsigned long long>(ended ? clock_.WallSeconds() : 0);
   map["trigger"] = run.trigger;
+  map["dry_run"] = run.options.dry_run;
   // The outcome belongs to the run's thread until the run has ended.
   static const TaskOutcome kRunning;
   const TaskOutcome& out = ended ? run.outcome : kRunning;
@@ -388,7 +411,7 @@ PObject Daemon::RunMap(const ActiveRun& run, bool ended) const {
     PObject share;
     share = PObject::Map();
     share["name"] = s.name;
-    share["step"] = s.ok ? "finish" : s.failed_step;
+    share["step"] = !s.ok ? s.failed_step : out.dry_run ? "transfer" : "finish";
     share["status"] = s.status;
     share["status_text"] = s.ok ? StatusText(0) : s.cause;
     share["seconds"] = static_cast<unsigned long long>(s.seconds + 0.5);
@@ -400,6 +423,7 @@ PObject Daemon::RunMap(const ActiveRun& run, bool ended) const {
     share["sent"] = s.stats.bytes_sent;
     share["speed"] =
         static_cast<unsigned long long>(s.stats.bytes_per_second + 0.5);
+    if (out.dry_run) AddListing(s.stats, share);
     shares.push_back(share);
   }
   map["shares"] = shares;
@@ -411,6 +435,8 @@ void Daemon::Start(unsigned long long id, const std::string& trigger) {
   run->id = id;
   run->task = tasks_[id].stored;
   run->trigger = trigger;
+  run->options = tasks_[id].queued_options;
+  run->options.guard = run->task.guard;
   run->started = clock_.WallSeconds();
   run->beacon_interval = config_.beacon_interval;
   run->sessions = &sessions_;
@@ -450,7 +476,11 @@ void Daemon::Finish(unsigned long long id) {
   PObject map = RunMap(*run, true);
   const TaskOutcome& out = run->outcome;
   long now = clock_.WallSeconds();
-  if (out.exit_code == kExitCancelled) {
+  if (run->options.dry_run) {
+    // The schedule's retries are not a dry run's business.
+  } else if (out.exit_code == kExitCancelled ||
+             out.exit_code == kExitDeletions) {
+    // Held deletions wait for the operator, not for a retry.
     scheduler_.CancelRetry(id);
   } else if (out.exit_code == kExitOk) {
     scheduler_.ResetRetry(id);

@@ -55,6 +55,7 @@ class Daemon {
     StoredTask stored;
     bool queued = false;
     std::string queued_trigger;
+    RunOptions queued_options;  // dry run, confirmed deletions
   };
   struct Pending {  // a request handed over by the control thread
     const S2S::PObject* request;
@@ -77,7 +78,8 @@ class Daemon {
 
   // Queues a run of the task (nothing when it runs or waits already) and
   // starts what may start. False when it was running or queued already.
-  bool Queue(unsigned long long id, const std::string& trigger);
+  bool Queue(unsigned long long id, const std::string& trigger,
+             const RunOptions& options = RunOptions());
   void StartQueued();
   bool SharesFree(const Task& task) const;
   void Start(unsigned long long id, const std::string& trigger);

@@ -46,7 +46,7 @@ PObject Daemon::Dispatch(const PObject& request) {
       {"delete", &Daemon::DoDelete, {"id"}, true},
       {"enable", &Daemon::DoEnable, {"id"}, true},
       {"disable", &Daemon::DoDisable, {"id"}, true},
-      {"run", &Daemon::DoRun, {"id"}, true},
+      {"run", &Daemon::DoRun, {"id", "dry_run", "confirm_deletions"}, true},
       {"cancel", &Daemon::DoCancel, {"id"}, false},
       {"status", &Daemon::DoStatus, {}, false},
       {"history", &Daemon::DoHistory, {"id", "limit"}, false},
@@ -278,9 +278,20 @@ PObject Daemon::DoRun(const PObject& request) {
     return MakeReply(kResultBusy, name + " is running already");
   }
   if (task->queued) return MakeReply(kResultBusy, name + " is queued already");
-  scheduler_.CancelRetry(id);
-  Queue(id, "manual");
-  return Ok(name + (runs_.count(id) != 0 ? " started" : " queued"));
+  RunOptions options;
+  for (const char* key : {"dry_run", "confirm_deletions"}) {
+    if (request.hasMember(key) && !request[key].isInteger()) {
+      return MakeReply(kResultMalformed,
+                       std::string("\"") + key + "\" must be 0 or 1");
+    }
+  }
+  options.dry_run = request["dry_run"].asBool();
+  options.confirm_deletions = request["confirm_deletions"].asBool();
+  // A dry run does not stand in for the retry that a failed run awaits.
+  if (!options.dry_run) scheduler_.CancelRetry(id);
+  Queue(id, "manual", options);
+  return Ok(name + (runs_.count(id) != 0 ? " started" : " queued") +
+            (options.dry_run ? " (dry run)" : ""));
 }
 
 PObject Daemon::DoCancel(const PObject& request) {
@@ -319,6 +330,7 @@ PObject Daemon::DoStatus(const PObject&) {
     r["id"] = it.first;
     r["name"] = run.task.task.GetInfo().GetName();
     r["trigger"] = run.trigger;
+    r["dry_run"] = run.options.dry_run;
     r["started"] = static_cast<unsigned long long>(run.started);
     std::string share, step;
     KARO::Backup::RsyncWrapper::TransferProgress p;

@@ -14,6 +14,7 @@ enum ExitCode : int {
   kExitShare = 5,        // a share failed to start, transfer or finish
   kExitCancelled = 6,    // cancelled (a signal, or the service)
   kExitBusy = 7,         // another run of the task holds its lock
+  kExitDeletions = 8,    // the mass-delete guard held a share's deletions
 };
 
 }  // namespace s2s_service

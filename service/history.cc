@@ -90,7 +90,8 @@ std::string History::LastResult(unsigned long long id) {
   Load(id);
   for (const PObject& run : tasks_[id].runs) {
     std::string outcome = run["outcome"].asString();
-    if (outcome != "running") return outcome;
+    // A dry run synced nothing.
+    if (outcome != "running" && !run["dry_run"].asBool()) return outcome;
   }
   return "";
 }

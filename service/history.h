@@ -3,11 +3,12 @@
 // "last_due"), rewritten atomically whenever a run starts or ends, so that
 // a run in progress shows and the history survives a restart.
 //
-// A run map holds "start", "end" (0 while running), "trigger", "outcome"
-// ("ok", "failed", "cancelled", "running"), "message", "task_status",
-// "task_result" and "shares" (per share "name", "step", "status",
-// "status_text", "seconds", and rsync's figures "files", "bytes",
-// "deleted", "matched", "sent", "speed").
+// A run map holds "start", "end" (0 while running), "trigger", "dry_run",
+// "outcome" ("ok", "failed", "cancelled", "held", "running"), "message",
+// "task_status", "task_result" and "shares" (per share "name", "step",
+// "status", "status_text", "seconds", and rsync's figures "files",
+// "bytes", "deleted", "matched", "sent", "speed"; a dry run's listing
+// "would_send", "would_delete", "send_paths", "delete_paths").
 //
 // "last_due" is the schedule slot the task last ran for (or the time it was
 // added), so that a slot missed while the service was down is found at
@@ -43,7 +44,8 @@ class History {
               std::string& error);
   // The newest `limit` runs, newest first.
   S2S::PObject::Array Runs(unsigned long long id, size_t limit);
-  // The outcome of the newest finished run; "" before the first.
+  // The outcome of the newest finished run that was not a dry run; ""
+  // before the first.
   std::string LastResult(unsigned long long id);
 
   long LastDue(unsigned long long id);

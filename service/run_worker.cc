@@ -75,8 +75,8 @@ void StartRun(std::shared_ptr<ActiveRun> run,
               run->step_ = "transfer";
               run->transfer_ = p;
             },
-            &session);
-        if (run->sessions != nullptr)
+            run->options, run->options.dry_run ? nullptr : &session);
+        if (run->sessions != nullptr && !run->options.dry_run)
           run->sessions->Put(run->task.task, session);
       }
     }

@@ -22,7 +22,8 @@ struct ActiveRun {
   unsigned long long id = 0;
   StoredTask task;  // a copy: an update applies from the next run
   std::string trigger;
-  long started = 0;  // wall clock
+  RunOptions options;  // dry run, confirmed deletions, the task's guard
+  long started = 0;    // wall clock
   unsigned int beacon_interval = 30;
   // Where the task's session is kept between runs; null: none is kept.
   SessionCache* sessions = nullptr;

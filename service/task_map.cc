@@ -45,6 +45,9 @@ const Key kKeys[] = {
     {"repeat_times_in_day", kInt, 0},
     {"enabled", kBool, 0},
     {"excludes", kTextList, 256},
+    {"delete_guard", kBool, 0},
+    {"delete_guard_percent", kUInt, 100},
+    {"delete_guard_files", kUInt, 0},
     {"has_password", kIgnored, 0},
     {"next_run", kIgnored, 0},
     {"schedule_error", kIgnored, 0},
@@ -167,6 +170,10 @@ bool ApplyTaskMap(const PObject& in, StoredTask& task, std::string& error) {
   for (const PObject& e : merged["excludes"].asArray()) {
     out.excludes.push_back(e.asString());
   }
+  out.guard.on = merged["delete_guard"].asBool();
+  out.guard.percent =
+      static_cast<unsigned int>(merged["delete_guard_percent"].asUInt64());
+  out.guard.files = merged["delete_guard_files"].asUInt64();
   task = out;
   return true;
 }
@@ -184,6 +191,9 @@ PObject TaskToMap(const StoredTask& task, bool with_password) {
   PObject::Array excludes;
   for (const std::string& e : task.excludes) excludes.emplace_back(e);
   map["excludes"] = excludes;
+  map["delete_guard"] = task.guard.on;
+  map["delete_guard_percent"] = task.guard.percent;
+  map["delete_guard_files"] = task.guard.files;
   return map;
 }
 

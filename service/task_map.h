@@ -1,11 +1,12 @@
 // A task as the service keeps it, and its flat map.
 //
 // A StoredTask is the library's SyncTask plus the service's own settings
-// (enabled, excludes). It crosses the control socket and lies in its file
-// as the flat map of the sync-object mapping (SyncTask2PObj's keys) with
-// "enabled" and "excludes" beside them. Every key of an incoming map is
-// checked against one table (kind and size) before anything is applied, so
-// a bad map changes nothing.
+// (enabled, excludes, the mass-delete guard). It crosses the control socket
+// and lies in its file as the flat map of the sync-object mapping
+// (SyncTask2PObj's keys) with "enabled", "excludes", "delete_guard",
+// "delete_guard_percent" and "delete_guard_files" beside them. Every key of an
+// incoming map is checked against one table (kind and size) before anything is
+// applied, so a bad map changes nothing.
 #ifndef S2S_SERVICE_TASK_MAP_H_
 #define S2S_SERVICE_TASK_MAP_H_
 
@@ -14,6 +15,7 @@
 
 #include "S2S/pobject.h"
 #include "S2S/sync_obj_task.h"
+#include "service/task_runner.h"
 
 namespace s2s_service {
 
@@ -21,6 +23,7 @@ struct StoredTask {
   S2S::SyncTask task;
   bool enabled = true;
   std::list<std::string> excludes;
+  DeleteGuard guard;
 };
 
 // Lays the keys of `in` over `task`: only keys present change, "pswd"

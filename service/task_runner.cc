@@ -8,11 +8,13 @@
 #include "karo/rsync_wrapper.h"
 #include "service/cancel.h"
 #include "service/exit_codes.h"
+#include "service/share_transfer.h"
 
 namespace s2s_service {
 
 namespace {
 
+const int kAlreadyPaired = 207;
 const int kConflictStatus = 214;
 const int kServiceDisabled = 244;
 const int kPairedElsewhere = 245;
@@ -62,12 +64,15 @@ class Run {
  public:
   Run(const S2S::SyncTask& task, const std::list<std::string>& excludes,
       const Reporter& report, const ProgressReporter& progress,
-      Session* session)
+      const RunOptions& options, Session* session)
       : task_(task),
         excludes_(excludes),
         report_(report),
         progress_(progress),
-        session_(session != nullptr ? session : &own_session_) {}
+        options_(options),
+        session_(session != nullptr ? session : &own_session_) {
+    out_.dry_run = options.dry_run;
+  }
 
   void Go(unsigned int beacon_interval);
   TaskOutcome& outcome() { return out_; }
@@ -80,14 +85,19 @@ class Run {
   bool Renew(const ShareOutcome& share);
   void Beacon(const char* when);
   void SyncShare(const std::string& share);
+  PushResult Push(ShareOutcome& share);
+  void DryRun();
   bool ShareStep(ShareOutcome& share, const char* step, int rc, int status);
   void FinishTask();
+  // The exit code and error from the shares' outcomes.
+  void Outcome();
   bool Stop(int code, const std::string& error);
 
   const S2S::SyncTask& task_;
   const std::list<std::string>& excludes_;
   const Reporter& report_;
   const ProgressReporter& progress_;
+  const RunOptions& options_;
   Session own_session_;
   Session* session_;
   S2S::Rsyncer rsyncer_;
@@ -170,7 +180,9 @@ bool Run::Probe() {
 bool Run::Pair() {
   const std::list<std::string>& shares = task_.GetInfo().GetShareList();
   int status = 0;
-  int rc = rsyncer_.DoPairing(false, shares, out_.conflicts, status);
+  int rc = rsyncer_.DoPairing(options_.dry_run, shares, out_.conflicts, status);
+  // A dry run's question to an old server: this client is the paired one.
+  if (options_.dry_run && status == kAlreadyPaired) status = 0;
   // 214 is the server's answer that some shares conflict; the list says
   // which.
   if (rc == 0 && status == kConflictStatus && !out_.conflicts.empty()) {
@@ -181,7 +193,8 @@ bool Run::Pair() {
     return Stop(kExitPairing, "pairing refused: " + FailureText(status));
   }
   report_("pair: " + Join(shares) +
-          (rsyncer_.SupportMultiSource() ? "" : " (single-client server)"));
+          (rsyncer_.SupportMultiSource() ? "" : " (single-client server)") +
+          (options_.dry_run ? " (dry run: nothing recorded)" : ""));
   return true;
 }
 
@@ -208,6 +221,16 @@ bool Run::ShareStep(ShareOutcome& share, const char* step, int rc, int status) {
   return false;
 }
 
+PushResult Run::Push(ShareOutcome& share) {
+  const std::string& name = share.name;
+  return PushShare(
+      rsyncer_, task_.GetID(), excludes_, options_,
+      [this, &name](const KARO::Backup::RsyncWrapper::TransferProgress& p) {
+        if (progress_) progress_(name, p);
+      },
+      share);
+}
+
 void Run::SyncShare(const std::string& name) {
   ShareOutcome share;
   share.name = name;
@@ -215,18 +238,13 @@ void Run::SyncShare(const std::string& name) {
   int rc = rsyncer_.StartSyncShare(name, status);
   if (ShareStep(share, "start", rc, status)) {
     report_("share " + name + ": started");
-    double t0 = Now();
-    status = 0;
-    // Always set, so that rsync prints its --stats for the share's figures.
-    KARO::Backup::RsyncWrapper::setThreadProgressHandler(
-        [this, &name](const KARO::Backup::RsyncWrapper::TransferProgress& p) {
-          if (progress_) progress_(name, p);
-        });
-    rc = rsyncer_.RunSync(task_.GetID(), name, "/", excludes_, status);
-    KARO::Backup::RsyncWrapper::setThreadProgressHandler({});
-    share.stats = KARO::Backup::RsyncWrapper::lastStats();
-    share.seconds = Now() - t0;
-    if (ShareStep(share, "transfer", rc, status)) {
+    PushResult push = Push(share);
+    if (!push.held.empty()) {
+      share.failed_step = "guard";
+      share.status = push.status;
+      share.cause = push.held;
+      report_("share " + name + ": " + push.held);
+    } else if (ShareStep(share, "transfer", push.rc, push.status)) {
       report_("share " + name + ": transferred in " +
               Format("%.2f s", share.seconds));
       S2S::ShareInfo info;
@@ -245,6 +263,20 @@ void Run::SyncShare(const std::string& name) {
     }
   }
   out_.shares.push_back(share);
+}
+
+void Run::DryRun() {
+  for (const std::string& name : task_.GetInfo().GetShareList()) {
+    if (CancelRequested()) break;
+    ShareOutcome share;
+    share.name = name;
+    PushResult push = Push(share);
+    share.ok = ShareStep(share, "transfer", push.rc, push.status);
+    if (share.ok) {
+      report_("share " + name + ": " + DryRunSummary(share, options_.guard));
+    }
+    out_.shares.push_back(share);
+  }
 }
 
 void Run::FinishTask() {
@@ -270,7 +302,13 @@ void Run::FinishTask() {
 void Run::Go(unsigned int beacon_interval) {
   double t0 = Now();
   rsyncer_.SetCancelChecker(CancelChecker);
-  if (Connect()) {
+  if (options_.dry_run) {
+    // A dry run asks its own questions and leaves any session alone.
+    if (Probe() && Pair()) {
+      DryRun();
+      Outcome();
+    }
+  } else if (Connect()) {
     SetBeaconHook([this] { Beacon("transfer running"); }, beacon_interval);
     const std::list<std::string>& shares = task_.GetInfo().GetShareList();
     for (const std::string& share : shares) {
@@ -285,23 +323,38 @@ void Run::Go(unsigned int beacon_interval) {
       if (lost_) break;
     }
     SetBeaconHook(nullptr, 0);
-    size_t failed = 0;
-    for (const ShareOutcome& s : out_.shares) failed += s.ok ? 0 : 1;
     // A run whose second probe or pairing failed has stopped already.
     if (!lost_) {
-      if (CancelRequested()) {
-        out_.exit_code = kExitCancelled;
-        out_.error = "cancelled";
-        report_("error: cancelled");
-      } else if (failed > 0) {
-        out_.exit_code = kExitShare;
-        out_.error = std::to_string(failed) + " of " +
-                     std::to_string(shares.size()) + " shares failed";
-      }
+      Outcome();
       FinishTask();
     }
   }
   out_.seconds = Now() - t0;
+}
+
+void Run::Outcome() {
+  size_t failed = 0;
+  std::string held;
+  for (const ShareOutcome& s : out_.shares) {
+    if (s.failed_step == "guard") {
+      held += (held.empty() ? "share " : "; share ") + s.name + ": " + s.cause;
+    } else if (!s.ok) {
+      ++failed;
+    }
+  }
+  if (CancelRequested()) {
+    out_.exit_code = kExitCancelled;
+    out_.error = "cancelled";
+    report_("error: cancelled");
+  } else if (failed > 0) {
+    out_.exit_code = kExitShare;
+    out_.error = std::to_string(failed) + " of " +
+                 std::to_string(task_.GetInfo().GetShareList().size()) +
+                 " shares failed";
+  } else if (!held.empty()) {
+    out_.exit_code = kExitDeletions;
+    out_.error = held;
+  }
 }
 
 }  // namespace
@@ -323,6 +376,9 @@ std::string StatusText(int status) {
       break;
     case 23:
       text = "partial transfer";
+      break;
+    case 25:
+      text = "deletions held back";
       break;
     case 30:
     case 35:
@@ -400,8 +456,9 @@ std::string FailureText(int status) {
 TaskOutcome RunTask(const S2S::SyncTask& task,
                     const std::list<std::string>& excludes,
                     unsigned int beacon_interval, const Reporter& report,
-                    const ProgressReporter& progress, Session* session) {
-  Run run(task, excludes, report, progress, session);
+                    const ProgressReporter& progress, const RunOptions& options,
+                    Session* session) {
+  Run run(task, excludes, report, progress, options, session);
   run.Go(beacon_interval);
   return run.outcome();
 }

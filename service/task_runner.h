@@ -16,6 +16,11 @@
 // none, the share's sync gone, the address refusing or silent), the run
 // probes and pairs again at once and makes the share's steps again, once.
 //
+// A dry run probes and asks the pairing question without committing the
+// server to anything, then runs each share's transfer with rsync's
+// --dry-run: no sync is started, no beacon or end is reported, and each
+// share's outcome lists what would be sent and deleted.
+//
 // RunTask runs on the calling thread with its own Rsyncer; a cancel comes
 // through the flag bound to that thread (service/cancel.h), and its beacons
 // are the thread's own, so several tasks may run at once on threads of
@@ -34,19 +39,37 @@
 
 namespace s2s_service {
 
+// The mass-delete guard of a task: a run that would delete more than
+// `percent` % of the entries of the server's copy of a share, or more than
+// `files` entries, whichever is fewer, deletes nothing there (the rest of
+// the share is synced) unless the run is confirmed.
+struct DeleteGuard {
+  bool on = true;
+  unsigned int percent = 50;
+  unsigned long long files = 10000;
+};
+
+struct RunOptions {
+  bool dry_run = false;
+  bool confirm_deletions = false;  // this run passes the guard
+  DeleteGuard guard;
+};
+
 struct ShareOutcome {
   std::string name;
   bool ok = false;
-  std::string failed_step;  // "start", "transfer", "key", "finish"
+  std::string failed_step;  // "start", "transfer", "guard", "key", "finish"
   int status = 0;           // the failed step's status
   std::string cause;        // the status in words, with rsync's or the
                             // server's reason when either gave one
   double seconds = 0;       // time of the transfer
-  // rsync's --stats of the transfer (complete false when it printed none).
+  // rsync's --stats of the transfer (complete false when it printed none);
+  // for a dry run also what would be sent and deleted.
   KARO::Backup::RsyncWrapper::TransferStats stats;
 };
 
 struct TaskOutcome {
+  bool dry_run = false;
   int exit_code = 0;  // an ExitCode
   std::string error;  // why the task stopped or failed; "" when it did not
   std::string server_ip;
@@ -73,6 +96,7 @@ TaskOutcome RunTask(const S2S::SyncTask& task,
                     const std::list<std::string>& excludes,
                     unsigned int beacon_interval, const Reporter& report,
                     const ProgressReporter& progress = nullptr,
+                    const RunOptions& options = RunOptions(),
                     Session* session = nullptr);
 
 // What a status from the rsync wrapper or the server means, for people.

@@ -84,6 +84,30 @@ TEST(CommandFile, IdsThatCouldEscapeAPathAreRefused) {
   EXPECT_TRUE(IsValidTaskName("nightly task"));
 }
 
+// Only what makes the daemon's rsync run dry passes for a dry run: an 'n'
+// among the leading value-less options of the cluster after --server.
+TEST(DataHook, OnlyArgumentsThatMakeTheDaemonRunDryCountAsADryRun) {
+  const struct {
+    std::vector<std::string> args;
+    bool dry;
+  } cases[] = {
+      {{"rsyncd", "--server", "-nlogDtpre.iLsfxCIvu", "--delete", ".", "d/"},
+       true},
+      {{"rsyncd", "--server", "-vvnlHogDtpArSze.iLsfxCIvu", ".", "d/"}, true},
+      {{"rsyncd", "--server", "-logDtpre.niLsfxCIvu", ".", "d/"}, false},
+      {{"rsyncd", "--server", "-B1024n", ".", "d/"}, false},
+      {{"rsyncd", "--server", "-lZn", ".", "d/"}, false},
+      {{"rsyncd", "--server", "-logDtpr", "-n", ".", "d/"}, false},
+      {{"rsyncd", "--server", "--dry-run", ".", "d/"}, false},
+      {{"rsyncd", "--server", "-nlogDtpr", "--sender", ".", "d/"}, false},
+      {{"rsyncd", "-n", "--server", "-logDtpr", ".", "d/"}, false},
+      {{"rsyncd", "--server"}, false},
+  };
+  for (const auto& c : cases) {
+    EXPECT_EQ(c.dry, IsDryRunReceiver(c.args)) << c.args[2 % c.args.size()];
+  }
+}
+
 class HookTest : public ::testing::Test {
  protected:
   void SetUp() override {

@@ -137,6 +137,14 @@ TEST_F(ServerDaemonTest, SyncRunAndDataModuleGuard) {
   EXPECT_EQ(0, Command("clientA", "S2S_SyncFinish",
                        {"finishType=\"share\"", "name=\"share1\""}));
   EXPECT_NE(0, Push());
+  // A dry run needs no running sync from the client that feeds the share,
+  // and the daemon changes nothing.
+  std::filesystem::create_directories(tmp_.Sub("empty"));
+  EXPECT_EQ(0,
+            Rsync(kUser, kPassword,
+                  {"-n", "-r", "--delete", tmp_.Sub("empty") + "/", "share1/"},
+                  daemon_.port()));
+  EXPECT_EQ("payload", ReadFile(tmp_.Sub("share1/file")));
   // Nothing is left in the spool once the connections are over: each
   // command's cleaner removes its files when its connection has ended.
   const std::string replies = tmp_.Sub("var/spool/s2s/reply");
@@ -195,6 +203,7 @@ TEST_F(ServerDaemonTest, HostileClientsAreRefused) {
       {"replace an upload", {tmp_.Sub("evil"), "s2sspool/pending"}},
       {"upload a tree", {"-r", tmp_.Sub("tree"), "s2sspool/t1"}},
       {"push into the share", {"-r", "--delete", src, "share1/"}},
+      {"dry run into the share", {"-n", "-r", "--delete", src, "share1/"}},
   };
   for (const Row& row : rows) {
     EXPECT_NE(0, Rsync(kOtherUser, kOtherPassword, row.args, port)) << row.what;

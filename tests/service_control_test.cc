@@ -13,6 +13,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <string>
 #include <vector>
 
@@ -109,6 +110,11 @@ TEST(CtlOptions, TaskOptionsBecomeOnlyTheKeysTheyName) {
       {{"task", "add", "--at", "7"}, ""},
       {{"task", "frobnicate"}, ""},
       {{"status", "--limit", "3"}, ""},
+      {{"task", "edit", "x", "--delete-guard=no", "--delete-guard-files", "9"},
+       "{\"delete_guard\":0,\"delete_guard_files\":9}"},
+      {{"run", "x", "--dry-run"}, "{}"},
+      {{"history", "x", "--confirm-deletions"}, ""},
+      {{"task", "add", "--delete-guard-percent", "101"}, ""},
   };
   for (const auto& c : kCases) {
     CtlOptions o;
@@ -480,7 +486,10 @@ TEST_F(ServiceControlTest, CtlAddListShowRunHistory) {
   const std::string password = apps_.Info().GetPassword();
   ASSERT_TRUE(s2s_test::WriteFile(pass, password + "\n"));
   chmod(pass.c_str(), 0600);
-  ASSERT_TRUE(s2s_test::WriteFile(apps_.ClientShare("docs") + "/a.txt", "a\n"));
+  const std::string docs = apps_.ClientShare("docs");
+  for (const char* f : {"/a.txt", "/b.txt", "/c.txt"}) {
+    ASSERT_TRUE(s2s_test::WriteFile(docs + f, "a\n"));
+  }
   CtlRun ctl(tmp_);
   ASSERT_EQ(0, ctl({"task", "add", "--task", "docs-copy", "--share", "docs",
                     "--server-ip", "127.0.0.1", "--user", apps_.user(),
@@ -500,15 +509,20 @@ TEST_F(ServiceControlTest, CtlAddListShowRunHistory) {
   EXPECT_EQ(2, ctl({"task", "edit", "docs-copy", "--exclude",
                     std::string(70000, 'x')}));  // the wire would wrap it
 
-  ASSERT_EQ(0, ctl({"run", "docs-copy"})) << ctl.output;
-  bool done = false;
-  for (int waited = 0; !done && waited < 30000; waited += 5) {
-    ASSERT_EQ(0, ctl({"history", "docs-copy", "--json"})) << ctl.output;
-    done = s2s_test::Has(ctl.output, "\"outcome\": \"") &&
-           !s2s_test::Has(ctl.output, "\"outcome\": \"running\"");
-    if (!done) Pause();
-  }
-  ASSERT_TRUE(done) << ctl.output;
+  // Runs the task and leaves its newest history entry in ctl.output.
+  auto run = [&](std::vector<std::string> args) {
+    args.insert(args.begin(), {"run", "docs-copy"});
+    ASSERT_EQ(0, ctl(args)) << ctl.output;
+    bool done = false;
+    for (int waited = 0; !done && waited < 30000; waited += 5) {
+      ASSERT_EQ(0, ctl({"history", "docs-copy", "--json", "--limit", "1"}));
+      done = s2s_test::Has(ctl.output, "\"outcome\": \"") &&
+             !s2s_test::Has(ctl.output, "\"outcome\": \"running\"");
+      if (!done) Pause();
+    }
+    ASSERT_TRUE(done) << ctl.output;
+  };
+  ASSERT_NO_FATAL_FAILURE(run({}));
   EXPECT_TRUE(s2s_test::Has(ctl.output, "\"outcome\": \"ok\"")) << ctl.output;
   EXPECT_TRUE(s2s_test::Has(ctl.output, "\"trigger\": \"manual\""));
   EXPECT_EQ("a\n", s2s_test::ReadFile(apps_.ServerShare("docs") + "/a.txt"));
@@ -517,6 +531,22 @@ TEST_F(ServiceControlTest, CtlAddListShowRunHistory) {
               s2s_test::Has(ctl.output, "(none)"))
       << ctl.output;
   EXPECT_FALSE(s2s_test::Has(ctl.output, password));
+
+  // The share emptied: a dry run lists the deletions, a run holds them
+  // back, a confirmed run makes them.
+  std::filesystem::remove_all(docs);
+  std::filesystem::create_directories(docs);
+  ASSERT_EQ(0, ctl({"run", "docs-copy", "--dry-run"})) << ctl.output;
+  EXPECT_TRUE(s2s_test::Has(ctl.output, "docs: would send 0, delete 3"))
+      << ctl.output;
+  EXPECT_TRUE(s2s_test::Has(ctl.output, "    - b.txt\n")) << ctl.output;
+  ASSERT_NO_FATAL_FAILURE(run({}));
+  EXPECT_TRUE(s2s_test::Has(ctl.output, "\"outcome\": \"held\"")) << ctl.output;
+  EXPECT_TRUE(s2s_test::Has(ctl.output, "3 of 4 entries")) << ctl.output;
+  EXPECT_EQ("a\n", s2s_test::ReadFile(apps_.ServerShare("docs") + "/a.txt"));
+  ASSERT_NO_FATAL_FAILURE(run({"--confirm-deletions"}));
+  EXPECT_TRUE(s2s_test::Has(ctl.output, "\"outcome\": \"ok\"")) << ctl.output;
+  EXPECT_FALSE(std::filesystem::exists(apps_.ServerShare("docs") + "/a.txt"));
 }
 
 }  // namespace

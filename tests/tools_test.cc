@@ -165,6 +165,19 @@ void SleepMs(int ms) {
   nanosleep(&ts, nullptr);
 }
 
+// Bytes of file data a run's summary says were sent: "N files and 20.1 MiB
+// sent".
+double SentBytes(const std::string& out) {
+  size_t at = out.find(" files and ");
+  double v = -1;
+  char unit[8] = "";
+  if (at == std::string::npos ||
+      sscanf(out.c_str() + at + 11, "%lf %7s", &v, unit) != 2) {
+    return -1;
+  }
+  return v * (unit[0] == 'K' ? 1 << 10 : unit[0] == 'M' ? 1 << 20 : 1);
+}
+
 // Whether the lock file `path` can be taken within `seconds`, that is,
 // every process holding it (inherited descriptors too) is gone. It is
 // released again before returning.
@@ -583,6 +596,93 @@ TEST_F(ToolsTest, AFullServerDiskIsNamedOnTheClient) {
   EXPECT_EQ(kExitShare, c.code) << c.out << c.err;
   EXPECT_TRUE(s2s_test::Has(c.out, "share big: transfer failed: ")) << c.out;
   EXPECT_TRUE(s2s_test::Has(c.out, "No space left on device")) << c.out;
+}
+
+// A dry run of a changed share lists what a sync would send and delete, and
+// the server's data and registry stay as they were.
+TEST_F(ToolsTest, DryRunListsTheChangesAndChangesNothingOnTheServer) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  ASSERT_EQ(kExitOk, RunProgram(tmp_.path(), Client(client, "docs")).code);
+  WriteFile(client + "/volume1/docs/new.txt", "new\n");
+  std::filesystem::remove(client + "/volume1/docs/a.txt");
+  const std::string registry = server_ + "/usr/karo/etc/karoS2S.info";
+  const std::string before = ReadFile(registry);
+  Child c = RunProgram(tmp_.path(), Client(client, "docs", {"--dry-run"}));
+  ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
+  for (const char* says :
+       {"share docs: would send 1, delete 1", "    + new.txt\n",
+        "    - a.txt\n", "1/1 shares checked (dry run)"}) {
+    EXPECT_TRUE(s2s_test::Has(c.out, says)) << says << "\n" << c.out;
+  }
+  EXPECT_EQ(before, ReadFile(registry));
+  EXPECT_EQ("alpha\n", ReadFile(server_ + "/volume1/docs/a.txt"));
+  EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/docs/new.txt"));
+}
+
+// A large file's transfer cut past half way: the next run sends only what
+// had not arrived, from the part the server kept.
+TEST_F(ToolsTest, ACutTransferResumesFromWhatArrived) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  const double kSize = 48 << 20;
+  WriteBlob(client + "/volume1/big/blob", 48);
+  // Slow enough to be cut where the test wants it.
+  Child c =
+      Spawn(tmp_.path(), Client(client, "big", {"--max-bandwidth", "16384"}));
+  const std::string share = server_ + "/volume1/big";
+  bool past_half = false;
+  for (int waited = 0; waited < 60000 && !past_half; waited += 5) {
+    std::error_code ec;
+    for (const auto& e : std::filesystem::directory_iterator(share, ec)) {
+      // rsync's temporary file of the blob, growing.
+      past_half =
+          past_half || (e.path().filename().string().find(".blob.") == 0 &&
+                        e.file_size(ec) > kSize * 0.6);
+    }
+    if (!past_half) SleepMs(5);
+  }
+  kill(c.pid, SIGTERM);
+  ASSERT_TRUE(past_half) << "the transfer was never seen half done";
+  ASSERT_EQ(kExitCancelled, c.Wait()) << c.out << c.err;
+  // The daemon's side keeps the part once its connection has ended.
+  const std::string part = share + "/.s2s-partial/blob";
+  for (int waited = 0; waited < 30000 && !std::filesystem::exists(part);
+       waited += 5)
+    SleepMs(5);
+  ASSERT_TRUE(std::filesystem::exists(part));
+  Child next = RunProgram(tmp_.path(), Client(client, "big"));
+  ASSERT_EQ(kExitOk, next.code) << next.out << next.err;
+  EXPECT_GT(SentBytes(next.out), 0) << next.out;
+  EXPECT_LT(SentBytes(next.out), kSize / 2) << next.out;
+  EXPECT_EQ(kSize, std::filesystem::file_size(share + "/blob"));
+  EXPECT_FALSE(std::filesystem::exists(share + "/.s2s-partial"));
+}
+
+// A client share emptied (its disk not mounted) but for one new file: the
+// new file arrives, nothing is deleted, the refusal names the share and the
+// counts; a confirmed run then deletes.
+TEST_F(ToolsTest, TheDeleteGuardHoldsBackAMassDeletionUntilConfirmed) {
+  std::string client = MakeClient("client", "CLIENT-A");
+  const std::string big = client + "/volume1/big";
+  for (const char* f : {"f1", "f2", "f3", "f4"}) WriteFile(big + "/" + f, f);
+  ASSERT_EQ(kExitOk, RunProgram(tmp_.path(), Client(client, "big")).code);
+  std::filesystem::remove_all(big);
+  std::filesystem::create_directories(big);
+  WriteFile(big + "/new", "new\n");
+  Child held = RunProgram(tmp_.path(), Client(client, "big"));
+  EXPECT_EQ(kExitDeletions, held.code) << held.out << held.err;
+  EXPECT_TRUE(s2s_test::Has(held.out,
+                            "share big: deletions held back: 4 of 5 entries "
+                            "on the server would be deleted, more than the "
+                            "guard allows (2)"))
+      << held.out;
+  EXPECT_EQ("new\n", ReadFile(server_ + "/volume1/big/new"));
+  EXPECT_EQ("f1", ReadFile(server_ + "/volume1/big/f1"));
+
+  Child confirmed =
+      RunProgram(tmp_.path(), Client(client, "big", {"--confirm-deletions"}));
+  EXPECT_EQ(kExitOk, confirmed.code) << confirmed.out << confirmed.err;
+  EXPECT_TRUE(s2s_test::Has(confirmed.out, "4 deleted")) << confirmed.out;
+  EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/big/f1"));
 }
 
 // kill -9 of the client while it transfers and a beacon's command is in

@@ -27,6 +27,11 @@ enum Option {
   kMaxBandwidth,
   kBeacon,
   kVersion,
+  kDryRun,
+  kConfirmDeletions,
+  kDeleteGuard,
+  kGuardPercent,
+  kGuardFiles,
 };
 
 const struct option kOptions[] = {
@@ -48,6 +53,11 @@ const struct option kOptions[] = {
     {"ssh-port", required_argument, nullptr, kSSHPort},
     {"max-bandwidth", required_argument, nullptr, kMaxBandwidth},
     {"beacon-interval", required_argument, nullptr, kBeacon},
+    {"dry-run", no_argument, nullptr, kDryRun},
+    {"confirm-deletions", no_argument, nullptr, kConfirmDeletions},
+    {"delete-guard", required_argument, nullptr, kDeleteGuard},
+    {"delete-guard-percent", required_argument, nullptr, kGuardPercent},
+    {"delete-guard-files", required_argument, nullptr, kGuardFiles},
     {"verbose", no_argument, nullptr, 'v'},
     {"help", no_argument, nullptr, 'h'},
     {"version", no_argument, nullptr, kVersion},
@@ -80,6 +90,13 @@ const char kUsage[] =
     "  --delta                block-level (delta) transfer\n"
     "  --ssh                  go through SSH; --ssh-port PORT\n"
     "  --beacon-interval SEC  seconds between beacons during a run (30)\n"
+    "  --dry-run              show what would be sent and deleted; the\n"
+    "                         server changes nothing, records no sync\n"
+    "  --delete-guard yes|no  hold back deletions of more than\n"
+    "                         --delete-guard-percent P (50) % of the\n"
+    "                         server's copy or --delete-guard-files N\n"
+    "                         (10000) entries, whichever is fewer (yes)\n"
+    "  --confirm-deletions    this run deletes past the guard\n"
     "  -v, --verbose          log INFO; twice: DEBUG and rsync's output\n"
     "  -h, --help             this text; --version: the version\n"
     "\n"
@@ -92,7 +109,9 @@ const char kUsage[] =
     "  4  pairing refused, or shares fed by another client\n"
     "  5  a share failed to start, transfer or finish\n"
     "  6  cancelled by SIGINT or SIGTERM\n"
-    "  7  another run of the task (or an rsync it left) is still running\n";
+    "  7  another run of the task (or an rsync it left) is still running\n"
+    "  8  the delete guard held back a share's deletions (the rest was\n"
+    "     synced): check, then run again with --confirm-deletions\n";
 
 bool Number(const char* name, const char* text, unsigned long long max,
             unsigned long long& out, std::string& error) {
@@ -190,6 +209,30 @@ bool ParseClientArgs(int argc, char** argv, ClientOptions& o,
       case kBeacon:
         if (!Number("beacon-interval", optarg, 86400, n, error)) return false;
         o.beacon_interval = static_cast<unsigned int>(n);
+        break;
+      case kDryRun:
+        o.dry_run = true;
+        break;
+      case kConfirmDeletions:
+        o.confirm_deletions = true;
+        break;
+      case kDeleteGuard:
+        if (!ParseFlag(optarg, o.spec.guard.on)) {
+          error = std::string("bad value for --delete-guard: ") + optarg;
+          return false;
+        }
+        break;
+      case kGuardPercent:
+        if (!Number("delete-guard-percent", optarg, 100, n, error)) {
+          return false;
+        }
+        o.spec.guard.percent = static_cast<unsigned int>(n);
+        break;
+      case kGuardFiles:
+        if (!Number("delete-guard-files", optarg, ~0ULL, n, error)) {
+          return false;
+        }
+        o.spec.guard.files = n;
         break;
       case 'v':
         ++o.verbose;

@@ -16,6 +16,8 @@ struct ClientOptions {
   bool help = false;
   bool version = false;               // --version
   unsigned int beacon_interval = 30;  // seconds between beacons during a run
+  bool dry_run = false;               // --dry-run
+  bool confirm_deletions = false;     // --confirm-deletions
 };
 
 // Parses `argv` into `options`: first the task file (--task-file), then

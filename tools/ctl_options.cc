@@ -40,6 +40,11 @@ enum Option {
   kRepeat,
   kEnabled,
   kDisabled,
+  kDeleteGuard,
+  kGuardPercent,
+  kGuardFiles,
+  kDryRun,
+  kConfirmDeletions,
 };
 
 const struct option kOptions[] = {
@@ -72,6 +77,11 @@ const struct option kOptions[] = {
     {"repeat", required_argument, nullptr, kRepeat},
     {"enabled", optional_argument, nullptr, kEnabled},
     {"disabled", no_argument, nullptr, kDisabled},
+    {"delete-guard", optional_argument, nullptr, kDeleteGuard},
+    {"delete-guard-percent", required_argument, nullptr, kGuardPercent},
+    {"delete-guard-files", required_argument, nullptr, kGuardFiles},
+    {"dry-run", no_argument, nullptr, kDryRun},
+    {"confirm-deletions", no_argument, nullptr, kConfirmDeletions},
     {"verbose", no_argument, nullptr, 'v'},
     {"help", no_argument, nullptr, 'h'},
     {"version", no_argument, nullptr, 'V'},
@@ -90,7 +100,10 @@ const char kUsage[] =
     "  task edit TASK [task options]   changes only what the options say\n"
     "  task delete TASK            removes a task that is not running\n"
     "  task enable TASK | task disable TASK   schedule on or off\n"
-    "  run TASK                    starts the task now\n"
+    "  run TASK [--confirm-deletions]   starts the task now; it may delete\n"
+    "                              past the task's delete guard\n"
+    "  run TASK --dry-run          waits for a dry run and shows what a run\n"
+    "                              would send and delete\n"
     "  cancel TASK                 stops its run, queued run or retry\n"
     "  status                      the service: uptime, running, next runs\n"
     "  history TASK [--limit N]    the task's last runs, newest first\n"
@@ -132,6 +145,10 @@ const char kUsage[] =
     "  --every HH:MM          period of the repeats within a run day\n"
     "  --repeat N             runs after the first of a run day\n"
     "  --enabled[=yes|no], --disabled   whether the schedule starts it\n"
+    "  --delete-guard[=yes|no]  hold back a run's deletions of more than\n"
+    "                         --delete-guard-percent P (50) % of the\n"
+    "                         server's copy or --delete-guard-files N\n"
+    "                         (10000) entries, whichever is fewer\n"
     "\n"
     "Exit codes:\n"
     "  0  done\n"
@@ -142,7 +159,8 @@ const char kUsage[] =
     "  5  the task was refused: invalid, or its id or name is taken\n"
     "  6  busy: the task is running (run, delete), or s2sd is stopping\n"
     "  7  not permitted: the control socket is for root (or the admin "
-    "group)\n";
+    "group)\n"
+    "  8  run --dry-run: the dry run failed (why on standard error)\n";
 
 struct Command {
   const char* name;
@@ -349,6 +367,18 @@ bool TaskOption(int c, CtlOptions& o, bool& shares_given, bool& excludes_given,
     case kDisabled:
       ch["enabled"] = false;
       return true;
+    case kDeleteGuard:
+      if (!Flag("delete-guard", optarg, flag, error)) return false;
+      ch["delete_guard"] = flag;
+      return true;
+    case kGuardPercent:
+      if (!Number("delete-guard-percent", optarg, 100, n, error)) return false;
+      ch["delete_guard_percent"] = static_cast<unsigned int>(n);
+      return true;
+    case kGuardFiles:
+      if (!Number("delete-guard-files", optarg, ~0ULL, n, error)) return false;
+      ch["delete_guard_files"] = n;
+      return true;
   }
   return Fail(error, "unknown option");
 }
@@ -379,6 +409,12 @@ bool ParseCtlArgs(int argc, char** argv, CtlOptions& o, std::string& error) {
       case kLimit:
         if (!Number("limit", optarg, 1000, o.limit, error)) return false;
         limit_given = true;
+        break;
+      case kDryRun:
+        o.dry_run = true;
+        break;
+      case kConfirmDeletions:
+        o.confirm_deletions = true;
         break;
       case kPassword:
         return Fail(error,
@@ -431,6 +467,9 @@ bool ParseCtlArgs(int argc, char** argv, CtlOptions& o, std::string& error) {
   }
   if (limit_given && o.command != "history") {
     return Fail(error, "--limit is for history");
+  }
+  if ((o.dry_run || o.confirm_deletions) && o.command != "run") {
+    return Fail(error, "--dry-run and --confirm-deletions are for run");
   }
   if (o.command == "task edit" && o.changes.hasMember("id")) {
     return Fail(error, "task edit: a task's id does not change");

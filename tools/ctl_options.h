@@ -25,6 +25,7 @@ enum CtlExit : int {
   kCtlInvalidTask = 5,   // the task was refused (validation, id or name used)
   kCtlBusy = 6,          // the task is running (run, delete) or s2sd stops
   kCtlNotPermitted = 7,  // the socket or the daemon refused this user
+  kCtlDryRunFailed = 8,  // run --dry-run: the dry run itself failed
 };
 
 struct CtlOptions {
@@ -37,7 +38,9 @@ struct CtlOptions {
 
   std::string command;  // "task add", "task list", "run", "status", ...
   std::string target;   // TASK: an id or a name
-  unsigned long long limit = 0;  // history --limit; 0: the daemon's default
+  unsigned long long limit = 0;    // history --limit; 0: the daemon's default
+  bool dry_run = false;            // run --dry-run
+  bool confirm_deletions = false;  // run --confirm-deletions
 
   // Task options.
   std::string task_file;      // --task-file: s2s-client's [Task] file

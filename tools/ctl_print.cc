@@ -195,6 +195,11 @@ std::string FormatTask(const S2S::PObject& reply) {
       {"ssh", ssh},
       {"max bandwidth", Text(t["max_bandwidth"])},
       {"excludes", Join(t["excludes"])},
+      {"delete guard", t["delete_guard"].asBool()
+                           ? "deletions of more than " +
+                                 Text(t["delete_guard_percent"]) + " % or " +
+                                 Text(t["delete_guard_files"]) + " entries held"
+                           : "off"},
   };
   if (t.hasMember("schedule_error")) {
     rows.push_back({"schedule error", Text(t["schedule_error"])});
@@ -243,7 +248,8 @@ std::string FormatHistory(const S2S::PObject& reply) {
     const unsigned long long end = run["end"].asUInt64();
     const std::string took =
         end >= start && end != 0 ? Duration(end - start) : "running";
-    out += TimeText(start) + "  " + took + "  " + Text(run["trigger"]) + "  " +
+    out += TimeText(start) + "  " + took + "  " + Text(run["trigger"]) +
+           (run["dry_run"].asBool() ? " (dry run)" : "") + "  " +
            Text(run["outcome"]) + "  " + Text(run["message"]) + "\n";
     std::vector<Row> shares = {
         {"SHARE", "STEP", "RESULT", "FILES", "BYTES", "TIME"}};
@@ -255,6 +261,33 @@ std::string FormatHistory(const S2S::PObject& reply) {
                         Duration(s["seconds"].asUInt64())});
     }
     if (shares.size() > 1) out += Table(shares, "    ");
+  }
+  return out;
+}
+
+std::string FormatDryRun(const S2S::PObject& run) {
+  std::string out =
+      "dry run: " + Text(run["outcome"]) + ", " + Text(run["message"]) + "\n";
+  for (const S2S::PObject& s : run["shares"].asArray()) {
+    if (s["status"].asUInt64() != 0) {
+      out += "  " + Text(s["name"]) + ": " + Text(s["status_text"]) + "\n";
+      continue;
+    }
+    out += "  " + Text(s["name"]) + ": would send " + Text(s["would_send"]) +
+           ", delete " + Text(s["would_delete"]) + "\n";
+    for (const char* key : {"send_paths", "delete_paths"}) {
+      const char* sign = key[0] == 's' ? "+" : "-";
+      const S2S::PObject& paths = s[key];
+      for (const S2S::PObject& p : paths.asArray()) {
+        out += std::string("    ") + sign + " " + Text(p) + "\n";
+      }
+      unsigned long long count =
+          s[key[0] == 's' ? "would_send" : "would_delete"].asUInt64();
+      if (count > paths.asArray().size()) {
+        out += std::string("    ") + sign + " ... and " +
+               std::to_string(count - paths.asArray().size()) + " more\n";
+      }
+    }
   }
   return out;
 }

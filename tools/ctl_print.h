@@ -19,6 +19,9 @@ std::string FormatTask(const S2S::PObject& reply);
 std::string FormatStatus(const S2S::PObject& reply);
 // "history": a line per run, a line per share under it.
 std::string FormatHistory(const S2S::PObject& reply);
+// A dry run's run map (from "history"): per share what would be sent ("+")
+// and deleted ("-").
+std::string FormatDryRun(const S2S::PObject& run);
 
 // A task map's schedule in words ("daily at 02:00", "manual", ...).
 std::string ScheduleText(const S2S::PObject& task);

@@ -30,6 +30,9 @@ S2S::PObject TaskFileMap(const TaskSpec& spec, bool adding) {
   for (const std::string& rule : spec.excludes) {
     excludes.asArray().push_back(S2S::PObject(rule));
   }
+  map["delete_guard"] = spec.guard.on;
+  map["delete_guard_percent"] = spec.guard.percent;
+  map["delete_guard_files"] = spec.guard.files;
   if (!adding) {
     for (const char* key : kScheduleKeys) m.erase(key);
     m.erase("max_bandwidth");

@@ -16,6 +16,7 @@
 #include <unistd.h>
 
 #include <string>
+#include <vector>
 
 #include "S2S/logger.h"
 #include "cancel.h"
@@ -25,6 +26,7 @@
 #include "karo_root.h"
 #include "secret.h"
 #include "service/exit_codes.h"
+#include "service/share_transfer.h"
 #include "service/task_runner.h"
 #include "task_lock.h"
 
@@ -113,17 +115,32 @@ void ShowProgress(const std::string& share,
   }
 }
 
+// What a dry run found: "+ path" would be sent, "- path" deleted.
+void PrintListing(const char* sign, unsigned long long count,
+                  const std::vector<std::string>& paths) {
+  for (const std::string& p : paths) printf("    %s %s\n", sign, p.c_str());
+  if (count > paths.size()) {
+    printf("    %s ... and %llu more\n", sign, count - paths.size());
+  }
+}
+
 void PrintSummary(const TaskSpec& spec, const TaskOutcome& out) {
   size_t ok = 0;
   for (const ShareOutcome& s : out.shares) ok += s.ok ? 1 : 0;
   printf(
-      "summary: task %s, server %s, %zu/%zu shares synced, %d beacons, "
+      "summary: task %s, server %s, %zu/%zu shares %s, %d beacons, "
       "%.2f s, exit %d%s%s\n",
       spec.name.c_str(), out.server_ip.empty() ? "-" : out.server_ip.c_str(),
-      ok, spec.shares.size(), out.beacons, out.seconds, out.exit_code,
-      out.error.empty() ? "" : ": ", out.error.c_str());
+      ok, spec.shares.size(), out.dry_run ? "checked (dry run)" : "synced",
+      out.beacons, out.seconds, out.exit_code, out.error.empty() ? "" : ": ",
+      out.error.c_str());
   for (const ShareOutcome& s : out.shares) {
-    if (s.ok) {
+    if (s.ok && out.dry_run) {
+      printf("  %-20s %s\n", s.name.c_str(),
+             DryRunSummary(s, spec.guard).c_str());
+      PrintListing("+", s.stats.would_send, s.stats.send_paths);
+      PrintListing("-", s.stats.would_delete, s.stats.delete_paths);
+    } else if (s.ok) {
       printf(
           "  %-20s ok (%.2f s, %llu files and %s sent, %llu deleted, %s "
           "matched, %s/s)\n",
@@ -131,6 +148,8 @@ void PrintSummary(const TaskSpec& spec, const TaskOutcome& out) {
           Size(s.stats.literal_bytes).c_str(), s.stats.files_deleted,
           Size(s.stats.matched_bytes).c_str(),
           Size(s.stats.bytes_per_second).c_str());
+    } else if (s.failed_step == "guard") {
+      printf("  %-20s synced, %s\n", s.name.c_str(), s.cause.c_str());
     } else {
       printf("  %-20s FAILED at %s: %s\n", s.name.c_str(),
              s.failed_step.c_str(), s.cause.c_str());
@@ -193,8 +212,12 @@ int main(int argc, char** argv) {
   }
   S2S::SyncTask task = MakeSyncTask(o.spec, password);
   g_tty = isatty(STDOUT_FILENO) == 1;
-  TaskOutcome out =
-      RunTask(task, o.spec.excludes, o.beacon_interval, Print, ShowProgress);
+  RunOptions options;
+  options.dry_run = o.dry_run;
+  options.confirm_deletions = o.confirm_deletions;
+  options.guard = o.spec.guard;
+  TaskOutcome out = RunTask(task, o.spec.excludes, o.beacon_interval, Print,
+                            ShowProgress, options);
   if (g_live_line) fputs("\n", stdout);
   PrintSummary(o.spec, out);
   return out.exit_code;

@@ -8,6 +8,7 @@
 // code says what failed (ctl_options.h).
 #include <stdio.h>
 #include <stdlib.h>
+#include <time.h>
 
 #include <string>
 
@@ -112,6 +113,8 @@ bool BuildRequest(const CtlOptions& o, unsigned long long id,
   }
   if (!o.target.empty()) request["id"] = id;
   if (o.command == "history" && o.limit != 0) request["limit"] = o.limit;
+  if (o.dry_run) request["dry_run"] = true;
+  if (o.confirm_deletions) request["confirm_deletions"] = true;
   if (o.command == "task add" || o.command == "task edit") {
     std::string note, error;
     if (!BuildTaskMap(o, o.command == "task add", request["task"], note,
@@ -123,6 +126,46 @@ bool BuildRequest(const CtlOptions& o, unsigned long long id,
     if (!note.empty()) fprintf(stderr, "s2sctl: note: %s\n", note.c_str());
   }
   return true;
+}
+
+// Waits until the dry run that `run` started has ended, then shows it (the
+// task's newest run) and returns the exit code.
+int AwaitDryRun(const CtlOptions& o, const ControlClient& client,
+                unsigned long long id) {
+  S2S::PObject get, reply;
+  get["action"] = "get";
+  get["id"] = id;
+  int code = kCtlOk;
+  for (;;) {
+    if (!Call(client, get, reply, code)) return code;
+    if (reply["result"].asUInt64() != s2s_service::kResultOk) {
+      fprintf(stderr, "s2sctl: %s\n", reply["message"].asString().c_str());
+      return ExitFor(reply["result"].asUInt64());
+    }
+    const std::string state = reply["task"]["state"].asString();
+    if (state != "running" && state != "queued") break;
+    timespec pause = {0, 200 * 1000 * 1000};
+    nanosleep(&pause, nullptr);
+  }
+  S2S::PObject history;
+  history["action"] = "history";
+  history["id"] = id;
+  history["limit"] = 1ULL;
+  if (!Call(client, history, reply, code)) return code;
+  const S2S::PObject& answer = reply;  // const: an array is read by index
+  const S2S::PObject& run = answer["runs"][0u];
+  if (!run["dry_run"].asBool()) {
+    fprintf(stderr, "s2sctl: the dry run left no record\n");
+    return kCtlFailed;
+  }
+  if (o.json) {
+    printf("%s\n", ToJson(run, true).c_str());
+  } else {
+    fputs(FormatDryRun(run).c_str(), stdout);
+  }
+  if (run["outcome"].asString() == "ok") return kCtlOk;
+  fprintf(stderr, "s2sctl: %s\n", run["message"].asString().c_str());
+  return kCtlDryRunFailed;
 }
 
 void PrintHuman(const CtlOptions& o, const S2S::PObject& reply) {
@@ -180,6 +223,9 @@ int main(int argc, char** argv) {
   if (!BuildRequest(o, id, request, code)) return code;
   if (!Call(client, request, reply, code)) return code;
   const unsigned long long result = reply["result"].asUInt64();
+  if (o.dry_run && result == s2s_service::kResultOk) {
+    return AwaitDryRun(o, client, id);
+  }
   if (o.json) {
     printf("%s\n", ToJson(reply, true).c_str());
   } else if (result == s2s_service::kResultOk) {

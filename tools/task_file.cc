@@ -104,6 +104,14 @@ bool LoadTaskFile(const std::string& path, TaskSpec& spec, std::string& error) {
     } else if (key == "ssh_port") {
       ok = ParseNumber(value, kMaxPort, n);
       if (ok) spec.ssh_port = static_cast<unsigned int>(n);
+    } else if (key == "delete_guard") {
+      ok = ParseFlag(value, spec.guard.on);
+    } else if (key == "delete_guard_percent") {
+      ok = ParseNumber(value, 100, n);
+      if (ok) spec.guard.percent = static_cast<unsigned int>(n);
+    } else if (key == "delete_guard_files") {
+      ok = ParseNumber(value, ~0ULL, n);
+      if (ok) spec.guard.files = n;
     } else if (key == "password") {
       error = "task file " + path +
               ": passwords do not go in task files; use password_file";

@@ -18,6 +18,9 @@
 //   	delta="no"                yes/no: block-level (delta) transfer
 //   	ssh="no"                  yes/no: through SSH instead of the daemon
 //   	ssh_port="22"
+//   	delete_guard="yes"        yes/no: the mass-delete guard
+//   	delete_guard_percent="50" it holds back deletions of more than this
+//   	delete_guard_files="10000"  share of the server's copy or this many
 //
 // A "password" key is refused: passwords live in private files only.
 #ifndef S2S_TOOLS_TASK_FILE_H_
@@ -27,6 +30,7 @@
 #include <string>
 
 #include "S2S/sync_obj_task.h"
+#include "service/task_runner.h"
 
 namespace s2s_tools {
 
@@ -45,6 +49,7 @@ struct TaskSpec {
   bool delta = false;
   bool ssh = false;
   unsigned int ssh_port = 0;
+  s2s_service::DeleteGuard guard;
 };
 
 // Applies the keys of the [Task] section of `path` to `spec`. Returns true,

@@ -10,7 +10,11 @@
 //
 // Switches and the rsync options they become (a data transfer always runs
 // with -a -H, --sparse (runs of zeros become holes on the server),
-// --timeout, and --contimeout/--sockopts=TCP_NODELAY on a daemon socket):
+// --timeout, and --contimeout/--sockopts=TCP_NODELAY on a daemon socket;
+// into a share's module also --partial-dir=.s2s-partial, so that the part
+// of a file an interrupted transfer had sent stays on the server, in that
+// hidden directory beside the file, which rsync itself never sends back
+// nor deletes):
 //   setDelete(true)          --delete
 //   setNumericIds(true)      --numeric-ids
 //   setKaroAuth(use, req)    use: log in to the daemon as the user with the
@@ -52,6 +56,7 @@
 #include <list>
 #include <memory>
 #include <string>
+#include <vector>
 
 #if defined(KARO_RSYNC_BUILDING_LIBRARY)
 #define KARO_RSYNC_EXPORT __attribute__((visibility("default")))
@@ -107,6 +112,31 @@ class KARO_RSYNC_EXPORT RsyncWrapper {
     unsigned long long bytes_sent = 0;     // on the wire
     unsigned long long bytes_received = 0;
     double bytes_per_second = 0;
+    unsigned long long files_created = 0;      // new on the server
+    unsigned long long deletions_skipped = 0;  // held back (max_delete)
+    // A dry run's itemized changes: entries that would be created or whose
+    // data would be sent, and entries that would be deleted, with the
+    // first kListedPaths paths of each (directories end in "/").
+    static constexpr size_t kListedPaths = 20;
+    unsigned long long would_send = 0;
+    unsigned long long would_delete = 0;
+    std::vector<std::string> send_paths;
+    std::vector<std::string> delete_paths;
+  };
+  // How the calling thread's data transfers run beyond the switches: what
+  // the callers of an interface that has no place for it (a share's
+  // RunSync) set around the call.
+  struct TransferMode {
+    // --dry-run --itemize-changes: nothing changes on the server; what
+    // would be sent and deleted is counted in lastStats().
+    bool dry_run = false;
+    // >= 0: --max-delete=N; deletions past N are skipped and counted in
+    // lastStats().deletions_skipped, and the run still succeeds.
+    long long max_delete = -1;
+    // --no-whole-file whatever setDeltaCopy says: what an interrupted
+    // transfer left in the partial directory is then the basis of the
+    // file, and only the rest is sent (rsync ignores it with --whole-file).
+    bool resume = false;
   };
   using ProgressHandler = boost::function<void(const TransferProgress&)>;
 
@@ -177,10 +207,15 @@ class KARO_RSYNC_EXPORT RsyncWrapper {
   // on the thread runs with --info=progress2 --stats, reports each progress
   // line to it (on this thread, from within execute()) and leaves its final
   // figures in lastStats(). An empty handler switches this off again.
+  // Either way lastStats() starts empty.
   static void setThreadProgressHandler(const ProgressHandler& handler);
   // The --stats of the calling thread's last data transfer made with a
-  // progress handler; `complete` is false when rsync did not print them.
+  // progress handler or a transfer mode other than the default; `complete`
+  // is false when rsync did not print them.
   static TransferStats lastStats();
+  // The mode of the calling thread's data transfers from now on; a
+  // default TransferMode switches it off again.
+  static void setThreadTransferMode(const TransferMode& mode);
 
  private:
   std::unique_ptr<detail::RsyncSettings> settings_;
