@@ -105,7 +105,11 @@ PObject Daemon::TaskMap(unsigned long long id, const Task& task) {
         "computed)";
   }
   std::string state = "idle";
-  if (runs_.count(id) != 0) {
+  auto watching = realtime_.find(id);
+  if (watching != realtime_.end()) {
+    state = "watching";
+    if (watching->second.watcher->InFlight()) state = "pushing";
+  } else if (runs_.count(id) != 0) {
     state = "running";
   } else if (task.queued) {
     state = "queued";
@@ -128,6 +132,7 @@ bool Daemon::Store(const StoredTask& stored, std::string& error) {
     S2S::Logger::LogMsg(S2S::Logger::Error, "[ERROR] s2sd: %s\n",
                         ignored.c_str());
   }
+  SyncWatchers();
   return true;
 }
 
@@ -238,6 +243,7 @@ PObject Daemon::DoDelete(const PObject& request) {
   if (!store_.Remove(id, error)) return MakeReply(kResultInternal, error);
   queue_.erase(std::remove(queue_.begin(), queue_.end(), id), queue_.end());
   tasks_.erase(id);
+  StopWatching(id);
   scheduler_.Remove(id);
   history_.Remove(id);
   return Ok(Named(id, name) + " deleted");
@@ -276,6 +282,11 @@ PObject Daemon::DoRun(const PObject& request) {
     return MakeReply(kResultBusy, name + " is running already");
   }
   if (task->queued) return MakeReply(kResultBusy, name + " is queued already");
+  auto watching = realtime_.find(id);
+  if (watching != realtime_.end()) {
+    watching->second.watcher->FullSync(clock_.MonotonicSeconds());
+    return Ok(name + ": a full sync of every share is queued");
+  }
   scheduler_.CancelRetry(id);
   Queue(id, "manual");
   return Ok(name + (runs_.count(id) != 0 ? " started" : " queued"));
@@ -290,6 +301,12 @@ PObject Daemon::DoCancel(const PObject& request) {
   auto run = runs_.find(id);
   bool was_running = run != runs_.end();
   if (was_running) run->second->cancel.Set();
+  auto watching = realtime_.find(id);
+  if (watching != realtime_.end() && watching->second.watcher->InFlight()) {
+    // The batch's paths stay pending; the task goes on watching.
+    watching->second.session->Cancel();
+    was_running = true;
+  }
   if (task->queued) {
     queue_.erase(std::remove(queue_.begin(), queue_.end(), id), queue_.end());
     task->queued = false;
@@ -343,6 +360,12 @@ PObject Daemon::DoStatus(const PObject&) {
     next.push_back(n);
   }
   reply["next_runs"] = next;
+  PObject::Array realtime;
+  double mono = clock_.MonotonicSeconds();
+  for (const auto& it : realtime_) {
+    realtime.push_back(it.second.watcher->StatusMap(mono));
+  }
+  reply["realtime"] = realtime;
   return reply;
 }
 
