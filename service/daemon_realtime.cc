@@ -207,8 +207,11 @@ void Daemon::OnSessionDone(RealtimeSession* session, bool ended) {
     rt.watcher->CountRuns(r.runs);
     rt.watcher->Ended(r.ok, r.pushed, r.unpushed, r.error,
                       clock_.MonotonicSeconds(), clock_.WallSeconds());
+    PObject map = BatchMap(r, whole);
+    S2S::Logger::LogMsg(S2S::Logger::Info, "[INFO] s2sd: task %llu: %s\n",
+                        it.first, map["message"].asString().c_str());
     std::string error;
-    if (!history_.Finish(it.first, BatchMap(r, whole), error)) {
+    if (!history_.Finish(it.first, map, error)) {
       S2S::Logger::LogMsg(S2S::Logger::Error, "[ERROR] s2sd: %s\n",
                           error.c_str());
     }
