@@ -134,10 +134,13 @@ class RealtimeTest : public ::testing::TestWithParam<const char*> {
     bin_ = tmp_.Sub("bin");
     fs::create_directories(bin_);
     rsync_log_ = tmp_.Sub("rsync.log");
-    // Every rsync the service runs, one line each.
+    // Every rsync the service runs, one line each; none reaches the server
+    // while the file `unreachable_` exists.
+    unreachable_ = tmp_.Sub("unreachable");
     ASSERT_TRUE(s2s_test::WriteScript(
-        bin_ + "/rsync",
-        "echo \"$*\" >> " + rsync_log_ + "\nexec /usr/bin/rsync \"$@\"\n"));
+        bin_ + "/rsync", "[ -e " + unreachable_ +
+                             " ] && exit 10\necho \"$*\" >> " + rsync_log_ +
+                             "\nexec /usr/bin/rsync \"$@\"\n"));
     ASSERT_TRUE(
         WriteFile(ConfigPath(), "[Service]\n\tbeacon_interval=\"3600\"\n"));
     client_ = app_.ClientShare("docs");
@@ -284,7 +287,7 @@ class RealtimeTest : public ::testing::TestWithParam<const char*> {
 
   s2s_test::Appliances app_;
   s2s_test::TempDir tmp_;
-  std::string bin_, rsync_log_, client_, server_;
+  std::string bin_, rsync_log_, client_, server_, unreachable_;
   pid_t pid_ = -1;
 };
 
@@ -374,7 +377,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   EXPECT_TRUE(Request("status")["realtime"].asArray().empty());
 }
 
-TEST_P(RealtimeTest, OverflowAndWatchLimitEndWithTheServerEqual) {
+TEST_P(RealtimeTest, OverflowWatchLimitAndAnUnreachableServerEndEqual) {
   for (int d = 0; d < 10; ++d) {
     fs::create_directories(client_ + "/tree/d" + std::to_string(d) + "/e");
   }
@@ -405,6 +408,22 @@ TEST_P(RealtimeTest, OverflowAndWatchLimitEndWithTheServerEqual) {
   } else {
     EXPECT_EQ(1u, status["watches"].asUInt64());
   }
+
+  // The server unreachable: the change waits, and arrives once it answers.
+  WriteFile(unreachable_, "");
+  WriteFile(client_ + "/later.txt", "later\n");
+  EXPECT_TRUE(WaitFor(
+      [&] {
+        const PObject s = Status();
+        return s["state"].asString() == "retry_wait" &&
+               s["last_error"].asString().find("unreachable") !=
+                   std::string::npos &&
+               s["pending"].asUInt64() >= 1;
+      },
+      30))
+      << Log();
+  unlink(unreachable_.c_str());
+  EXPECT_LE(0, Arrival("/later.txt", "later\n", 30)) << Log();
 }
 
 INSTANTIATE_TEST_SUITE_P(Sources, RealtimeTest,
