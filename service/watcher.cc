@@ -64,7 +64,7 @@ void Watcher::Lose(Share& share, const std::string& why) {
       "share " + share.name + ": " + why + "; watching again when it is back");
 }
 
-bool Watcher::Watch(Share& share, double /*now*/) {
+bool Watcher::Watch(Share& share) {
   S2S::ShareInfo info;
   if (S2S::GetShareInfo(share.name, info) != 0) {
     Lose(share, "not a share of this appliance");
@@ -99,7 +99,7 @@ bool Watcher::Start(double now) {
   std::string why;
   if (task_.realtime.source != "inotify" && MakeSource(true, why)) {
     for (Share& share : shares_) {
-      if (Watch(share, now)) continue;
+      if (Watch(share)) continue;
       // A file system that cannot be marked: the task watches by
       // directories, all of its shares alike.
       why = share.message;
@@ -117,7 +117,7 @@ bool Watcher::Start(double now) {
     }
     for (Share& share : shares_) {
       share.message.clear();
-      Watch(share, now);
+      Watch(share);
     }
   }
   Log(S2S::Logger::Note,
@@ -184,7 +184,7 @@ void Watcher::Tick(double now) {
     for (Share& share : shares_) {
       struct stat st;
       if (!share.watching) {
-        Watch(share, now);
+        Watch(share);
       } else if (stat(share.path.c_str(), &st) != 0 || st.st_dev != share.dev ||
                  st.st_ino != share.ino) {
         Lose(share, "its directory " + share.path +

@@ -87,7 +87,7 @@ class Watcher {
   };
   bool MakeSource(bool fanotify, std::string& error);
   // False when the source refused an existing directory.
-  bool Watch(Share& share, double now);
+  bool Watch(Share& share);
   void Lose(Share& share, const std::string& why);
   void Feed(const std::vector<S2S::Event>& events, double now);
   double FullInterval() const;
