@@ -10,6 +10,7 @@
 #ifndef S2S_SERVICE_CONFIG_H_
 #define S2S_SERVICE_CONFIG_H_
 
+#include <stddef.h>
 #include <sys/types.h>
 
 #include <string>
@@ -21,6 +22,10 @@ struct DaemonConfig {
   bool has_admin_group = false;
   gid_t admin_gid = 0;
   unsigned int beacon_interval = 30;
+  // Limits below the kernel's for the realtime tasks' change sources, so
+  // that tests reach them (s2sd's options, not the settings file); 0 none.
+  size_t watch_queue_limit = 0;
+  size_t watch_limit = 0;
 };
 
 // Reads the settings file (a missing file means the defaults). True, or

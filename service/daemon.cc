@@ -181,6 +181,10 @@ void Daemon::Teardown() {
     if (it.second->thread.joinable()) it.second->thread.join();
   }
   runs_.clear();
+  std::vector<unsigned long long> watching;
+  for (const auto& it : realtime_) watching.push_back(it.first);
+  for (unsigned long long id : watching) StopWatching(id);
+  leaving_.clear();  // each one joins its thread
   for (int* fd :
        {&timer_fd_, &signal_fd_, &ended_fd_, &request_fd_, &zone_fd_}) {
     if (*fd >= 0) close(*fd);
@@ -195,13 +199,15 @@ void Daemon::Teardown() {
 
 void Daemon::Loop() {
   ArmTimer();
-  pollfd fds[5] = {{timer_fd_, POLLIN, 0},
-                   {signal_fd_, POLLIN, 0},
-                   {ended_fd_, POLLIN, 0},
-                   {request_fd_, POLLIN, 0},
-                   {zone_fd_, POLLIN, 0}};
-  while (!(stopping_ && runs_.empty())) {
-    if (poll(fds, 5, -1) < 0) {
+  std::vector<pollfd> fds;
+  while (!(stopping_ && runs_.empty() && leaving_.empty())) {
+    fds = {{timer_fd_, POLLIN, 0},
+           {signal_fd_, POLLIN, 0},
+           {ended_fd_, POLLIN, 0},
+           {request_fd_, POLLIN, 0},
+           {zone_fd_, POLLIN, 0}};
+    WatchFds(fds);
+    if (poll(fds.data(), fds.size(), WatchTimeout()) < 0) {
       if (errno == EINTR) continue;
       LogError(std::string("poll: ") + strerror(errno));
       return;
@@ -211,6 +217,7 @@ void Daemon::Loop() {
     if (fds[3].revents != 0) OnRequests();
     if (fds[4].revents != 0) OnZoneChange();
     if (fds[0].revents != 0) OnTimer();
+    OnWatchers(fds.data() + 5, fds.size() - 5);
   }
   LogInfo("stopped");
 }
@@ -289,6 +296,7 @@ void Daemon::OnSignal() {
                           runs_.size());
     }
     stopping_ = true;
+    SyncWatchers();
     for (auto& it : runs_) it.second->cancel.Set();
     for (unsigned long long id : queue_) tasks_[id].queued = false;
     queue_.clear();
@@ -320,6 +328,7 @@ void Daemon::Reload(std::vector<std::string>& errors) {
   }
   LogInfo(std::to_string(tasks_.size()) + " tasks loaded, " +
           std::to_string(errors.size()) + " refused");
+  SyncWatchers();
 }
 
 void Daemon::CatchUp() {
@@ -328,8 +337,12 @@ void Daemon::CatchUp() {
     std::string error;
     // A task that never recorded a slot (its file was written by hand) has
     // nothing to catch up.
+    // A realtime task's start-up full sync covers the time it was down.
     long last = history_.LastDue(it.first);
-    if (last <= 0 || !it.second.stored.enabled) continue;
+    if (last <= 0 || !it.second.stored.enabled ||
+        realtime_.count(it.first) != 0) {
+      continue;
+    }
     long missed =
         it.second.stored.task.GetInfo().GetSchedule().GetNextScheduledSeconds(
             last);
@@ -343,7 +356,7 @@ bool Daemon::Queue(unsigned long long id, const std::string& trigger,
                    const RunOptions& options) {
   auto it = tasks_.find(id);
   if (stopping_ || it == tasks_.end() || it->second.queued ||
-      runs_.count(id) != 0) {
+      runs_.count(id) != 0 || realtime_.count(id) != 0) {
     return false;
   }
   it->second.queued = true;
@@ -354,27 +367,14 @@ bool Daemon::Queue(unsigned long long id, const std::string& trigger,
   return true;
 }
 
-bool Daemon::SharesFree(const Task& task) const {
-  for (const auto& it : runs_) {
-    for (const std::string& busy :
-         it.second->task.task.GetInfo().GetShareList()) {
-      const std::list<std::string>& mine =
-          task.stored.task.GetInfo().GetShareList();
-      if (std::find(mine.begin(), mine.end(), busy) != mine.end()) {
-        return false;
-      }
-    }
-  }
-  return true;
-}
-
 void Daemon::StartQueued() {
   for (auto q = queue_.begin();
-       q != queue_.end() && runs_.size() < config_.max_parallel;) {
+       q != queue_.end() &&
+       runs_.size() + BatchesInFlight() < config_.max_parallel;) {
     auto it = tasks_.find(*q);
     if (it == tasks_.end()) {
       q = queue_.erase(q);
-    } else if (SharesFree(it->second)) {
+    } else if (SharesFree(it->second.stored.task.GetInfo().GetShareList())) {
       unsigned long long id = *q;
       q = queue_.erase(q);
       it->second.queued = false;
@@ -408,26 +408,30 @@ PObject Daemon::RunMap(const ActiveRun& run, bool ended) const {
   map["task_result"] = ended ? out.exit_code : 0;
   PObject::Array shares;
   for (const ShareOutcome& s : out.shares) {
-    PObject share;
-    share = PObject::Map();
-    share["name"] = s.name;
-    share["step"] = !s.ok ? s.failed_step : out.dry_run ? "transfer" : "finish";
-    share["status"] = s.status;
-    share["status_text"] = s.ok ? StatusText(0) : s.cause;
-    share["seconds"] = static_cast<unsigned long long>(s.seconds + 0.5);
-    // rsync's own figures of the transfer.
-    share["files"] = s.stats.files_transferred;
-    share["bytes"] = s.stats.literal_bytes;
-    share["deleted"] = s.stats.files_deleted;
-    share["matched"] = s.stats.matched_bytes;
-    share["sent"] = s.stats.bytes_sent;
-    share["speed"] =
-        static_cast<unsigned long long>(s.stats.bytes_per_second + 0.5);
-    if (out.dry_run) AddListing(s.stats, share);
-    shares.push_back(share);
+    shares.push_back(ShareMap(s, out.dry_run));
   }
   map["shares"] = shares;
   return map;
+}
+
+PObject Daemon::ShareMap(const ShareOutcome& s, bool dry_run) {
+  PObject share;
+  share = PObject::Map();
+  share["name"] = s.name;
+  share["step"] = !s.ok ? s.failed_step : dry_run ? "transfer" : "finish";
+  share["status"] = s.status;
+  share["status_text"] = s.ok ? StatusText(0) : s.cause;
+  share["seconds"] = static_cast<unsigned long long>(s.seconds + 0.5);
+  // rsync's own figures of the transfer.
+  share["files"] = s.stats.files_transferred;
+  share["bytes"] = s.stats.literal_bytes;
+  share["deleted"] = s.stats.files_deleted;
+  share["matched"] = s.stats.matched_bytes;
+  share["sent"] = s.stats.bytes_sent;
+  share["speed"] =
+      static_cast<unsigned long long>(s.stats.bytes_per_second + 0.5);
+  if (dry_run) AddListing(s.stats, share);
+  return share;
 }
 
 void Daemon::Start(unsigned long long id, const std::string& trigger) {
@@ -458,11 +462,14 @@ void Daemon::Start(unsigned long long id, const std::string& trigger) {
 void Daemon::OnRunsEnded() {
   Drain(ended_fd_);
   std::vector<unsigned long long> ended;
+  std::vector<std::pair<RealtimeSession*, bool>> sessions;
   {
     std::lock_guard<std::mutex> lock(mu_);
     ended.swap(ended_);
+    sessions.swap(sessions_done_);
   }
   for (unsigned long long id : ended) Finish(id);
+  for (const auto& s : sessions) OnSessionDone(s.first, s.second);
   StartQueued();
   ArmTimer();
 }

@@ -19,6 +19,8 @@
 #ifndef S2S_SERVICE_DAEMON_H_
 #define S2S_SERVICE_DAEMON_H_
 
+#include <poll.h>
+
 #include <condition_variable>
 #include <deque>
 #include <map>
@@ -32,10 +34,12 @@
 #include "service/config.h"
 #include "service/control_server.h"
 #include "service/history.h"
+#include "service/realtime_session.h"
 #include "service/run_worker.h"
 #include "service/scheduler.h"
 #include "service/session.h"
 #include "service/task_store.h"
+#include "service/watcher.h"
 
 namespace s2s_service {
 
@@ -63,6 +67,13 @@ class Daemon {
     bool done = false;
   };
   using Action = S2S::PObject (Daemon::*)(const S2S::PObject& request);
+  // An enabled realtime task: its watcher on the loop, its session (a
+  // thread) toward the server, and the batch it pushes.
+  struct Realtime {
+    std::unique_ptr<Watcher> watcher;
+    std::unique_ptr<RealtimeSession> session;
+    std::vector<S2S::Event> batch;  // in flight
+  };
 
   bool Setup();
   void Teardown();
@@ -81,10 +92,29 @@ class Daemon {
   bool Queue(unsigned long long id, const std::string& trigger,
              const RunOptions& options = RunOptions());
   void StartQueued();
-  bool SharesFree(const Task& task) const;
+  // Whether no run and no batch holds any of `shares`.
+  bool SharesFree(const std::list<std::string>& shares) const;
   void Start(unsigned long long id, const std::string& trigger);
   void Finish(unsigned long long id);
   S2S::PObject RunMap(const ActiveRun& run, bool ended) const;
+
+  // Realtime tasks (daemon_realtime.cc). Watchers follow the tasks: an
+  // enabled realtime task watches, anything else does not.
+  void SyncWatchers();
+  void StartWatching(unsigned long long id);
+  void StopWatching(unsigned long long id);
+  // Poll entries for the watchers' descriptors, appended to `fds`.
+  void WatchFds(std::vector<pollfd>& fds) const;
+  // Milliseconds until a watcher is due; 0 when one has set-up work; -1
+  // when none is due ever.
+  int WatchTimeout() const;
+  void OnWatchers(const pollfd* fds, size_t n);
+  void StartBatches();
+  void OnSessionDone(RealtimeSession* session, bool ended);
+  size_t BatchesInFlight() const;
+  S2S::PObject BatchMap(const BatchResult& r, bool whole) const;
+  // A share's entry of a run map.
+  static S2S::PObject ShareMap(const ShareOutcome& share, bool dry_run = false);
 
   // The control thread's entry: hands the request to the loop and waits.
   S2S::PObject Handle(const S2S::PObject& request);
@@ -118,6 +148,9 @@ class Daemon {
   std::deque<unsigned long long> queue_;  // waiting for a slot or a share
   SessionCache sessions_;  // each task's probe and pairing, for its next run
   std::map<unsigned long long, std::shared_ptr<ActiveRun>> runs_;
+  std::map<unsigned long long, Realtime> realtime_;
+  // Sessions told to stop; each is joined once it says it has ended.
+  std::vector<std::unique_ptr<RealtimeSession>> leaving_;
   bool stopping_ = false;
   ControlServer control_;
 
@@ -128,6 +161,7 @@ class Daemon {
   int zone_fd_ = -1;     // inotify on /etc: the local time zone changed
   std::mutex mu_;        // guards the members below and each Pending
   std::vector<unsigned long long> ended_;
+  std::vector<std::pair<RealtimeSession*, bool>> sessions_done_;
   std::deque<Pending*> requests_;
   bool closed_ = false;  // the loop answers no more requests
   std::condition_variable answered_;

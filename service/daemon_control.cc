@@ -105,7 +105,11 @@ PObject Daemon::TaskMap(unsigned long long id, const Task& task) {
         "computed)";
   }
   std::string state = "idle";
-  if (runs_.count(id) != 0) {
+  auto watching = realtime_.find(id);
+  if (watching != realtime_.end()) {
+    state = "watching";
+    if (watching->second.watcher->InFlight()) state = "pushing";
+  } else if (runs_.count(id) != 0) {
     state = "running";
   } else if (task.queued) {
     state = "queued";
@@ -128,6 +132,7 @@ bool Daemon::Store(const StoredTask& stored, std::string& error) {
     S2S::Logger::LogMsg(S2S::Logger::Error, "[ERROR] s2sd: %s\n",
                         ignored.c_str());
   }
+  SyncWatchers();
   return true;
 }
 
@@ -239,6 +244,7 @@ PObject Daemon::DoDelete(const PObject& request) {
   if (!store_.Remove(id, error)) return MakeReply(kResultInternal, error);
   queue_.erase(std::remove(queue_.begin(), queue_.end(), id), queue_.end());
   tasks_.erase(id);
+  StopWatching(id);
   scheduler_.Remove(id);
   sessions_.Drop(id);
   history_.Remove(id);
@@ -287,6 +293,17 @@ PObject Daemon::DoRun(const PObject& request) {
   }
   options.dry_run = request["dry_run"].asBool();
   options.confirm_deletions = request["confirm_deletions"].asBool();
+  auto watching = realtime_.find(id);
+  if (watching != realtime_.end()) {
+    if (options.dry_run) {
+      return MakeReply(kResultBusy,
+                       name +
+                           " is watching its shares; a dry run needs it "
+                           "stopped (disable it first)");
+    }
+    watching->second.watcher->FullSync(clock_.MonotonicSeconds());
+    return Ok(name + ": a full sync of every share is queued");
+  }
   // A dry run does not stand in for the retry that a failed run awaits.
   if (!options.dry_run) scheduler_.CancelRetry(id);
   Queue(id, "manual", options);
@@ -303,6 +320,12 @@ PObject Daemon::DoCancel(const PObject& request) {
   auto run = runs_.find(id);
   bool was_running = run != runs_.end();
   if (was_running) run->second->cancel.Set();
+  auto watching = realtime_.find(id);
+  if (watching != realtime_.end() && watching->second.watcher->InFlight()) {
+    // The batch's paths stay pending; the task goes on watching.
+    watching->second.session->Cancel();
+    was_running = true;
+  }
   if (task->queued) {
     queue_.erase(std::remove(queue_.begin(), queue_.end(), id), queue_.end());
     task->queued = false;
@@ -357,6 +380,12 @@ PObject Daemon::DoStatus(const PObject&) {
     next.push_back(n);
   }
   reply["next_runs"] = next;
+  PObject::Array realtime;
+  double mono = clock_.MonotonicSeconds();
+  for (const auto& it : realtime_) {
+    realtime.push_back(it.second.watcher->StatusMap(mono));
+  }
+  reply["realtime"] = realtime;
   return reply;
 }
 

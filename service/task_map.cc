@@ -16,7 +16,8 @@ enum Kind { kUInt, kInt, kBool, kText, kTextList, kIgnored };
 struct Key {
   const char* name;
   Kind kind;
-  size_t max;  // bytes of a string, entries of a list
+  size_t max;      // bytes of a string, entries of a list; largest number
+  size_t min = 0;  // smallest number
 };
 
 // Share names and exclude rules are checked one by one below.
@@ -48,6 +49,11 @@ const Key kKeys[] = {
     {"delete_guard", kBool, 0},
     {"delete_guard_percent", kUInt, 100},
     {"delete_guard_files", kUInt, 0},
+    {"realtime_settle_ms", kUInt, 600000},
+    {"realtime_max_delay", kUInt, 86400, 1},
+    {"realtime_full_sync", kUInt, 30 * 86400, 1},
+    {"realtime_pending_limit", kUInt, 10000000, 1},
+    {"realtime_source", kText, 16},
     {"has_password", kIgnored, 0},
     {"next_run", kIgnored, 0},
     {"schedule_error", kIgnored, 0},
@@ -88,7 +94,7 @@ bool CheckValue(const Key& k, const PObject& v) {
   switch (k.kind) {
     case kUInt:
       if (k.max == 0) return v.isInteger();
-      return v.isInteger() && v.asUInt64() <= k.max;
+      return v.isInteger() && v.asUInt64() <= k.max && v.asUInt64() >= k.min;
     case kInt: {
       long long n = v.asInt64();
       return v.isInteger() && n >= INT32_MIN && n <= INT32_MAX;
@@ -100,6 +106,10 @@ bool CheckValue(const Key& k, const PObject& v) {
       if (std::string(k.name) == "name") {
         return !v.asStringRef().empty() &&
                Printable(v.asStringRef(), "/\\[]\"");
+      }
+      if (std::string(k.name) == "realtime_source") {
+        const std::string& s = v.asStringRef();
+        return s == "auto" || s == "fanotify" || s == "inotify";
       }
       return !HasLineBreak(v.asStringRef());
     case kTextList:
@@ -174,6 +184,12 @@ bool ApplyTaskMap(const PObject& in, StoredTask& task, std::string& error) {
   out.guard.percent =
       static_cast<unsigned int>(merged["delete_guard_percent"].asUInt64());
   out.guard.files = merged["delete_guard_files"].asUInt64();
+  RealtimeSettings& rt = out.realtime;
+  rt.settle_ms = merged["realtime_settle_ms"].asUInt32();
+  rt.max_delay = merged["realtime_max_delay"].asUInt32();
+  rt.full_sync = merged["realtime_full_sync"].asUInt32();
+  rt.pending_limit = merged["realtime_pending_limit"].asUInt32();
+  rt.source = merged["realtime_source"].asString();
   task = out;
   return true;
 }
@@ -194,6 +210,11 @@ PObject TaskToMap(const StoredTask& task, bool with_password) {
   map["delete_guard"] = task.guard.on;
   map["delete_guard_percent"] = task.guard.percent;
   map["delete_guard_files"] = task.guard.files;
+  map["realtime_settle_ms"] = task.realtime.settle_ms;
+  map["realtime_max_delay"] = task.realtime.max_delay;
+  map["realtime_full_sync"] = task.realtime.full_sync;
+  map["realtime_pending_limit"] = task.realtime.pending_limit;
+  map["realtime_source"] = task.realtime.source;
   return map;
 }
 

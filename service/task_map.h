@@ -1,12 +1,13 @@
 // A task as the service keeps it, and its flat map.
 //
 // A StoredTask is the library's SyncTask plus the service's own settings
-// (enabled, excludes, the mass-delete guard). It crosses the control socket
-// and lies in its file as the flat map of the sync-object mapping
-// (SyncTask2PObj's keys) with "enabled", "excludes", "delete_guard",
-// "delete_guard_percent" and "delete_guard_files" beside them. Every key of an
-// incoming map is checked against one table (kind and size) before anything is
-// applied, so a bad map changes nothing.
+// (enabled, excludes, the mass-delete guard, the realtime settings). It
+// crosses the control socket and lies in its file as the flat map of the
+// sync-object mapping (SyncTask2PObj's keys) with "enabled", "excludes",
+// "delete_guard", "delete_guard_percent", "delete_guard_files" and the
+// realtime settings ("realtime_*") beside them. Every key of an incoming map
+// is checked against one table (kind and size) before anything is applied,
+// so a bad map changes nothing.
 #ifndef S2S_SERVICE_TASK_MAP_H_
 #define S2S_SERVICE_TASK_MAP_H_
 
@@ -19,11 +20,27 @@
 
 namespace s2s_service {
 
+// How a realtime task (schedule mode realtime) turns changes into syncs.
+struct RealtimeSettings {
+  unsigned int settle_ms = 2000;       // quiet after the last change
+  unsigned int max_delay = 30;         // s: longest wait under constant change
+  unsigned int full_sync = 3600;       // s between full syncs of every share
+  unsigned int pending_limit = 10000;  // paths per share before a full sync
+  std::string source = "auto";         // "auto", "fanotify", "inotify"
+  bool operator==(const RealtimeSettings& o) const {
+    return settle_ms == o.settle_ms && max_delay == o.max_delay &&
+           full_sync == o.full_sync && pending_limit == o.pending_limit &&
+           source == o.source;
+  }
+  bool operator!=(const RealtimeSettings& o) const { return !(*this == o); }
+};
+
 struct StoredTask {
   S2S::SyncTask task;
   bool enabled = true;
   std::list<std::string> excludes;
   DeleteGuard guard;
+  RealtimeSettings realtime;
 };
 
 // Lays the keys of `in` over `task`: only keys present change, "pswd"

@@ -45,6 +45,11 @@ enum Option {
   kGuardFiles,
   kDryRun,
   kConfirmDeletions,
+  kSettle,
+  kMaxDelay,
+  kFullSync,
+  kPendingLimit,
+  kChangeSource,
 };
 
 const struct option kOptions[] = {
@@ -82,6 +87,11 @@ const struct option kOptions[] = {
     {"delete-guard-files", required_argument, nullptr, kGuardFiles},
     {"dry-run", no_argument, nullptr, kDryRun},
     {"confirm-deletions", no_argument, nullptr, kConfirmDeletions},
+    {"settle", required_argument, nullptr, kSettle},
+    {"max-delay", required_argument, nullptr, kMaxDelay},
+    {"full-sync-every", required_argument, nullptr, kFullSync},
+    {"pending-limit", required_argument, nullptr, kPendingLimit},
+    {"change-source", required_argument, nullptr, kChangeSource},
     {"verbose", no_argument, nullptr, 'v'},
     {"help", no_argument, nullptr, 'h'},
     {"version", no_argument, nullptr, 'V'},
@@ -149,6 +159,17 @@ const char kUsage[] =
     "                         --delete-guard-percent P (50) % of the\n"
     "                         server's copy or --delete-guard-files N\n"
     "                         (10000) entries, whichever is fewer\n"
+    "\n"
+    "Realtime tasks (--schedule realtime) watch their shares and push each\n"
+    "change:\n"
+    "  --settle SEC           quiet after the last change before a push\n"
+    "                         (default 2; decimals, e.g. 0.2)\n"
+    "  --max-delay SEC        longest wait under constant change (default 30)\n"
+    "  --full-sync-every SEC  full sync of every share (default 3600)\n"
+    "  --pending-limit N      pending paths per share before a full sync\n"
+    "                         instead (default 10000)\n"
+    "  --change-source SRC    auto (fanotify where it works, else inotify),\n"
+    "                         fanotify or inotify\n"
     "\n"
     "Exit codes:\n"
     "  0  done\n"
@@ -244,6 +265,25 @@ bool Days(const std::string& text, std::string& week, std::string& error) {
     week[static_cast<size_t>(i)] = '1';
     start = comma + 1;
   }
+  return true;
+}
+
+// Seconds with up to three decimals, as milliseconds.
+bool Millis(const char* option, const std::string& text, unsigned long long max,
+            unsigned long long& ms, std::string& error) {
+  size_t dot = text.find('.');
+  std::string whole = text.substr(0, dot);
+  std::string part = dot == std::string::npos ? "" : text.substr(dot + 1);
+  unsigned long long s = 0, f = 0;
+  if ((whole.empty() && part.empty()) || part.size() > 3 ||
+      (!whole.empty() && !ParseNumber(whole, max / 1000, s)) ||
+      (!part.empty() && !ParseNumber(part, 999, f))) {
+    return Fail(error, std::string("bad value for --") + option + ": " + text +
+                           " (seconds, at most three decimals)");
+  }
+  for (size_t digits = part.size(); digits < 3; ++digits) f *= 10;
+  ms = s * 1000 + f;
+  if (ms > max) return Fail(error, std::string("--") + option + " too large");
   return true;
 }
 
@@ -378,6 +418,32 @@ bool TaskOption(int c, CtlOptions& o, bool& shares_given, bool& excludes_given,
     case kGuardFiles:
       if (!Number("delete-guard-files", optarg, ~0ULL, n, error)) return false;
       ch["delete_guard_files"] = n;
+      return true;
+    case kSettle:
+      if (!Millis("settle", optarg, 600000, n, error)) return false;
+      ch["realtime_settle_ms"] = static_cast<unsigned int>(n);
+      return true;
+    case kMaxDelay:
+      if (!Number("max-delay", optarg, 86400, n, error)) return false;
+      ch["realtime_max_delay"] = static_cast<unsigned int>(n);
+      return true;
+    case kFullSync:
+      if (!Number("full-sync-every", optarg, 30 * 86400, n, error)) {
+        return false;
+      }
+      ch["realtime_full_sync"] = static_cast<unsigned int>(n);
+      return true;
+    case kPendingLimit:
+      if (!Number("pending-limit", optarg, 10000000, n, error)) return false;
+      ch["realtime_pending_limit"] = static_cast<unsigned int>(n);
+      return true;
+    case kChangeSource:
+      if (std::string(optarg) != "auto" && std::string(optarg) != "fanotify" &&
+          std::string(optarg) != "inotify") {
+        return Fail(error, std::string("bad value for --change-source: ") +
+                               optarg + " (auto, fanotify, inotify)");
+      }
+      ch["realtime_source"] = optarg;
       return true;
   }
   return Fail(error, "unknown option");

@@ -49,6 +49,12 @@ std::string Duration(unsigned long long s) {
   return buf;
 }
 
+std::string Millis(unsigned long long ms) {
+  char buf[32];
+  snprintf(buf, sizeof buf, "%.1f s", static_cast<double>(ms) / 1000);
+  return buf;
+}
+
 std::string Bytes(unsigned long long n) {
   static const char* const kUnits[] = {"KiB", "MiB", "GiB", "TiB"};
   if (n < 1024) return std::to_string(n) + " B";
@@ -204,6 +210,14 @@ std::string FormatTask(const S2S::PObject& reply) {
   if (t.hasMember("schedule_error")) {
     rows.push_back({"schedule error", Text(t["schedule_error"])});
   }
+  if (t["schedule_mode"].asInt32() == 1) {
+    rows.push_back({"change source", Text(t["realtime_source"])});
+    rows.push_back({"settle", Millis(t["realtime_settle_ms"].asUInt64())});
+    rows.push_back({"max delay", Text(t["realtime_max_delay"]) + " s"});
+    rows.push_back(
+        {"full sync every", Duration(t["realtime_full_sync"].asUInt64())});
+    rows.push_back({"pending limit", Text(t["realtime_pending_limit"])});
+  }
   // Key lines without the header row.
   std::string table = Table(rows, "");
   return table.substr(table.find('\n') + 1);
@@ -235,8 +249,35 @@ std::string FormatStatus(const S2S::PObject& reply) {
     next.push_back(
         {Text(n["id"]), Text(n["name"]), TimeText(n["next"].asUInt64())});
   }
-  return out + "running:\n" + Table(running, "  ") + "next runs:\n" +
-         Table(next, "  ");
+  out +=
+      "running:\n" + Table(running, "  ") + "next runs:\n" + Table(next, "  ");
+  if (!reply["realtime"].isArray()) return out;
+  std::vector<Row> watching = {{"ID", "NAME", "SOURCE", "STATE", "PENDING",
+                                "LAST BATCH", "LAG", "EVENTS", "BATCHES",
+                                "RSYNC RUNS", "FAILED"}};
+  std::string notes;
+  for (const S2S::PObject& w : reply["realtime"].asArray()) {
+    watching.push_back(
+        {Text(w["id"]), Text(w["name"]), Text(w["source"]), Text(w["state"]),
+         Text(w["pending"]), TimeText(w["last_batch"].asUInt64()),
+         Millis(w["last_lag_ms"].asUInt64()), Text(w["events"]),
+         Text(w["batches"]), Text(w["rsync_runs"]), Text(w["failures"])});
+    std::string who = "  task " + Text(w["id"]) + ": ";
+    if (!w["source_note"].isEmpty()) {
+      notes += who + "not fanotify: " + Text(w["source_note"]) + "\n";
+    }
+    if (!w["problem"].isEmpty()) notes += who + Text(w["problem"]) + "\n";
+    if (!w["last_error"].isEmpty()) {
+      notes += who + "last batch failed: " + Text(w["last_error"]) + "\n";
+    }
+    for (const S2S::PObject& s : w["shares"].asArray()) {
+      if (!s["watching"].asBool()) {
+        notes += who + "share " + Text(s["name"]) +
+                 " not watched: " + Text(s["message"]) + "\n";
+      }
+    }
+  }
+  return out + "realtime:\n" + Table(watching, "  ") + notes;
 }
 
 std::string FormatHistory(const S2S::PObject& reply) {

@@ -4,8 +4,8 @@
 # port; the client syncs three shares of sample data to it, changes them and
 # syncs again; each copy is checked with diff -r. Then the client service
 # s2sd runs on the client root: a task added with s2sctl runs by itself at
-# the next full minute, another is run on demand, and status and history
-# show what happened. Everything started here is stopped by its own pid and
+# the next full minute, another is run on demand, a realtime task pushes
+# each change within seconds, and status and history show what happened. Everything started here is stopped by its own pid and
 # the directory is removed, also on failure.
 #
 #   tools/demo.sh [BUILD_DIR]     (default: build/ beside tools/)
@@ -185,6 +185,30 @@ ctl task add --task on-demand --server-ip 127.0.0.1 --user s2s \
   --password-file "$work/password" --share projects
 ctl run on-demand
 await_run on-demand 60
+verify
+
+step "a realtime task: each change of docs reaches the server within seconds"
+ctl task add --task live --server-ip 127.0.0.1 --user s2s \
+  --password-file "$work/password" --share docs --schedule realtime \
+  --settle 0.5
+# Waits (at most $2 seconds) until test $1 holds.
+await() {
+  local i
+  for i in $(seq $(($2 * 10))); do
+    if eval "$1"; then echo "  after $(((i - 1) / 10)).$(((i - 1) % 10)) s"; return 0; fi
+    sleep 0.1
+  done
+  echo "demo: no sign of [$1] within $2 s" >&2
+  cat "$work/s2sd.log" >&2
+  return 1
+}
+await 'ctl --json status | grep -q "\"state\": \"watching\""' 30
+echo "Written while the task watches." >"$d/docs/live.txt"
+echo "docs/live.txt written on the client"
+await 'cmp -s "$d/docs/live.txt" "$server/volume1/docs/live.txt"' 20
+rm "$d/docs/README.txt"
+echo "docs/README.txt deleted on the client"
+await '[ ! -e "$server/volume1/docs/README.txt" ]' 20
 verify
 
 step "service status, a task as scripts see it (no password in it)"

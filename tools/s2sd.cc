@@ -33,6 +33,10 @@ const char kUsage[] =
     "  --clock-offset S, --clock-rate R\n"
     "                 schedules see the wall clock as system time * R + S\n"
     "                 (for tests and benchmarks; default 0 and 1)\n"
+    "  --watch-queue-limit N, --watch-limit N\n"
+    "                 realtime tasks count more than N events per wake-up\n"
+    "                 as an overflow, and place at most N inotify watches\n"
+    "                 each (for tests; default 0: the kernel's limits)\n"
     "  --help, --version  this text; the version\n"
     "\n"
     "Settings: <root>/etc/s2s/s2sd.conf, section [Service]: max_parallel,\n"
@@ -54,6 +58,7 @@ void WrapperLog(int priority, const char* message) {
 int main(int argc, char** argv) {
   std::string root, log = "syslog";
   long clock_offset = 0, clock_rate = 1;
+  long queue_limit = 0, watch_limit = 0;
   for (int i = 1; i < argc; ++i) {
     std::string a = argv[i];
     std::string value;
@@ -62,21 +67,27 @@ int main(int argc, char** argv) {
       value = a.substr(eq + 1);
       a = a.substr(0, eq);
     } else if (a == "--root" || a == "--log" || a == "--clock-offset" ||
-               a == "--clock-rate") {
+               a == "--clock-rate" || a == "--watch-queue-limit" ||
+               a == "--watch-limit") {
       if (i + 1 == argc) {
         fprintf(stderr, "s2sd: %s needs a value\n", a.c_str());
         return 2;
       }
       value = argv[++i];
     }
-    if (a == "--clock-offset" || a == "--clock-rate") {
+    if (a == "--clock-offset" || a == "--clock-rate" ||
+        a == "--watch-queue-limit" || a == "--watch-limit") {
       char* end = nullptr;
       long n = strtol(value.c_str(), &end, 10);
-      if (value.empty() || *end != '\0' || (a == "--clock-rate" && n < 1)) {
+      if (value.empty() || *end != '\0' ||
+          (a != "--clock-offset" && n < (a == "--clock-rate" ? 1 : 0))) {
         fprintf(stderr, "s2sd: %s needs a number\n", a.c_str());
         return 2;
       }
-      (a == "--clock-offset" ? clock_offset : clock_rate) = n;
+      if (a == "--clock-offset") clock_offset = n;
+      if (a == "--clock-rate") clock_rate = n;
+      if (a == "--watch-queue-limit") queue_limit = n;
+      if (a == "--watch-limit") watch_limit = n;
     } else if (a == "--foreground") {
     } else if (a == "--root") {
       root = value;
@@ -122,6 +133,8 @@ int main(int argc, char** argv) {
                         error.c_str());
     return 1;
   }
+  config.watch_queue_limit = static_cast<size_t>(queue_limit);
+  config.watch_limit = static_cast<size_t>(watch_limit);
   s2s_service::ShiftedClock clock(clock_offset, clock_rate);
   s2s_service::Daemon daemon(config, clock);
   return daemon.Run();

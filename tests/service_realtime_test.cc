@@ -1,0 +1,435 @@
+// Realtime tasks: the batcher's coalescing through its clock seam, and s2sd
+// watching real shares with each change source and pushing to a real
+// server daemon.
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <filesystem>
+#include <functional>
+#include <string>
+#include <thread>
+#include <tuple>
+#include <vector>
+
+#include "S2S/ipc.h"
+#include "S2S/sync_obj_pobject.h"
+#include "appliances.h"
+#include "service/batcher.h"
+#include "service/config.h"
+#include "testutil.h"
+
+namespace {
+
+using namespace s2s_service;
+
+std::string Str(const std::vector<S2S::Event>& batch) {
+  std::string out;
+  for (const S2S::Event& e : batch) {
+    out +=
+        (out.empty() ? "" : " ") + e.GetShareName() + ":" + e.GetRelativePath();
+  }
+  return out;
+}
+
+TEST(Batcher, CoalescesIntoTheSmallestSetOfSubPaths) {
+  using Add = std::tuple<const char*, std::string, EventKind>;
+  auto Files = [](const std::string& dir, int n, const std::string& leaf) {
+    std::vector<Add> adds;
+    for (int i = 0; i < n; ++i) {
+      adds.emplace_back("docs", dir + "/f" + std::to_string(i + 10) + leaf,
+                        kEventChanged);
+    }
+    return adds;
+  };
+  struct Case {
+    const char* what;
+    std::vector<Add> adds;
+    std::string want;
+    size_t pending_limit = 0;
+  };
+  const EventKind C = kEventChanged, G = kEventGone, W = kEventWhole;
+  const Case cases[] = {
+      {"duplicates", {{"docs", "/a/x", C}, {"docs", "/a/x", C}}, "docs:/a/x"},
+      {"inside a queued directory",
+       {{"docs", "/a", C}, {"docs", "/a/b/c", C}},
+       "docs:/a"},
+      {"a directory drops what it holds",
+       {{"docs", "/a/b/c", C}, {"docs", "/a/b/d", C}, {"docs", "/a", C}},
+       "docs:/a"},
+      {"a common prefix is not a parent",
+       {{"docs", "/ab", C}, {"docs", "/a b", C}, {"docs", "/a", C}},
+       "docs:/a docs:/a b docs:/ab"},
+      {"any bytes",
+       {{"docs", "/x\ny", C}, {"docs", "/\xff\xfe", C}},
+       "docs:/x\ny docs:/\xff\xfe"},
+      {"gone pushes the parent", {{"docs", "/a/x", G}}, "docs:/a"},
+      {"gone at the top is the whole share", {{"docs", "/x", G}}, "docs:/"},
+      {"whole swallows the rest",
+       {{"docs", "/", W}, {"docs", "/a/b", C}},
+       "docs:/"},
+      {"shares apart",
+       {{"photos", "/a", C}, {"docs", "/a", C}},
+       "docs:/a photos:/a"},
+      {"a crowded directory", Files("/d", 9, ""), "docs:/d"},
+      {"a crowded top is the whole share", Files("", 9, ""), "docs:/"},
+      {"over the pending limit", Files("", 5, "/x"), "docs:/", 4},
+  };
+  for (const Case& c : cases) {
+    BatcherSettings s;
+    if (c.pending_limit != 0) s.pending_limit = c.pending_limit;
+    Batcher b(s);
+    for (const Add& a : c.adds) {
+      b.Add(MakeEvent(std::get<0>(a), std::get<1>(a), std::get<2>(a)), 100);
+    }
+    EXPECT_EQ(c.want, Str(b.Take())) << c.what;
+    EXPECT_TRUE(b.Empty()) << c.what;
+  }
+
+  // Twenty directories with a file each: more than 16 runs, so the files
+  // are lifted to their directories, which crowd their parent.
+  Batcher b{BatcherSettings()};
+  for (int i = 0; i < 20; ++i) {
+    b.Add(MakeEvent("docs", "/p/d" + std::to_string(i) + "/f"), 100);
+  }
+  EXPECT_EQ("docs:/p", Str(b.Take()));
+}
+
+TEST(Batcher, SettlesAfterTheLastChangeButNeverPastTheMaximumDelay) {
+  BatcherSettings s;  // settle 2 s, at most 30 s
+  Batcher b(s);
+  EXPECT_EQ(0, b.Due());
+  for (double t : {100.0, 100.5, 101.0}) b.Add(MakeEvent("docs", "/a"), t);
+  EXPECT_DOUBLE_EQ(103.0, b.Due());
+  for (double t = 101; t <= 140; t += 1) b.Add(MakeEvent("docs", "/a"), t);
+  EXPECT_DOUBLE_EQ(130.0, b.Due());
+  std::vector<S2S::Event> batch = b.Take();
+  EXPECT_EQ(0, b.Due());
+  // A batch that could not be pushed comes back as new changes.
+  b.Restore(batch, 200);
+  b.Add(MakeEvent("docs", "/b/c", kEventGone), 201);
+  EXPECT_EQ(2u, b.Pending());
+  EXPECT_DOUBLE_EQ(203.0, b.Due());
+  EXPECT_EQ("docs:/a docs:/b", Str(b.Take()));
+}
+
+// ---------------------------------------------------------------------------
+// s2sd watching a share, with each change source.
+
+using S2S::PObject;
+using s2s_test::ReadFile;
+using s2s_test::WriteFile;
+namespace fs = std::filesystem;
+
+class RealtimeTest : public ::testing::TestWithParam<const char*> {
+ protected:
+  RealtimeTest() : app_(S2S_CMD_HANDLER) {}
+
+  void SetUp() override {
+    ASSERT_TRUE(app_.AddShare("docs"));
+    ASSERT_TRUE(app_.StartServer());
+    bin_ = tmp_.Sub("bin");
+    fs::create_directories(bin_);
+    rsync_log_ = tmp_.Sub("rsync.log");
+    // Every rsync the service runs, one line each; none reaches the server
+    // while the file `unreachable_` exists.
+    unreachable_ = tmp_.Sub("unreachable");
+    ASSERT_TRUE(s2s_test::WriteScript(
+        bin_ + "/rsync", "[ -e " + unreachable_ +
+                             " ] && exit 10\necho \"$*\" >> " + rsync_log_ +
+                             "\nexec /usr/bin/rsync \"$@\"\n"));
+    ASSERT_TRUE(
+        WriteFile(ConfigPath(), "[Service]\n\tbeacon_interval=\"3600\"\n"));
+    client_ = app_.ClientShare("docs");
+    server_ = app_.ServerShare("docs");
+  }
+
+  void TearDown() override { StopDaemon(); }
+
+  void StartDaemon(const std::vector<std::string>& extra = {}) {
+    unlink(s2s_service::SocketPath().c_str());
+    std::string path = bin_ + ":" + getenv("PATH");
+    std::string log = tmp_.Sub("s2sd.log");
+    std::vector<std::string> args = {S2SD_PROGRAM, "--foreground", "--log", log,
+                                     "-v"};
+    args.insert(args.end(), extra.begin(), extra.end());
+    pid_ = fork();
+    if (pid_ == 0) {
+      setenv("PATH", path.c_str(), 1);
+      std::vector<char*> argv;
+      for (std::string& a : args) argv.push_back(&a[0]);
+      argv.push_back(nullptr);
+      execv(S2SD_PROGRAM, argv.data());
+      _exit(127);
+    }
+    ASSERT_TRUE(WaitFor(
+        [this] { return Request("status")["result"].isInteger(); }, 10));
+  }
+
+  void StopDaemon() {
+    if (pid_ <= 0) return;
+    kill(pid_, SIGTERM);
+    waitpid(pid_, nullptr, 0);
+    pid_ = -1;
+  }
+
+  PObject Request(const std::string& action, const PObject& more = PObject()) {
+    PObject req = more;
+    if (!req.isMap()) req = PObject::Map();
+    req["action"] = action;
+    S2S::IPCSender sender;
+    PObject reply;
+    if (sender.connect(s2s_service::SocketPath()) == 0) {
+      sender.send(req, true, reply);
+    }
+    sender.close();
+    return reply;
+  }
+
+  // Adds the realtime task over docs with the test's change source, a
+  // settle delay of 0.2 s and `settings` beside; its status map once it
+  // watches, or a null object.
+  PObject AddTask(const PObject& settings = PObject()) {
+    S2S::SyncTask t;
+    t.GetInfo().SetName("live");
+    t.GetInfo().SetShareList({"docs"});
+    t.GetInfo().SetSyncInfo(app_.Info());
+    S2S::Schedule realtime;
+    realtime.SetMode(S2S::SCHD_REALTIME);
+    t.GetInfo().SetSchedule(realtime);
+    PObject req;
+    req = PObject::Map();
+    S2S::SyncTask2PObj(t, req["task"]);
+    req["task"].asMap().erase("id");
+    req["task"]["realtime_source"] = GetParam();
+    req["task"]["realtime_settle_ms"] = 200u;
+    if (settings.isMap()) {
+      for (const auto& it : settings.asMap()) req["task"][it.first] = it.second;
+    }
+    PObject reply = Request("add", req);
+    EXPECT_EQ(0u, reply["result"].asUInt64()) << reply["message"].asString();
+    PObject status;
+    WaitFor(
+        [&] {
+          status = Status();
+          return status["state"].asString() == "watching";
+        },
+        20);
+    return status;
+  }
+
+  // The task's realtime status (null when the daemon did not answer).
+  PObject Status() {
+    const PObject reply = Request("status");
+    return reply["realtime"][0u];
+  }
+
+  static bool WaitFor(const std::function<bool()>& done, double seconds) {
+    auto start = std::chrono::steady_clock::now();
+    while (!done()) {
+      if (s2s_test::SecondsSince(start) > seconds) return false;
+      std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    return true;
+  }
+
+  // Seconds until `path` on the server holds `content` (-1: not within
+  // `seconds`).
+  double Arrival(const std::string& path, const std::string& content,
+                 double seconds = 10) {
+    auto start = std::chrono::steady_clock::now();
+    bool ok =
+        WaitFor([&] { return ReadFile(server_ + path) == content; }, seconds);
+    return ok ? s2s_test::SecondsSince(start) : -1;
+  }
+
+  bool Gone(const std::string& path) {
+    return WaitFor(
+        [&] { return !fs::exists(fs::symlink_status(server_ + path)); }, 10);
+  }
+
+  bool Same() { return s2s_test::RunQuiet({"diff", "-r", client_, server_}); }
+
+  size_t Files(const std::string& dir) {
+    std::error_code ec;
+    size_t n = 0;
+    for (auto it = fs::recursive_directory_iterator(dir, ec);
+         !ec && it != fs::recursive_directory_iterator(); it.increment(ec)) {
+      n += it->is_regular_file(ec) ? 1 : 0;
+    }
+    return n;
+  }
+
+  size_t RsyncRuns() {
+    std::string log = ReadFile(rsync_log_);
+    size_t n = 0;
+    for (size_t at = log.find(client_); at != std::string::npos;
+         at = log.find(client_, at + 1)) {
+      ++n;
+    }
+    return n;
+  }
+
+  std::string Log() { return ReadFile(tmp_.Sub("s2sd.log")); }
+
+  // The status of the task's share.
+  PObject Share() {
+    const PObject status = Status();
+    return status["shares"][0u];
+  }
+  bool Watching() {
+    const PObject share = Share();
+    return share["watching"].asBool();
+  }
+
+  s2s_test::Appliances app_;
+  s2s_test::TempDir tmp_;
+  std::string bin_, rsync_log_, client_, server_, unreachable_;
+  pid_t pid_ = -1;
+};
+
+#define SKIP_UNLESS_SOURCE(status)                         \
+  if (status["source"].asString() != GetParam())           \
+  GTEST_SKIP() << GetParam() << " is not available here: " \
+               << status["source_note"].asString()
+
+TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
+  WriteFile(client_ + "/before.txt", "made before the task\n");
+  StartDaemon();
+  const PObject status = AddTask();
+  SKIP_UNLESS_SOURCE(status);
+  // The start-up full sync.
+  ASSERT_LE(0, Arrival("/before.txt", "made before the task\n")) << Log();
+  EXPECT_NE("idle", app_.ServerRegistry("TASK_live", "status"));
+
+  WriteFile(client_ + "/a.txt", "alpha\n");
+  double took = Arrival("/a.txt", "alpha\n");
+  EXPECT_LE(0, took);
+  EXPECT_LT(took, 0.2 + 1) << "settle delay plus a second";
+
+  // Deleted, renamed, made and filled at once, any bytes in names.
+  fs::create_directories(client_ + "/old/sub");
+  WriteFile(client_ + "/old/sub/x", "x\n");
+  ASSERT_LE(0, Arrival("/old/sub/x", "x\n"));
+  unlink((client_ + "/a.txt").c_str());
+  fs::rename(client_ + "/old", client_ + "/new");
+  fs::create_directories(client_ + "/quick/deep/er");
+  for (int i = 0; i < 50; ++i) {
+    WriteFile(client_ + "/quick/deep/er/f" + std::to_string(i), "q");
+  }
+  const std::string odd[] = {"/line\nbreak", "/\xff\xfe.bin", "/caf\xe9"};
+  fs::create_directories(client_ + odd[2]);
+  WriteFile(client_ + odd[0], "newline\n");
+  WriteFile(client_ + odd[1], "latin\n");
+  WriteFile(client_ + odd[2] + odd[0], "both\n");
+  EXPECT_TRUE(Gone("/a.txt"));
+  EXPECT_TRUE(Gone("/old"));
+  EXPECT_LE(0, Arrival("/new/sub/x", "x\n"));
+  EXPECT_LE(0, Arrival("/quick/deep/er/f49", "q"));
+  EXPECT_LE(0, Arrival(odd[2] + odd[0], "both\n"));
+  EXPECT_TRUE(WaitFor([&] { return Same(); }, 10));
+
+  // A burst: 10,000 files in 1,000 new directories. The deadline is for
+  // a loaded machine, where each file costs milliseconds on both sides.
+  size_t runs_before = RsyncRuns();
+  for (int d = 0; d < 1000; ++d) {
+    std::string dir = client_ + "/burst/d" + std::to_string(d);
+    fs::create_directories(dir);
+    for (int f = 0; f < 10; ++f) WriteFile(dir + "/f" + std::to_string(f), "b");
+  }
+  ASSERT_TRUE(WaitFor([&] { return Files(server_ + "/burst") == 10000; }, 300))
+      << Log();
+  EXPECT_TRUE(Same());
+  size_t runs = RsyncRuns() - runs_before;
+  std::printf(
+      "[ burst    ] 10,000 files in 1,000 directories: %zu rsync runs (%s)\n",
+      runs, GetParam());
+  EXPECT_LE(runs, 10u);
+
+  // The share's directory goes: no longer watched, and watched again when
+  // it is back.
+  fs::rename(client_, client_ + ".away");
+  EXPECT_TRUE(WaitFor(
+      [&] {
+        const PObject share = Share();
+        return !share["watching"].asBool() &&
+               share["message"].asString().find("went away") !=
+                   std::string::npos;
+      },
+      10))
+      << Log();
+  fs::rename(client_ + ".away", client_);
+  EXPECT_TRUE(WaitFor([&] { return Watching(); }, 10));
+  WriteFile(client_ + "/back.txt", "back\n");
+  EXPECT_LE(0, Arrival("/back.txt", "back\n"));
+
+  // Disabled: the server shows the task idle again.
+  PObject id;
+  id = PObject::Map();
+  id["id"] = 1u;
+  ASSERT_EQ(0u, Request("disable", id)["result"].asUInt64());
+  EXPECT_TRUE(WaitFor(
+      [&] { return app_.ServerRegistry("TASK_live", "status") == "idle"; },
+      10));
+  EXPECT_TRUE(Request("status")["realtime"].asArray().empty());
+}
+
+TEST_P(RealtimeTest, OverflowWatchLimitAndAnUnreachableServerEndEqual) {
+  for (int d = 0; d < 10; ++d) {
+    fs::create_directories(client_ + "/tree/d" + std::to_string(d) + "/e");
+  }
+  // At most 16 events per wake-up and 4 inotify watches; the full syncs
+  // that cover what is not watched come every 2 s.
+  StartDaemon({"--watch-queue-limit", "16", "--watch-limit", "4"});
+  PObject settings;
+  settings = PObject::Map();
+  settings["realtime_full_sync"] = 2u;
+  const PObject added = AddTask(settings);
+  SKIP_UNLESS_SOURCE(added);
+  // Into the share's directory, which is watched, and into directories
+  // that are not; while s2sd is stopped, so that the events pile up.
+  kill(pid_, SIGSTOP);
+  for (int i = 0; i < 300; ++i) {
+    std::string dir = i < 100 ? "" : "/tree/d" + std::to_string(i % 10) + "/e";
+    WriteFile(client_ + dir + "/f" + std::to_string(i), std::to_string(i));
+  }
+  kill(pid_, SIGCONT);
+  EXPECT_TRUE(WaitFor([&] { return Same(); }, 30)) << Log();
+  const PObject status = Status();
+  EXPECT_LE(1u, status["overflows"].asUInt64());
+  if (std::string(GetParam()) == "inotify") {
+    EXPECT_NE(std::string::npos,
+              status["problem"].asString().find("watch limit"))
+        << status["problem"].asString();
+    EXPECT_EQ(4u, status["watches"].asUInt64());
+  } else {
+    EXPECT_EQ(1u, status["watches"].asUInt64());
+  }
+
+  // The server unreachable: the change waits, and arrives once it answers.
+  WriteFile(unreachable_, "");
+  WriteFile(client_ + "/later.txt", "later\n");
+  EXPECT_TRUE(WaitFor(
+      [&] {
+        const PObject s = Status();
+        return s["state"].asString() == "retry_wait" &&
+               s["last_error"].asString().find("unreachable") !=
+                   std::string::npos &&
+               s["pending"].asUInt64() >= 1;
+      },
+      30))
+      << Log();
+  unlink(unreachable_.c_str());
+  EXPECT_LE(0, Arrival("/later.txt", "later\n", 30)) << Log();
+}
+
+INSTANTIATE_TEST_SUITE_P(Sources, RealtimeTest,
+                         ::testing::Values("inotify", "fanotify"),
+                         [](const ::testing::TestParamInfo<const char*>& p) {
+                           return std::string(p.param);
+                         });
+
+}  // namespace
