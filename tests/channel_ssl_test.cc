@@ -1,5 +1,4 @@
 #include <gtest/gtest.h>
-#include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -341,34 +340,6 @@ TEST_F(ChannelSSLTest, ClientTalksToOpenSSLServer) {
     EXPECT_EQ(ch.Read(buf, 5), 0);
     EXPECT_STREQ(buf, "pong\n");
   }
-}
-
-// Our server end, with its chain file, against a real TLS client that
-// insists on a valid chain and name.
-TEST_F(ChannelSSLTest, ServerTalksToOpenSSLClient) {
-  int port = 0;
-  int lfd = s2s_test::LoopbackListener(&port);
-  ASSERT_GE(lfd, 0);
-  s2s_test::PipedProcess client;
-  ASSERT_TRUE(client.Start(
-      Words("openssl s_client -brief -verify_return_error -verify_hostname "
-            "server.example.test -connect 127.0.0.1:" +
-            std::to_string(port) + " -CAfile " + File("ca.pem"))));
-  pollfd pfd = {lfd, POLLIN, 0};
-  ASSERT_EQ(poll(&pfd, 1, 5000), 1);
-  Channel ch(4096);
-  ch.SetTimeout(5);
-  ASSERT_EQ(ch.Open(accept(lfd, nullptr, nullptr), true), 0);
-  close(lfd);
-  ASSERT_EQ(ch.ConvertToSSLChannel(true), 0);
-  ASSERT_EQ(ch.Write("hello client\n", 13), 0);
-  ASSERT_EQ(ch.FlushWrite(0), 0);
-  EXPECT_TRUE(client.WaitFor("hello client\n")) << client.output();
-  EXPECT_TRUE(Has(client.output(), "Verification: OK"));
-  ASSERT_TRUE(client.Send("hello server\n"));
-  char buf[14] = {};
-  EXPECT_EQ(ch.Read(buf, 13), 0);
-  EXPECT_STREQ(buf, "hello server\n");
 }
 
 }  // namespace
