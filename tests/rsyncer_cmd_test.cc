@@ -159,6 +159,11 @@ TEST(RsyncerSplitTest, SplitsAtEachSeparatorKeepingEmptyPieces) {
 // copies into them, and the time-outs of the two kinds of run.
 TEST(RsyncerTaskTest, SwitchesConnectionAndTimeOuts) {
   Rsyncer::RsyncTask task;
+  // Every run deletes, keeps numeric ids, authenticates and stores owners
+  // through the server's pseudo root unless its owner says otherwise.
+  EXPECT_TRUE(task.getDelete() && task.getNumericIds() &&
+              task.getKaroAuthUse() && task.getKaroAuthRequire() &&
+              task.getKaroPseudoRoot());
   // Block-level sync is rsync's delta transfer, not its compression.
   task.SetBlockLevelSync(true);
   EXPECT_TRUE(task.getDeltaCopy());
