@@ -226,7 +226,8 @@ TEST(ChannelTest, OpensTcpClientsAndReopensAfterClose) {
   std::string ip = "x";
   int port = 9;
   EXPECT_EQ(ch.GetPeerInfo(ip, port), 0);
-  EXPECT_EQ(ip + std::to_string(port), "0");
+  EXPECT_EQ(ip, "");
+  EXPECT_EQ(port, 0);
   char c;
   EXPECT_EQ(ch.Read(&c, 1), S2S::kIOError);
   EXPECT_EQ(ch.Write("a", 1), S2S::kIOError);

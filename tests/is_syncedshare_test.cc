@@ -100,7 +100,8 @@ TEST_F(RegistryTest, RecordsAreReplacedWholeAndNamesFromTheNetworkChecked) {
   KSZHASH* b = Hash({{"k2", "two"}});
   ASSERT_EQ(S2SUpdateServerInfo("A", a), 0);
   ASSERT_EQ(S2SUpdateServerInfo("A", b), 0);
-  EXPECT_EQ(Value("A", "k1") + Value("A", "k2"), "<none>two");
+  EXPECT_EQ(Value("A", "k1"), "<none>");
+  EXPECT_EQ(Value("A", "k2"), "two");
   ASSERT_EQ(S2SServerUpdateShare("docs", a), 0);
   ASSERT_EQ(S2SServerUpdateTask("t1", a), 0);
   char buf[16];
@@ -214,7 +215,8 @@ int BusyAtAge(long age) {
 TEST_F(RegistryTest, StatusIsBusyForTwoMinutesAndRunsWithSwitchAndDaemon) {
   S2S_SVR_STATUS st;
   EXPECT_EQ(s2s_svr_get_status(&st), 0);  // no client: null strings
-  EXPECT_EQ(st.running + st.busy, 0);
+  EXPECT_EQ(st.running, 0);
+  EXPECT_EQ(st.busy, 0);
   EXPECT_EQ(st.clientID, nullptr);
   EXPECT_EQ(st.serverName, nullptr);
   s2s_svr_put_status(&st);

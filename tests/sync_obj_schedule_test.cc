@@ -89,7 +89,8 @@ TEST(Schedule, SettersNormalisePeriodRepeatAndWeek) {
   s.SetPeriod(1, 30);
   EXPECT_EQ(s.GetPeriodSeconds(), 5400);
   s.SetPeriod(5430);
-  EXPECT_EQ(s.GetPeriodHourPart() * 100 + s.GetPeriodMinutePart(), 130);
+  EXPECT_EQ(s.GetPeriodHourPart(), 1);
+  EXPECT_EQ(s.GetPeriodMinutePart(), 30);
 
   const struct {
     const char *in, *stored;
