@@ -24,6 +24,7 @@ packages=(
   rsync openssh-server openssh-client samba-common-bin acl tzdata
   scdoc man-db lintian
   clang libclang-rt-14-dev
+  lcov  # scripts/coverage.sh
 )
 
 install_missing() {

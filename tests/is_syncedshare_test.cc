@@ -1,44 +1,23 @@
+// The server's pairing registry: its records, the pairing modes, the service
+// status, and writers in several processes at once.
 #include "S2S/is_syncedshare.h"
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <string>
+#include <vector>
 
 #include "karo_err.h"
 #include "testutil.h"
 
 namespace {
 
+using s2s_test::Has;
 using s2s_test::ReadFile;
-using s2s_test::SyslogCapture;
-using s2s_test::TempRoot;
-using s2s_test::WriteFile;
-
-const char kRegistry[] = "/usr/karo/etc/karoS2S.info";
-
-class RegistryTest : public ::testing::Test {
- protected:
-  std::string File() const { return root_.Path(kRegistry); }
-  void Write(const std::string& text) {
-    ASSERT_EQ(S2SCheckServerInfo(), 0);
-    ASSERT_TRUE(WriteFile(File(), text));
-  }
-  std::string Value(const char* section, const char* key) {
-    KSZHASH* h = KLIBCSzHashAlloc(64);
-    std::string out = "<none>";
-    if (S2SGetServerInfo(section, h) == 1 &&
-        KLIBCSzHashGetValue(h, key) != nullptr) {
-      out = KLIBCSzHashGetValue(h, key);
-    }
-    KLIBCSzHashFree(h);
-    return out;
-  }
-
-  TempRoot root_;
-  SyslogCapture syslog_;
-};
 
 KSZHASH* Hash(std::initializer_list<std::pair<const char*, const char*>> kv) {
   KSZHASH* h = KLIBCSzHashAlloc(16);
@@ -46,21 +25,46 @@ KSZHASH* Hash(std::initializer_list<std::pair<const char*, const char*>> kv) {
   return h;
 }
 
-TEST_F(RegistryTest, CheckServerInfoCreatesTheFileUnderTheRoot) {
-  ASSERT_EQ(S2SCheckServerInfo(), 0);
-  struct stat st;
-  ASSERT_EQ(stat(File().c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0644u);
-  EXPECT_EQ(S2SCheckServerInfo(), 0);
+// `key` of registry section `section`, or "<none>".
+std::string Value(const char* section, const char* key) {
+  KSZHASH* h = KLIBCSzHashAlloc(64);
+  std::string out = "<none>";
+  if (S2SGetServerInfo(section, h) == 1 &&
+      KLIBCSzHashGetValue(h, key) != nullptr) {
+    out = KLIBCSzHashGetValue(h, key);
+  }
+  KLIBCSzHashFree(h);
+  return out;
 }
+
+std::string Joined(const KSZLIST* l) {
+  std::string out;
+  for (int i = 0; i < KLIBCSzListCount(l); ++i) {
+    out += std::string(i ? ":" : "") + KLIBCSzListGet(l, i);
+  }
+  return out;
+}
+
+class RegistryTest : public ::testing::Test {
+ protected:
+  std::string File() const { return root_.Path("/usr/karo/etc/karoS2S.info"); }
+  void Write(const std::string& text) {
+    ASSERT_EQ(S2SCheckServerInfo(), 0);
+    ASSERT_TRUE(s2s_test::WriteFile(File(), text));
+  }
+
+  s2s_test::TempRoot root_;
+  s2s_test::SyslogCapture syslog_;
+};
 
 TEST_F(RegistryTest, IsSyncedShareFollowsRunningIdAndTheSwitch) {
   EXPECT_EQ(KAROS2SIsSyncedShare("docs"), 0);  // no registry file at all
-  EXPECT_EQ(syslog_.Messages().size(), 0u);
   EXPECT_EQ(KAROS2SIsSyncedShare(""), 0);
   EXPECT_EQ(KLIBCErrGet(), KERR_INVALID_ARG);
-
   Write("[SHARE_docs]\n\tRunningID=\"c1\"\n[SHARE_idle]\n\tRunningID=\"\"\n");
+  struct stat st;
+  ASSERT_EQ(stat(File().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0644u);
   EXPECT_EQ(KAROS2SIsSyncedShare("docs"), 1);
   EXPECT_EQ(KAROS2SIsSyncedShare("idle"), 0);
   EXPECT_EQ(KAROS2SIsSyncedShare("other"), 0);
@@ -68,14 +72,14 @@ TEST_F(RegistryTest, IsSyncedShareFollowsRunningIdAndTheSwitch) {
   EXPECT_EQ(KAROS2SIsSyncedShare("docs"), 0);
   ASSERT_EQ(KAROUISetS2S(1, nullptr, nullptr), 0);
   EXPECT_EQ(KAROS2SIsSyncedShare("docs"), 1);
-  EXPECT_EQ(syslog_.Messages().size(), 0u);
+  EXPECT_EQ(syslog_.Text(), "");
 
   Write("[SHARE_docs]\n\tRunningID=\"" + std::string(300, 'x') + "\"\n");
   EXPECT_EQ(KAROS2SIsSyncedShare("docs"), 0);
-  EXPECT_NE(syslog_.Text().find("is_syncedshare:"), std::string::npos);
-  EXPECT_NE(syslog_.Text().find("KLIBCFileGetSectionValue error. "
-                                "key:[SHARE_docs] errno=[0x2400]"),
-            std::string::npos);
+  EXPECT_TRUE(Has(syslog_.Text(), "is_syncedshare:"));
+  EXPECT_TRUE(Has(syslog_.Text(),
+                  "KLIBCFileGetSectionValue error. key:[SHARE_docs] "
+                  "errno=[0x2400]"));
 }
 
 TEST_F(RegistryTest, SetS2SKeepsTheClientUnlessBothAreGiven) {
@@ -91,40 +95,15 @@ TEST_F(RegistryTest, SetS2SKeepsTheClientUnlessBothAreGiven) {
   EXPECT_EQ(Value("PairedClientInfo", "clientID"), "c2");
 }
 
-TEST_F(RegistryTest, UpdateServerInfoAppendsOrReplaces) {
-  KSZHASH* a = Hash({{"k1", "1"}, {"k2", "2"}});
+TEST_F(RegistryTest, RecordsAreReplacedWholeAndNamesFromTheNetworkChecked) {
+  KSZHASH* a = Hash({{"k1", "1"}, {"RunningID", "c1"}});
   KSZHASH* b = Hash({{"k2", "two"}});
   ASSERT_EQ(S2SUpdateServerInfo("A", a), 0);
-  ASSERT_EQ(S2SUpdateServerInfo("B", a), 0);
   ASSERT_EQ(S2SUpdateServerInfo("A", b), 0);
   EXPECT_EQ(Value("A", "k1"), "<none>");
   EXPECT_EQ(Value("A", "k2"), "two");
-  EXPECT_EQ(Value("B", "k1"), "1");
-
-  syslog_.Clear();
-  EXPECT_EQ(S2SUpdateServerInfo("C]", a), -1);
-  EXPECT_EQ(S2SUpdateServerInfo(nullptr, a), -1);
-  const auto msgs = syslog_.Messages();
-  ASSERT_EQ(msgs.size(), 4u);
-  EXPECT_EQ(msgs[0], "KLIBCFileAddSection() failed!! szFile=[" + File() +
-                         "], section=[C]], errno=[0x2300]");
-  EXPECT_EQ(msgs[1], "Set section [C] ] value into [" + File() + "] error.");
-  EXPECT_EQ(msgs[3], "Set section [ ] value into [" + File() + "] error.");
-
-  Write("[A]\nno equals sign\n");
-  syslog_.Clear();
-  EXPECT_EQ(S2SUpdateServerInfo("A", b), -1);
-  EXPECT_EQ(syslog_.Messages()[0], "KLIBCFileGetSection error. filePath:[" +
-                                       File() +
-                                       "] szOldSecName:[A]  iRet:[-1]");
-  KLIBCSzHashFree(a);
-  KLIBCSzHashFree(b);
-}
-
-TEST_F(RegistryTest, ShareAndTaskRecords) {
-  KSZHASH* v = Hash({{"RunningID", "c1"}});
-  ASSERT_EQ(S2SServerUpdateShare("docs", v), 0);
-  ASSERT_EQ(S2SServerUpdateTask("t1", v), 0);
+  ASSERT_EQ(S2SServerUpdateShare("docs", a), 0);
+  ASSERT_EQ(S2SServerUpdateTask("t1", a), 0);
   char buf[16];
   EXPECT_EQ(S2SServerGetShare("docs", "RunningID", buf, sizeof buf), 2);
   EXPECT_STREQ(buf, "c1");
@@ -132,23 +111,33 @@ TEST_F(RegistryTest, ShareAndTaskRecords) {
   EXPECT_EQ(S2SServerGetShare("docs", "CompleteID", buf, sizeof buf), -1);
   EXPECT_EQ(KLIBCErrGet(), KERR_NOT_FOUND);
   EXPECT_EQ(S2SServerGetShare(nullptr, "RunningID", buf, sizeof buf), -1);
-  EXPECT_EQ(S2SServerUpdateShare("", v), -1);
-  // Names from the network that a section cannot hold are refused whole.
+
+  // Names a section cannot hold are refused whole, and said so once.
   const std::string before = ReadFile(File());
-  EXPECT_EQ(S2SServerUpdateShare("x]\n[PairedClientInfo", v), -1);
-  EXPECT_EQ(S2SServerUpdateTask("t\n", v), -1);
+  syslog_.Clear();
+  EXPECT_EQ(S2SUpdateServerInfo("C]", a), -1);
+  EXPECT_EQ(S2SUpdateServerInfo(nullptr, a), -1);
+  EXPECT_EQ(S2SServerUpdateShare("", a), -1);
+  EXPECT_EQ(S2SServerUpdateShare("x]\n[PairedClientInfo", a), -1);
+  EXPECT_EQ(S2SServerUpdateTask("t\n", a), -1);
   EXPECT_EQ(ReadFile(File()), before);
-  KLIBCSzHashFree(v);
+  EXPECT_EQ(syslog_.Messages()[1],
+            "Set section [C] ] value into [" + File() + "] error.");
+  // A registry that does not parse is not overwritten.
+  Write("[A]\nno equals sign\n");
+  EXPECT_EQ(S2SUpdateServerInfo("A", b), -1);
+  EXPECT_EQ(ReadFile(File()), "[A]\nno equals sign\n");
+  KLIBCSzHashFree(a);
+  KLIBCSzHashFree(b);
 }
 
-TEST_F(RegistryTest, PairingMovesToManyClientMode) {
+TEST_F(RegistryTest, PairingMovesToManyClientModeAndResetRemembersTheClient) {
   EXPECT_EQ(S2SServerIfOldClientPaired(), 0);  // nothing paired yet
   ASSERT_EQ(KAROUISetS2S(1, "c1", "srv1"), 0);
   EXPECT_EQ(S2SServerIfOldClientPaired(), 1);
-
   EXPECT_EQ(S2SServerUpdatePairInfo("c1", ""), S2S_SVR_BAD_ARGUMENT);
-  EXPECT_EQ(Value("CLIENTID_c1", "ServerName"), "<none>");
   EXPECT_EQ(S2SServerUpdatePairInfo("c1]", "srv1"), S2S_SVR_WRITE_ERROR);
+  EXPECT_EQ(Value("CLIENTID_c1", "ServerName"), "<none>");
   EXPECT_EQ(S2SServerUpdatePairInfo("c1", "srv1"), S2S_SVR_OK);
   EXPECT_EQ(Value("CLIENTID_c1", "ServerName"), "srv1");
   EXPECT_EQ(Value("PairedClientInfo", "clientID"), S2S_MULTI_SRC_MARKER);
@@ -165,24 +154,18 @@ TEST_F(RegistryTest, PairingMovesToManyClientMode) {
   EXPECT_EQ(S2SServerSetPairValue(half), S2S_SVR_WRITE_ERROR);
   KLIBCSzHashFree(half);
 
-  Write("garbage\n");
-  EXPECT_EQ(S2SServerIfOldClientPaired(), -1);
-  EXPECT_NE(syslog_.Text().find("Get server paired-info error."),
-            std::string::npos);
-}
-
-TEST_F(RegistryTest, ResetPairRemembersTheOldClient) {
-  ASSERT_EQ(KAROUISetS2S(1, "c1", "srv1"), 0);
+  ASSERT_EQ(KAROUISetS2S(1, "c2", "srv2"), 0);
   ASSERT_EQ(s2s_svr_reset_pair(), 0);
-  EXPECT_EQ(Value("CLIENTID_c1", "ServerName"), "srv1");
+  EXPECT_EQ(Value("CLIENTID_c2", "ServerName"), "srv2");
   EXPECT_EQ(Value("PairedClientInfo", "serverName"), S2S_MULTI_SRC_MARKER);
-  EXPECT_EQ(Value("PairedClientInfo", "s2sEnabled"), "yes");
-
   Write("");
   syslog_.Clear();
   ASSERT_EQ(s2s_svr_reset_pair(), 0);
   EXPECT_EQ(syslog_.Text(), "Failed to get clientID from hash.");
   EXPECT_EQ(Value("PairedClientInfo", "clientID"), S2S_MULTI_SRC_MARKER);
+  Write("garbage\n");
+  EXPECT_EQ(S2SServerIfOldClientPaired(), -1);
+  EXPECT_TRUE(Has(syslog_.Text(), "Get server paired-info error."));
 }
 
 TEST_F(RegistryTest, CheckIfSharePairedSortsByFeeder) {
@@ -195,38 +178,118 @@ TEST_F(RegistryTest, CheckIfSharePairedSortsByFeeder) {
   for (const char* s : {"free", "mine", "running", "done", "back", "new"}) {
     KLIBCSzListPush(shares, s);
   }
-  KSZLIST* lists[3] = {KLIBCSzListAlloc(), KLIBCSzListAlloc(),
-                       KLIBCSzListAlloc()};
-  ASSERT_EQ(S2SCheckIfSharePaired(shares, "me", lists[0], lists[1], lists[2]),
-            S2S_SVR_OK);
-  auto joined = [](const KSZLIST* l) {
-    std::string out;
-    for (int i = 0; i < KLIBCSzListCount(l); ++i) {
-      out += std::string(i ? ":" : "") + KLIBCSzListGet(l, i);
-    }
-    return out;
-  };
-  EXPECT_EQ(joined(lists[0]), "free:new");
-  EXPECT_EQ(joined(lists[1]), "mine:back");
-  EXPECT_EQ(joined(lists[2]), "running:done");
-
-  EXPECT_EQ(S2SCheckIfSharePaired(shares, "", lists[0], lists[1], lists[2]),
+  KSZLIST* l[3] = {KLIBCSzListAlloc(), KLIBCSzListAlloc(), KLIBCSzListAlloc()};
+  ASSERT_EQ(S2SCheckIfSharePaired(shares, "me", l[0], l[1], l[2]), S2S_SVR_OK);
+  EXPECT_EQ(Joined(l[0]), "free:new");
+  EXPECT_EQ(Joined(l[1]), "mine:back");
+  EXPECT_EQ(Joined(l[2]), "running:done");
+  EXPECT_EQ(S2SCheckIfSharePaired(shares, "", l[0], l[1], l[2]),
             S2S_SVR_BAD_ARGUMENT);
-  EXPECT_NE(syslog_.Text().find("Input parameters are null or empty!"),
-            std::string::npos);
   KLIBCSzListPush(shares, "");
-  EXPECT_EQ(S2SCheckIfSharePaired(shares, "me", lists[0], lists[1], lists[2]),
+  EXPECT_EQ(S2SCheckIfSharePaired(shares, "me", l[0], l[1], l[2]),
             S2S_SVR_BAD_ARGUMENT);
-
   Write("[SHARE_free]\n\tCompleteID=\"" + std::string(300, 'x') + "\"\n");
-  syslog_.Clear();
-  EXPECT_EQ(S2SCheckIfSharePaired(shares, "me", lists[0], lists[1], lists[2]),
+  EXPECT_EQ(S2SCheckIfSharePaired(shares, "me", l[0], l[1], l[2]),
             S2S_SVR_READ_ERROR);
-  EXPECT_EQ(syslog_.Text(),
-            "Failed to get section [SHARE_free] CompleteID value."
-            "getSharePairStatus error");
-  for (KSZLIST* l : lists) KLIBCSzListFree(l);
+  EXPECT_TRUE(Has(syslog_.Text(),
+                  "Failed to get section [SHARE_free] CompleteID value."));
+  for (KSZLIST* list : l) KLIBCSzListFree(list);
   KLIBCSzListFree(shares);
+}
+
+// The busy flag for task t1 last active `age` seconds ago. Retried when the
+// clock ticks between writing the time and reading the status.
+int BusyAtAge(long age) {
+  for (;;) {
+    time_t before = time(nullptr);
+    KSZHASH* h = Hash({{"status", std::to_string(before - age).c_str()}});
+    EXPECT_EQ(S2SServerUpdateTask("t1", h), 0);
+    KLIBCSzHashFree(h);
+    S2S_SVR_STATUS st;
+    EXPECT_EQ(s2s_svr_get_status(&st), 0);
+    s2s_svr_put_status(&st);
+    if (time(nullptr) == before) return st.busy;
+  }
+}
+
+TEST_F(RegistryTest, StatusIsBusyForTwoMinutesAndRunsWithSwitchAndDaemon) {
+  S2S_SVR_STATUS st;
+  EXPECT_EQ(s2s_svr_get_status(&st), 0);  // no client: null strings
+  EXPECT_EQ(st.running, 0);
+  EXPECT_EQ(st.busy, 0);
+  EXPECT_EQ(st.clientID, nullptr);
+  EXPECT_EQ(st.serverName, nullptr);
+  s2s_svr_put_status(&st);
+  EXPECT_EQ(BusyAtAge(0), 1);
+  EXPECT_EQ(BusyAtAge(119), 1);
+  EXPECT_EQ(BusyAtAge(120), 0);
+  KSZHASH* now = Hash({{"status", std::to_string(time(nullptr)).c_str()}});
+  ASSERT_EQ(S2SServerUpdateTask("t2", now), 0);  // any task counts
+  KLIBCSzHashFree(now);
+  s2s_svr_get_status(&st);
+  EXPECT_EQ(st.busy, 1);
+  s2s_svr_put_status(&st);
+
+  ASSERT_EQ(KAROUISetS2S(1, "c1", "srv1"), 0);
+  s2s_svr_get_status(&st);
+  EXPECT_EQ(st.running, 0);  // no daemon
+  EXPECT_STREQ(st.clientID, "c1");
+  EXPECT_STREQ(st.serverName, "srv1");
+  EXPECT_EQ(s2s_svr_put_status(&st), 0);
+  EXPECT_EQ(st.clientID, nullptr);
+  // This test process stands in for a live daemon.
+  ASSERT_TRUE(root_.Write("/var/run/rsyncd.pid", std::to_string(getpid())));
+  s2s_svr_get_status(&st);
+  EXPECT_EQ(st.running, 1);
+  s2s_svr_put_status(&st);
+  ASSERT_EQ(KAROUISetS2S(0, nullptr, nullptr), 0);
+  s2s_svr_get_status(&st);
+  EXPECT_EQ(st.running, 0);
+  s2s_svr_put_status(&st);
+  EXPECT_EQ(s2s_svr_get_status(nullptr), 0);
+  EXPECT_EQ(s2s_svr_put_status(nullptr), 0);
+}
+
+// Writers of different sections and keys in several processes: every
+// function takes the lock around its read and write, so nothing is lost.
+TEST_F(RegistryTest, WritersInManyProcessesLoseNothing) {
+  ASSERT_EQ(S2SCheckServerInfo(), 0);
+  const int kWriters = 6, kRounds = 40;
+  std::vector<pid_t> pids;
+  for (int who = 0; who < kWriters; ++who) {
+    pid_t pid = fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+      for (int i = 1; i <= kRounds; ++i) {
+        std::string n = std::to_string(i), name = std::to_string(who);
+        KSZHASH* h = Hash({{"clientID", ("c" + n).c_str()},
+                           {"serverName", ("srv" + n).c_str()},
+                           {"round", n.c_str()}});
+        int r = who == 0   ? KAROUISetS2S(i % 2, nullptr, nullptr)
+                : who == 1 ? S2SServerSetPairValue(h)
+                : who % 2  ? S2SServerUpdateTask(name.c_str(), h)
+                           : S2SServerUpdateShare(name.c_str(), h);
+        KLIBCSzHashFree(h);
+        if (r != 0) _exit(1);
+      }
+      _exit(0);
+    }
+    pids.push_back(pid);
+  }
+  for (pid_t pid : pids) {
+    int status;
+    ASSERT_EQ(waitpid(pid, &status, 0), pid);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  }
+  const std::string last = std::to_string(kRounds);
+  EXPECT_EQ(Value("PairedClientInfo", "s2sEnabled"),
+            kRounds % 2 ? "yes" : "no");
+  EXPECT_EQ(Value("PairedClientInfo", "clientID"), "c" + last);
+  EXPECT_EQ(Value("PairedClientInfo", "serverName"), "srv" + last);
+  for (int who = 2; who < kWriters; ++who) {
+    std::string section = (who % 2 ? "TASK_" : "SHARE_") + std::to_string(who);
+    EXPECT_EQ(Value(section.c_str(), "round"), last) << section;
+  }
 }
 
 }  // namespace

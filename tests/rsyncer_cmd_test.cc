@@ -1,6 +1,6 @@
-// The command files of the client: exact lines of every request, the checks
-// made before anything is written, and the splitting of the server's
-// answers. No server is involved.
+// The client's side of a server command without a server: the wrapper
+// settings of each kind of run, the exact lines of every request, the
+// checks made before anything is written, and the splitting of answers.
 #include <list>
 #include <string>
 #include <vector>
@@ -12,14 +12,13 @@
 namespace {
 
 using S2S::Rsyncer;
+using s2s_test::Has;
 using Lines = std::list<std::string>;
 
 class RsyncerCmdTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    ASSERT_TRUE(root_.Write("/etc/s2s/platform.conf",
-                            "[Platform]\n\tserial=\"SN-9\"\n"
-                            "\thostname=\"nas-one\"\n"));
+    Identity("\tserial=\"SN-9\"\n\thostname=\"" + kHost + "\"\n");
     ASSERT_TRUE(root_.MakeDir("/data/plain"));
     ASSERT_TRUE(root_.MakeDir("/data/@locked@"));
     // "plain" reports a key length although it is not encrypted.
@@ -35,124 +34,87 @@ class RsyncerCmdTest : public ::testing::Test {
     // A mount table that holds none of the shares without a volume key.
     ASSERT_TRUE(root_.Write("/etc/mtab", "/dev/sdz1 /elsewhere ext4 rw 0 0\n"));
   }
-
-  void NoIdentity() {
-    ASSERT_TRUE(root_.Write("/etc/s2s/platform.conf",
-                            "[Platform]\n\tha=\"yes\"\n\tserial=\"\"\n"));
+  void Identity(const std::string& lines) {
+    ASSERT_TRUE(root_.Write("/etc/s2s/platform.conf", "[Platform]\n" + lines));
+  }
+  // What a generator appended to out_, joined by '|', or "refused" when it
+  // failed; out_ then holds its first line again. Lines are appended to what
+  // the list holds and a refusal writes nothing.
+  std::string Joined(int r) {
+    EXPECT_EQ(out_.front(), "kept");
+    std::string joined = r == 0 ? "" : "refused";
+    for (auto it = std::next(out_.begin()); it != out_.end(); ++it) {
+      joined += (it == std::next(out_.begin()) ? "" : "|") + *it;
+    }
+    out_ = {"kept"};
+    return joined;
   }
 
+  // A host name longer than the 35 characters a request carries.
+  const std::string kHost = "nas-one-of-the-many-storage-servers-in-a-rack";
   s2s_test::TempRoot root_;
   Rsyncer r_;
+  Lines out_ = {"kept"};
 };
 
-TEST_F(RsyncerCmdTest, PairingVersionBeaconAndFinishLines) {
-  Lines out;
-  ASSERT_EQ(0, r_.GenSinglePairCmd(true, out));
-  EXPECT_EQ(out, (Lines{"command=\"S2S_Pairing\"", "clientID=\"SN-9\"",
-                        "dryRun=\"yes\"", "serverName=\"nas-one\""}));
-  out.clear();
-  ASSERT_EQ(0, r_.GenSinglePairCmd(false, out));
-  EXPECT_EQ("dryRun=\"no\"", *std::next(out.begin(), 2));
-
-  out.clear();
-  ASSERT_EQ(0, r_.GenServerVersionCmd("/tmp/S2S/temp.1", out));
-  EXPECT_EQ(out, (Lines{"command=\"S2S_GetProtocolVer\"", "clientID=\"SN-9\"",
-                        "outfile=\"/tmp/S2S/temp.1\""}));
-
-  out.clear();
-  ASSERT_EQ(0, r_.GenSendBeaconCmd("nightly run", out));
-  EXPECT_EQ(out, (Lines{"command=\"S2S_UpdateTaskStatus\"", "clientID=\"SN-9\"",
-                        "taskName=\"nightly run\""}));
-
-  // Lines are appended to what the list holds.
-  out = {"kept"};
-  ASSERT_EQ(0, r_.GenFinishSyncCmd("share", "plain", out));
-  EXPECT_EQ(out,
-            (Lines{"kept", "command=\"S2S_SyncFinish\"", "clientID=\"SN-9\"",
-                   "finishType=\"share\"", "name=\"plain\""}));
-}
-
-TEST_F(RsyncerCmdTest, ServerNameIsCutTo35Characters) {
-  std::string longName(50, 'h');
-  ASSERT_TRUE(root_.Write(
-      "/etc/s2s/platform.conf",
-      "[Platform]\n\tserial=\"SN-9\"\n\thostname=\"" + longName + "\"\n"));
-  Lines single, multi;
-  ASSERT_EQ(0, r_.GenSinglePairCmd(true, single));
-  EXPECT_EQ("serverName=\"" + longName.substr(0, 35) + "\"", single.back());
-  ASSERT_EQ(0, r_.GenPairMultiSrcCmd(false, false, {"a"}, "/o", multi));
-  EXPECT_EQ("serverName=\"" + longName.substr(0, 35) + "\"",
-            *std::next(multi.begin(), 2));
-}
-
-TEST_F(RsyncerCmdTest, MultiSourcePairingLines) {
-  Lines out;
-  ASSERT_EQ(0, r_.GenPairMultiSrcCmd(true, false, {"a", "b", "c"},
-                                     "/tmp/S2S/temp.2", out));
-  EXPECT_EQ(out, (Lines{"command=\"S2S_PairingMultiSrc\"", "clientID=\"SN-9\"",
-                        "serverName=\"nas-one\"", "syncShares=\"a:b:c\"",
-                        "dryRun=\"yes\"", "outfile=\"/tmp/S2S/temp.2\"",
-                        "requireEncryptionShareSupport=\"no\""}));
-  out.clear();
-  ASSERT_EQ(0, r_.GenPairMultiSrcCmd(false, true, {"a"}, "/o", out));
-  EXPECT_EQ("syncShares=\"a\"", *std::next(out.begin(), 3));
-  EXPECT_EQ("dryRun=\"no\"", *std::next(out.begin(), 4));
-  EXPECT_EQ("requireEncryptionShareSupport=\"yes\"", out.back());
-  // Nothing is escaped: the server has to cope with what it gets.
-  out.clear();
-  ASSERT_EQ(0, r_.GenPairMultiSrcCmd(false, false, {"x\"y", "p:q"}, "/o", out));
-  EXPECT_EQ("syncShares=\"x\"y:p:q\"", *std::next(out.begin(), 3));
-}
-
-TEST_F(RsyncerCmdTest, SyncStartPlainAndWithAttributes) {
-  Lines out;
-  ASSERT_EQ(0, r_.GenStartSyncShareCmd("locked", false, out));
-  EXPECT_EQ(out, (Lines{"command=\"S2S_SyncStart\"", "clientID=\"SN-9\"",
-                        "volumeName=\"volume2\"", "shareName=\"locked\""}));
-  out.clear();
-  ASSERT_EQ(0, r_.GenStartSyncShareCmd("locked", true, out));
-  EXPECT_EQ(out,
-            (Lines{"command=\"S2S_SyncStart\"", "clientID=\"SN-9\"",
-                   "volumeName=\"volume2\"", "shareName=\"locked\"",
-                   "isEncrypt=\"1\"", "isAutomount=\"1\"", "isEnableACL=\"1\"",
-                   "isWinShare=\"1\"", "lenEncKey=\"32\""}));
-  out.clear();
-  ASSERT_EQ(0, r_.GenStartSyncShareCmd("plain", true, out));
-  EXPECT_EQ(out,
-            (Lines{"command=\"S2S_SyncStart\"", "clientID=\"SN-9\"",
-                   "volumeName=\"volume1\"", "shareName=\"plain\"",
-                   "isEncrypt=\"0\"", "isAutomount=\"0\"", "isEnableACL=\"0\"",
-                   "isWinShare=\"0\"", "lenEncKey=\"16\""}));
-}
-
-TEST_F(RsyncerCmdTest, EmptyParametersAndUnknownSharesWriteNothing) {
+TEST_F(RsyncerCmdTest, EveryRequestsLinesAndTheRefusalsThatWriteNothing) {
   s2s_test::LogCapture log;
-  Lines out;
-  EXPECT_EQ(-1, r_.GenSendBeaconCmd("", out));
-  EXPECT_EQ(-1, r_.GenFinishSyncCmd("", "plain", out));
-  EXPECT_EQ(-1, r_.GenFinishSyncCmd("share", "", out));
-  EXPECT_EQ(-1, r_.GenStartSyncShareCmd("", true, out));
-  EXPECT_EQ(-1, r_.GenStartSyncShareCmd("nope", true, out));
-  EXPECT_EQ(-1, r_.GenStartSyncShareCmd("nomount", false, out));
-  EXPECT_EQ(-1, r_.GenPairMultiSrcCmd(true, false, {}, "/o", out));
-  EXPECT_TRUE(out.empty());
-  std::string text = log.Text();
-  EXPECT_NE(text.find("[ERROR] S2S/rsyncer("), std::string::npos);
+  const std::string id = "clientID=\"SN-9\"|";
+  const std::string server =
+      "serverName=\"nas-one-of-the-many-storage-servers\"";
+  EXPECT_EQ(Joined(r_.GenSinglePairCmd(true, out_)),
+            "command=\"S2S_Pairing\"|" + id + "dryRun=\"yes\"|" + server);
+  EXPECT_EQ(Joined(r_.GenSinglePairCmd(false, out_)),
+            "command=\"S2S_Pairing\"|" + id + "dryRun=\"no\"|" + server);
+  EXPECT_EQ(Joined(r_.GenServerVersionCmd("/o", out_)),
+            "command=\"S2S_GetProtocolVer\"|" + id + "outfile=\"/o\"");
+  EXPECT_EQ(
+      Joined(r_.GenSendBeaconCmd("nightly run", out_)),
+      "command=\"S2S_UpdateTaskStatus\"|" + id + "taskName=\"nightly run\"");
+  EXPECT_EQ(Joined(r_.GenFinishSyncCmd("share", "plain", out_)),
+            "command=\"S2S_SyncFinish\"|" + id +
+                "finishType=\"share\"|name=\"plain\"");
+  EXPECT_EQ(
+      Joined(r_.GenPairMultiSrcCmd(true, false, {"a", "b", "c"}, "/o", out_)),
+      "command=\"S2S_PairingMultiSrc\"|" + id + server +
+          "|syncShares=\"a:b:c\"|dryRun=\"yes\"|outfile=\"/o\"|"
+          "requireEncryptionShareSupport=\"no\"");
+  // Nothing is escaped: the server has to cope with what it gets.
+  EXPECT_EQ(
+      Joined(r_.GenPairMultiSrcCmd(false, true, {"x\"y", "p:q"}, "/o", out_)),
+      "command=\"S2S_PairingMultiSrc\"|" + id + server +
+          "|syncShares=\"x\"y:p:q\"|dryRun=\"no\"|outfile=\"/o\"|"
+          "requireEncryptionShareSupport=\"yes\"");
+  EXPECT_EQ(Joined(r_.GenStartSyncShareCmd("locked", false, out_)),
+            "command=\"S2S_SyncStart\"|" + id +
+                "volumeName=\"volume2\"|shareName=\"locked\"");
+  EXPECT_EQ(Joined(r_.GenStartSyncShareCmd("locked", true, out_)),
+            "command=\"S2S_SyncStart\"|" + id +
+                "volumeName=\"volume2\"|shareName=\"locked\"|isEncrypt=\"1\"|"
+                "isAutomount=\"1\"|isEnableACL=\"1\"|isWinShare=\"1\"|"
+                "lenEncKey=\"32\"");
+  EXPECT_EQ(Joined(r_.GenStartSyncShareCmd("plain", true, out_)),
+            "command=\"S2S_SyncStart\"|" + id +
+                "volumeName=\"volume1\"|shareName=\"plain\"|isEncrypt=\"0\"|"
+                "isAutomount=\"0\"|isEnableACL=\"0\"|isWinShare=\"0\"|"
+                "lenEncKey=\"16\"");
+  EXPECT_EQ(Joined(r_.GenSendBeaconCmd("", out_)), "refused");
+  EXPECT_EQ(Joined(r_.GenFinishSyncCmd("", "plain", out_)), "refused");
+  EXPECT_EQ(Joined(r_.GenFinishSyncCmd("share", "", out_)), "refused");
+  EXPECT_EQ(Joined(r_.GenStartSyncShareCmd("", true, out_)), "refused");
+  EXPECT_EQ(Joined(r_.GenStartSyncShareCmd("nope", true, out_)), "refused");
+  EXPECT_EQ(Joined(r_.GenStartSyncShareCmd("nomount", false, out_)), "refused");
+  EXPECT_EQ(Joined(r_.GenPairMultiSrcCmd(true, false, {}, "/o", out_)),
+            "refused");
   for (const char* msg :
-       {"GenSendBeaconCmd: Empty parameter\n",
-        "GenStartSyncShareCmd: Empty parameter\n",
-        "Fail to get share info of 'nope'\n", "Fail to get volume info\n",
-        "GenPairMultiSrcCmd: Empty parameter\n"}) {
-    EXPECT_NE(text.find(msg), std::string::npos) << msg;
+       {"[ERROR] S2S/rsyncer(", "GenFinishSyncCmd: Empty parameter\n",
+        "Fail to get share info of 'nope'\n", "Fail to get volume info\n"}) {
+    EXPECT_TRUE(Has(log.Text(), msg)) << msg;
   }
-  size_t first = text.find("GenFinishSyncCmd: Empty parameter\n");
-  ASSERT_NE(first, std::string::npos);
-  EXPECT_NE(text.find("GenFinishSyncCmd: Empty parameter\n", first + 1),
-            std::string::npos);
 }
 
 TEST_F(RsyncerCmdTest, MissingClientIdentityStopsEveryRequest) {
-  NoIdentity();
+  Identity("\tha=\"yes\"\n\tserial=\"\"\n");
   s2s_test::LogCapture log;
   Lines out;
   EXPECT_EQ(-1, r_.GenSinglePairCmd(true, out));
@@ -164,10 +126,7 @@ TEST_F(RsyncerCmdTest, MissingClientIdentityStopsEveryRequest) {
   EXPECT_TRUE(out.empty());
   int count = 0;
   for (const std::string& m : log.Messages()) {
-    if (m.find("[ERROR] S2S/rsyncer(") == 0 &&
-        m.find("): Fail to get client id\n") != std::string::npos) {
-      ++count;
-    }
+    count += Has(m, "): Fail to get client id\n");
   }
   EXPECT_EQ(6, count);
 }
@@ -182,7 +141,6 @@ TEST(RsyncerSplitTest, SplitsAtEachSeparatorKeepingEmptyPieces) {
       {"a,b:c", ":,", {"a", "b", "c"}},
       {":a:", ":", {"", "a", ""}},
       {"", ":", {""}},
-      {"abc", ":", {"abc"}},
       {"a:b", "", {"a:b"}},
       // A set of characters, not a substring.
       {"a:,b", ",:", {"a", "", "b"}},
@@ -195,6 +153,61 @@ TEST(RsyncerSplitTest, SplitsAtEachSeparatorKeepingEmptyPieces) {
     EXPECT_EQ(expected, std::vector<std::string>(out.begin(), out.end()))
         << "'" << c.text << "' at '" << c.separators << "'";
   }
+}
+
+// The wrapper settings every invocation starts from, what the Rsyncer
+// copies into them, and the time-outs of the two kinds of run.
+TEST(RsyncerTaskTest, SwitchesConnectionAndTimeOuts) {
+  Rsyncer::RsyncTask task;
+  // Every run deletes, keeps numeric ids, authenticates and stores owners
+  // through the server's pseudo root unless its owner says otherwise.
+  EXPECT_TRUE(task.getDelete() && task.getNumericIds() &&
+              task.getKaroAuthUse() && task.getKaroAuthRequire() &&
+              task.getKaroPseudoRoot());
+  // Block-level sync is rsync's delta transfer, not its compression.
+  task.SetBlockLevelSync(true);
+  EXPECT_TRUE(task.getDeltaCopy());
+  EXPECT_FALSE(task.getCompress());
+  // A test task runs quietly, every other one with the debug log.
+  task.SetTestTask(true);
+  EXPECT_FALSE(task.getDebugLog());
+  task.SetTestTask(false);
+  EXPECT_TRUE(task.getDebugLog());
+
+  S2S::SyncInfo info;
+  info.SetServerIP("127.0.0.9");
+  info.SetUser("backup");
+  info.SetSSHPort(2222);
+  info.SetCompression(true);
+  // Initialize probes the server; without a client identity no request is
+  // even written, so nothing runs.
+  s2s_test::TempRoot root;
+  ASSERT_TRUE(root.Write("/etc/s2s/platform.conf",
+                         "[Platform]\n\tha=\"yes\"\n\tserial=\"\"\n"));
+  Rsyncer r;
+  for (bool ssh : {false, true}) {
+    info.SetSSH(ssh);
+    r.Initialize(info);
+    Rsyncer::RsyncTask t;
+    r.InitRsyncTask(t, !ssh);
+    EXPECT_EQ("127.0.0.9", t.GetServerIP());
+    EXPECT_EQ("backup", t.GetUser());
+    EXPECT_EQ(ssh, t.getSsh());
+    EXPECT_EQ(ssh ? 2222u : 0u, t.getPort());  // the port only for SSH
+    EXPECT_EQ(ssh, t.getDebugLog());
+    EXPECT_FALSE(t.getCompress());  // transfer options are the callers'
+  }
+
+  // No server address: the wrapper refuses before starting rsync.
+  Rsyncer::RsyncTask command;
+  EXPECT_EQ(Rsyncer::RsyncTask::kBadSettings,
+            command.ExecuteCmd({"command=\"S2S_Pairing\""}, nullptr));
+  EXPECT_EQ(60u, command.getTimeout());
+  Rsyncer::RsyncTask data;
+  data.setTimeout(5);
+  EXPECT_EQ(Rsyncer::RsyncTask::kBadSettings,
+            data.Execute("/src/", "share", nullptr, "", {}));
+  EXPECT_EQ(600u, data.getTimeout());
 }
 
 }  // namespace

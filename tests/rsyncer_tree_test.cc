@@ -18,45 +18,25 @@ using s2s_test::ReadFile;
 using s2s_test::WriteFile;
 namespace fs = std::filesystem;
 
-// One entry of a tree as rsync should carry it: type and mode, owner,
-// modification time, and the content or the link's target.
-struct Entry {
-  mode_t mode;
-  uid_t uid;
-  gid_t gid;
-  time_t mtime;
-  std::string data;
-  bool operator==(const Entry& o) const {
-    return mode == o.mode && uid == o.uid && gid == o.gid && data == o.data &&
-           (S_ISDIR(mode) || mtime == o.mtime);
-  }
-};
-
-std::map<std::string, Entry> Snapshot(const std::string& top) {
-  std::map<std::string, Entry> tree;
+// A tree as rsync should carry it, one line per entry: name, type and mode,
+// owner, modification time (not for directories) and the content or the
+// link's target.
+std::string Snapshot(const std::string& top) {
+  std::string out;
+  std::map<std::string, std::string> lines;
   for (const auto& e : fs::recursive_directory_iterator(top)) {
     std::string path = e.path().string();
     struct stat st;
     if (lstat(path.c_str(), &st) != 0) continue;
-    Entry entry{st.st_mode, st.st_uid, st.st_gid, st.st_mtime, ""};
-    if (S_ISLNK(st.st_mode)) {
-      entry.data = fs::read_symlink(e.path()).string();
-    } else if (S_ISREG(st.st_mode)) {
-      entry.data = ReadFile(path);
-    }
-    tree[path.substr(top.size())] = entry;
+    char head[64];
+    snprintf(head, sizeof head, " %o %d:%d %ld ", st.st_mode, st.st_uid,
+             st.st_gid, S_ISDIR(st.st_mode) ? 0L : long(st.st_mtime));
+    std::string data = S_ISLNK(st.st_mode) ? fs::read_symlink(e.path()).string()
+                       : S_ISREG(st.st_mode) ? ReadFile(path)
+                                             : "";
+    lines[path.substr(top.size())] = head + data;
   }
-  return tree;
-}
-
-std::string Describe(const std::map<std::string, Entry>& tree) {
-  std::string out;
-  for (const auto& [name, e] : tree) {
-    char mode[16];
-    snprintf(mode, sizeof mode, "%o", e.mode);
-    out += name + " " + mode + " " + std::to_string(e.uid) + ":" +
-           std::to_string(e.gid) + "\n";
-  }
+  for (const auto& [name, line] : lines) out += name + line + "\n";
   return out;
 }
 
@@ -109,20 +89,8 @@ TEST_F(RsyncerTreeTest, AwkwardNamesLinksModesAndOwners) {
   ASSERT_TRUE(fs::create_directories(c_ + "/empty dir"));
 
   ASSERT_EQ(0, Push()) << app_.DaemonLog();
-  auto client = Snapshot(c_);
-  auto server = Snapshot(s_);
-  EXPECT_EQ(Describe(client), Describe(server));
-  for (const auto& [name, entry] : client) {
-    auto it = server.find(name);
-    ASSERT_NE(it, server.end()) << name;
-    EXPECT_TRUE(entry == it->second)
-        << name << ": mtime " << entry.mtime << " / " << it->second.mtime
-        << ", data '" << entry.data << "' / '" << it->second.data << "'";
-  }
-  // The link itself travels, not what it points at.
-  struct stat st;
-  ASSERT_EQ(0, lstat((s_ + "/link to dir").c_str(), &st));
-  EXPECT_TRUE(S_ISLNK(st.st_mode));
+  // Links travel as links, not as what they point at.
+  EXPECT_EQ(Snapshot(c_), Snapshot(s_));
   // A hard link stays one file with two names.
   struct stat a, b;
   ASSERT_EQ(0, stat((s_ + "/hard-a").c_str(), &a));
@@ -134,8 +102,7 @@ TEST_F(RsyncerTreeTest, AwkwardNamesLinksModesAndOwners) {
   ASSERT_EQ(0, chmod((c_ + "/quote\"d 'twice'").c_str(), 0444));
   ASSERT_EQ(0, Push());
   EXPECT_FALSE(fs::exists(s_ + "/new\nline"));
-  ASSERT_EQ(0, stat((s_ + "/quote\"d 'twice'").c_str(), &st));
-  EXPECT_EQ(0444u, st.st_mode & 07777);
+  EXPECT_EQ(Snapshot(c_), Snapshot(s_));
 }
 
 // Runs a command line of the acl tools; true on exit 0.

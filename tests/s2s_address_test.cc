@@ -10,9 +10,8 @@
 
 namespace {
 
+using s2s_test::Has;
 using s2s_test::ScopedEnv;
-using s2s_test::SyslogCapture;
-using s2s_test::TempRoot;
 using Addrs = std::vector<std::string>;
 
 // A root whose hosts file names the servers, with the system resolver shut
@@ -41,59 +40,49 @@ class UsableIpTest : public ::testing::Test {
         "echo \"No reply from $2\"; exit 1\n"));
   }
 
-  TempRoot root_;
+  s2s_test::TempRoot root_;
   ScopedEnv path_{"PATH", root_.Path("/bin") + ":/usr/bin:/bin"};
 };
 
-TEST_F(UsableIpTest, WithoutHostTheAddressIsTakenAsGiven) {
-  Addrs out{"kept"};
-  EXPECT_EQ(S2S::GetUsableIP("", "10.0.0.5", out), 0);
-  EXPECT_EQ(out, (Addrs{"kept", "10.0.0.5"}));
-}
-
-TEST_F(UsableIpTest, WithoutAddressEveryResolvedAddressIsOffered) {
+// The remembered address wins while it belongs to the host: by name
+// resolution, or by its NetBIOS name (case ignored) when it answers one.
+TEST_F(UsableIpTest, RememberedAddressWinsWhileItBelongsToTheHost) {
+  const struct {
+    const char *host, *remembered;
+    int result;
+    Addrs out;
+  } cases[] = {
+      {"", "10.0.0.5", 0, {"10.0.0.5"}},  // no host: taken as given
+      {"backup", "", 0, {"127.0.0.7", "127.0.0.8"}},
+      {"nosuch", "", -1, {}},
+      {"backup", "127.0.0.8", 0, {"127.0.0.8"}},
+      // A silent machine no longer the host's; an unknown name.
+      {"backup", "127.0.0.9", 0, {"127.0.0.7", "127.0.0.8"}},
+      {"nosuch", "127.0.0.9", 0, {"127.0.0.9"}},
+      {"Storage01", "127.0.0.5", 0, {"127.0.0.5"}},
+      // The NetBIOS name of another machine sends it to the resolver.
+      {"backup", "127.0.0.5", 0, {"127.0.0.7", "127.0.0.8"}},
+  };
+  for (const auto& c : cases) {
+    Addrs out = {"kept"}, want = {"kept"};  // addresses are appended
+    want.insert(want.end(), c.out.begin(), c.out.end());
+    EXPECT_EQ(S2S::GetUsableIP(c.host, c.remembered, out), c.result)
+        << c.host << " " << c.remembered;
+    EXPECT_EQ(out, want) << c.host << " " << c.remembered;
+  }
   KARO_IPADDR table[1];
   EXPECT_EQ(KARONetLookupIP("BACKUP", table, 1, 0), 1);  // bounded by max
-  Addrs out;
-  EXPECT_EQ(S2S::GetUsableIP("backup", "", out), 0);
-  EXPECT_EQ(out, (Addrs{"127.0.0.7", "127.0.0.8"}));
-  EXPECT_EQ(S2S::GetUsableIP("nosuch", "", out), -1);
-  EXPECT_EQ(out.size(), 2u);
-}
-
-TEST_F(UsableIpTest, RememberedAddressWinsWhileItBelongsToTheHost) {
-  Addrs out;
-  EXPECT_EQ(S2S::GetUsableIP("backup", "127.0.0.8", out), 0);
-  EXPECT_EQ(out, Addrs{"127.0.0.8"});
-
-  out.clear();  // silent machine, address no longer the host's
-  EXPECT_EQ(S2S::GetUsableIP("backup", "127.0.0.9", out), 0);
-  EXPECT_EQ(out, (Addrs{"127.0.0.7", "127.0.0.8"}));
-
-  out.clear();  // unknown name: the remembered address is all there is
-  EXPECT_EQ(S2S::GetUsableIP("nosuch", "127.0.0.9", out), 0);
-  EXPECT_EQ(out, Addrs{"127.0.0.9"});
-}
-
-TEST_F(UsableIpTest, NetbiosNameMatchesIgnoringCase) {
-  Addrs out;
-  EXPECT_EQ(S2S::GetUsableIP("Storage01", "127.0.0.5", out), 0);
-  EXPECT_EQ(out, Addrs{"127.0.0.5"});
-  out.clear();  // the name of another machine sends it to the resolver
-  EXPECT_EQ(S2S::GetUsableIP("backup", "127.0.0.5", out), 0);
-  EXPECT_EQ(out, (Addrs{"127.0.0.7", "127.0.0.8"}));
 }
 
 TEST_F(UsableIpTest, MissingNmblookupIsLoggedAndLookupGoesOn) {
   ScopedEnv no_path("PATH", root_.Path("/empty"));
-  SyslogCapture log;
+  s2s_test::SyslogCapture log;
   Addrs out;
   EXPECT_EQ(S2S::GetUsableIP("backup", "127.0.0.8", out), 0);
   EXPECT_EQ(out, Addrs{"127.0.0.8"});
   ASSERT_EQ(log.Messages().size(), 1u);
-  EXPECT_NE(log.Messages()[0].find("[ERROR] S2S/s2s("), std::string::npos);
-  EXPECT_NE(log.Messages()[0].find("): nmblookup_r: popen error\n"),
-            std::string::npos);
+  EXPECT_TRUE(Has(log.Messages()[0], "[ERROR] S2S/s2s("));
+  EXPECT_TRUE(Has(log.Messages()[0], "): nmblookup_r: popen error\n"));
 }
 
 TEST_F(UsableIpTest, SystemResolverAnswersNamesTheRootDoesNotKnow) {

@@ -13,8 +13,8 @@
 
 namespace {
 
+using s2s_test::Has;
 using s2s_test::SyslogCapture;
-using s2s_test::TempRoot;
 
 const char kShares[] =
     "[docs]\n\tpath=\"/volume1/docs\"\n\tencrypted=\"yes\"\n"
@@ -33,39 +33,43 @@ class ShareTest : public ::testing::Test {
   void SetUp() override {
     ASSERT_TRUE(root_.Write("/etc/s2s/shares.conf", kShares));
   }
-  TempRoot root_;
+  s2s_test::TempRoot root_;
 };
 
-TEST_F(ShareTest, PlainShareIsServedFromItsPath) {
-  S2S::ShareInfo info;
-  ASSERT_EQ(S2S::GetShareInfo("public", info), 0);
-  EXPECT_EQ(info.GetPath(), "/volume1/public/");
-  EXPECT_EQ(info.GetModulePath(), "/volume1/public/");
-  EXPECT_EQ(info.GetModuleName(), "public");
-  EXPECT_FALSE(info.IsEncrypted());
-  EXPECT_TRUE(info.IsWinShare());
-  EXPECT_TRUE(info.IsACL());  // a Windows share always carries ACLs
-  EXPECT_TRUE(info.IsCluster());
-  EXPECT_EQ(info.GetStatus(), 0x800u | 0x8000u);
+std::string Flags(const S2S::ShareInfo& i) {
+  std::string f;
+  if (i.IsEncrypted()) f += "enc ";
+  if (i.IsAutoMount()) f += "auto ";
+  if (i.IsACL()) f += "acl ";
+  if (i.IsWinShare()) f += "win ";
+  if (i.IsCluster()) f += "cluster ";
+  return f + std::to_string(i.GetEncryptKeyLen());
 }
 
-TEST_F(ShareTest, EncryptedShareIsServedFromItsLowerPath) {
-  S2S::ShareInfo info;
-  ASSERT_EQ(S2S::GetShareInfo("docs", info), 0);
-  EXPECT_EQ(info.GetName(), "docs");
-  EXPECT_EQ(info.GetPath(), "/volume1/docs");
-  EXPECT_EQ(info.GetModulePath(), "/volume1/@docs@");
-  EXPECT_EQ(info.GetModuleName(), "@docs@");
-  EXPECT_TRUE(info.IsEncrypted() && info.IsAutoMount());
-  EXPECT_FALSE(info.IsACL());
-  EXPECT_EQ(info.GetEncryptKeyLen(), 32u);
-
-  // Without a configured lower path it lies beside the share.
-  ASSERT_EQ(S2S::GetShareInfo("secret", info), 0);
-  EXPECT_EQ(info.GetModulePath(), "/volume2/@secret@");
-}
-
-TEST_F(ShareTest, FailuresAreLoggedOnceExceptForAnEmptyName) {
+// An encrypted share is served from its lower path, configured or beside
+// the share; a Windows share always carries ACLs.
+TEST_F(ShareTest, ShareInfoNamesTheModuleAndItsDirectory) {
+  const struct {
+    const char *name, *path, *module_path, *module, *flags;
+  } cases[] = {
+      {"public", "/volume1/public/", "/volume1/public/", "public",
+       "acl win cluster 0"},
+      {"docs", "/volume1/docs", "/volume1/@docs@", "@docs@", "enc auto 32"},
+      {"secret", "/volume2/secret", "/volume2/@secret@", "@secret@", "enc 0"},
+  };
+  for (const auto& c : cases) {
+    S2S::ShareInfo info;
+    ASSERT_EQ(S2S::GetShareInfo(c.name, info), 0);
+    EXPECT_EQ(info.GetName(), c.name);
+    EXPECT_EQ(info.GetPath(), c.path);
+    EXPECT_EQ(info.GetModulePath(), c.module_path);
+    EXPECT_EQ(info.GetModuleName(), c.module);
+    EXPECT_EQ(Flags(info), c.flags);
+    if (info.IsWinShare()) {
+      EXPECT_EQ(info.GetStatus(), 0x800u | 0x8000u);
+    }
+  }
+  // Failures are logged once, except for an empty name.
   SyslogCapture log;
   S2S::ShareInfo info;
   EXPECT_EQ(S2S::GetShareInfo("", info), -1);
@@ -74,11 +78,9 @@ TEST_F(ShareTest, FailuresAreLoggedOnceExceptForAnEmptyName) {
   EXPECT_EQ(S2S::GetShareInfo("nopath", info), -1);
   EXPECT_EQ(S2S::GetShareInfo("../etc", info), -1);
   ASSERT_EQ(log.Messages().size(), 3u);
-  EXPECT_NE(log.Messages()[0].find("S2S/s2s("), std::string::npos);
-  EXPECT_NE(log.Messages()[0].find("Fail to get share 'missing'\n"),
-            std::string::npos);
-  EXPECT_NE(log.Messages()[1].find("Fail to get the path of share 'nopath'"),
-            std::string::npos);
+  EXPECT_TRUE(Has(log.Messages()[0], "S2S/s2s("));
+  EXPECT_TRUE(Has(log.Messages()[0], "Fail to get share 'missing'\n"));
+  EXPECT_TRUE(Has(log.Messages()[1], "Fail to get the path of share 'nopath'"));
   EXPECT_EQ(info.GetName(), "");  // untouched by the failures
 }
 
@@ -87,20 +89,24 @@ TEST_F(ShareTest, VolumesAndValidity) {
   ASSERT_EQ(S2S::GetVolumeInfo("docs", vol), 0);
   EXPECT_EQ(vol.GetPath(), "/volume1");
   EXPECT_EQ(vol.GetName(), "volume1");
-  EXPECT_TRUE(vol.IsInternal());
   ASSERT_EQ(S2S::GetVolumeInfo("public", vol), 0);  // type defaults to 1
   EXPECT_TRUE(vol.IsInternal());
-
   bool valid = true;
   EXPECT_EQ(S2S::IsValidShare("usb", valid), 0);
   EXPECT_FALSE(valid);
   EXPECT_EQ(S2S::IsValidShare("docs", valid), 0);
   EXPECT_TRUE(valid);
-
   SyslogCapture log;
   EXPECT_EQ(S2S::IsValidShare("missing", valid), -1);
-  EXPECT_NE(log.Text().find("Fail to get share info\n"), std::string::npos);
-  EXPECT_NE(log.Text().find("Fail to get volume info\n"), std::string::npos);
+  EXPECT_TRUE(Has(log.Text(), "Fail to get share info\n"));
+  EXPECT_TRUE(Has(log.Text(), "Fail to get volume info\n"));
+  // A plug unit accepts only shares on its share bin.
+  ASSERT_TRUE(root_.Write("/etc/s2s/platform.conf",
+                          "[Platform]\n\tplug_unit=\"yes\"\n"));
+  EXPECT_EQ(S2S::IsValidShare("usb", valid), 0);
+  EXPECT_TRUE(valid);
+  EXPECT_EQ(S2S::IsValidShare("docs", valid), 0);
+  EXPECT_FALSE(valid);
 }
 
 TEST_F(ShareTest, VolumeFallsBackToTheRootsMountTable) {
@@ -123,21 +129,11 @@ TEST_F(ShareTest, VolumeFallsBackToTheRootsMountTable) {
   EXPECT_EQ(KLIBCErrGet(), KERR_INVALID_ARG);
 }
 
-TEST_F(ShareTest, PlugUnitAcceptsOnlyShareBinShares) {
-  ASSERT_TRUE(root_.Write("/etc/s2s/platform.conf",
-                          "[Platform]\n\tplug_unit=\"yes\"\n"));
-  bool valid = false;
-  EXPECT_EQ(S2S::IsValidShare("usb", valid), 0);
-  EXPECT_TRUE(valid);
-  EXPECT_EQ(S2S::IsValidShare("docs", valid), 0);
-  EXPECT_FALSE(valid);
-}
-
 TEST_F(ShareTest, KeyFilesAndShareNames) {
   KARO_SHARE* share = nullptr;
   char buf[4096];
-  ASSERT_EQ(KAROShareGet("docs", &share), 0);
   int flag = 0;
+  ASSERT_EQ(KAROShareGet("docs", &share), 0);
   ASSERT_EQ(KLIBShareIsAutoDecryptGet(share, &flag), 0);
   EXPECT_EQ(flag, 1);
   ASSERT_GT(KAROShareEncKeyFileGet(share, buf, sizeof buf), 0);
@@ -146,22 +142,18 @@ TEST_F(ShareTest, KeyFilesAndShareNames) {
   EXPECT_EQ(std::string(buf),
             root_.Path("/usr/karo/etc/.encrypt/docs.auto.key"));
   KAROShareFree(share);
-
-  ASSERT_EQ(KAROShareGet("secret", &share), 0);
+  ASSERT_EQ(KAROShareGet("secret", &share), 0);  // configured elsewhere
   ASSERT_GT(KAROShareEncKeyFileGet(share, buf, sizeof buf), 0);
   EXPECT_STREQ(buf, "/keys/secret.key");
   KAROShareFree(share);
-
   ASSERT_EQ(KAROShareGet("public", &share), 0);
   EXPECT_EQ(KAROShareEncKeyFileGet(share, buf, sizeof buf), -1);
   EXPECT_EQ(KLIBCErrGet(), KERR_NOT_FOUND);
   KAROShareFree(share);
-
   for (const char* bad : {"", ".", "..", "a/b", "a]b", "@x@", " x", "a\nb"}) {
     EXPECT_EQ(KaroShareNameValid(bad), 0) << bad;
   }
   EXPECT_EQ(KaroShareNameValid("My Share.2"), 1);
-
   KSZLIST* names = KLIBCSzListAlloc();
   ASSERT_EQ(KAROShareEnum(names), 5);
   EXPECT_STREQ(KLIBCSzListGet(names, 4), "nopath");
@@ -176,7 +168,6 @@ TEST(SimpleFileLockTest, ExcludesASecondProcessUntilReleased) {
   ASSERT_EQ(lock.UnLock(), 0);  // not held yet
   ASSERT_EQ(lock.ExLock(), 0);
   ASSERT_EQ(lock.ExLock(), 0);  // held already
-
   int pipefd[2];
   ASSERT_EQ(pipe(pipefd), 0);
   pid_t child = fork();
@@ -188,31 +179,27 @@ TEST(SimpleFileLockTest, ExcludesASecondProcessUntilReleased) {
     if (write(pipefd[1], refused ? "B" : "!", 1) != 1) _exit(2);
     S2S::SimpleFileLock waiter(path);
     bool got = waiter.ExLock() == 0;
-    if (write(pipefd[1], got ? "L" : "!", 1) != 1) _exit(2);
-    _exit(0);
+    _exit(write(pipefd[1], got ? "L" : "!", 1) == 1 ? 0 : 2);
   }
   close(pipefd[1]);
-  char c = 0;
-  ASSERT_EQ(read(pipefd[0], &c, 1), 1);
-  EXPECT_EQ(c, 'B');
+  char c[2] = {};
+  ASSERT_EQ(read(pipefd[0], c, 1), 1);
   ASSERT_EQ(lock.UnLock(), 0);
-  ASSERT_EQ(read(pipefd[0], &c, 1), 1);
-  EXPECT_EQ(c, 'L');
+  ASSERT_EQ(read(pipefd[0], c + 1, 1), 1);
+  EXPECT_EQ(std::string(c, 2), "BL");
   close(pipefd[0]);
   int status = 0;
   ASSERT_EQ(waitpid(child, &status, 0), child);
   EXPECT_EQ(status, 0);
   EXPECT_EQ(access(path.c_str(), F_OK), 0);  // the file stays
-}
 
-TEST(SimpleFileLockTest, UnopenableFileFailsEveryCall) {
   SyslogCapture log;
-  S2S::SimpleFileLock lock("/nonexistent-dir/s2s/lock");
-  EXPECT_EQ(lock.ExLock(), -1);
-  EXPECT_EQ(lock.UnLock(), -1);
-  EXPECT_NE(log.Text().find("Fail to open lock file at "
-                            "'/nonexistent-dir/s2s/lock', error:'No such file"),
-            std::string::npos);
+  S2S::SimpleFileLock unopenable("/nonexistent-dir/s2s/lock");
+  EXPECT_EQ(unopenable.ExLock(), -1);
+  EXPECT_EQ(unopenable.UnLock(), -1);
+  EXPECT_TRUE(Has(log.Text(),
+                  "Fail to open lock file at '/nonexistent-dir/s2s/lock', "
+                  "error:'No such file"));
 }
 
 }  // namespace

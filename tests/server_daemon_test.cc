@@ -116,47 +116,6 @@ class ServerDaemonTest : public ::testing::Test {
   std::unique_ptr<s2s_test::ScopedEnv> port_;
 };
 
-TEST_F(ServerDaemonTest, SyncRunAndDataModuleGuard) {
-  StartServer();
-  EXPECT_EQ(0,
-            Command("clientA", "S2S_PairingMultiSrc",
-                    {"serverName=\"srv\"", "syncShares=\"share1\"",
-                     "dryRun=\"no\"", "requireEncryptionShareSupport=\"no\""}));
-  // No running sync yet: the data module refuses the push.
-  EXPECT_NE(0, Push());
-  EXPECT_EQ(
-      0, Command("clientA", "S2S_SyncStart",
-                 {"volumeName=\"vol1\"", "shareName=\"share1\"",
-                  "isEncrypt=\"0\"", "isAutomount=\"0\"", "isEnableACL=\"1\"",
-                  "isWinShare=\"0\"", "lenEncKey=\"0\""}));
-  EXPECT_EQ(0, Push());
-  EXPECT_EQ("payload", ReadFile(tmp_.Sub("share1/file")));
-  // Only the client that holds the sync may finish it.
-  EXPECT_EQ(kNotSyncing, Command("clientB", "S2S_SyncFinish",
-                                 {"finishType=\"share\"", "name=\"share1\""}));
-  EXPECT_EQ(0, Command("clientA", "S2S_SyncFinish",
-                       {"finishType=\"share\"", "name=\"share1\""}));
-  EXPECT_NE(0, Push());
-  // A dry run needs no running sync from the client that feeds the share,
-  // and the daemon changes nothing.
-  std::filesystem::create_directories(tmp_.Sub("empty"));
-  EXPECT_EQ(0,
-            Rsync(kUser, kPassword,
-                  {"-n", "-r", "--delete", tmp_.Sub("empty") + "/", "share1/"},
-                  daemon_.port()));
-  EXPECT_EQ("payload", ReadFile(tmp_.Sub("share1/file")));
-  // Nothing is left in the spool once the connections are over: each
-  // command's cleaner removes its files when its connection has ended.
-  const std::string replies = tmp_.Sub("var/spool/s2s/reply");
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-  while (!std::filesystem::is_empty(replies) &&
-         std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::yield();
-  }
-  EXPECT_TRUE(std::filesystem::is_empty(replies));
-  EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("var/spool/s2s/early")));
-}
-
 TEST_F(ServerDaemonTest, OversizedCommandIsRefusedWithStatus) {
   StartServer();
   std::string big(kMaxCommandFile, 'x');
@@ -166,14 +125,24 @@ TEST_F(ServerDaemonTest, OversizedCommandIsRefusedWithStatus) {
                             {"taskName=\"" + std::string(3000, 'x') + "\""}));
 }
 
-// What a client that knows a daemon password tries against a share another
-// client syncs, against the real daemon. Each row's attempt must fail and
-// leave the victim's files as they were.
-TEST_F(ServerDaemonTest, HostileClientsAreRefused) {
+// A sync run against the real daemon, and what a client that knows a daemon
+// password tries against the share while another client syncs it. Each
+// row's attempt must fail and leave the victim's files as they were.
+TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   StartServer();
   const std::vector<std::string> start = {"volumeName=\"vol1\"",
                                           "shareName=\"share1\""};
+  const std::vector<std::string> finish = {"finishType=\"share\"",
+                                           "name=\"share1\""};
+  EXPECT_EQ(0,
+            Command("CL1", "S2S_PairingMultiSrc",
+                    {"serverName=\"srv\"", "syncShares=\"share1\"",
+                     "dryRun=\"no\"", "requireEncryptionShareSupport=\"no\""}));
+  // No running sync yet: the data module refuses the push.
+  EXPECT_NE(0, Push());
   ASSERT_EQ(0, Command("CL1", "S2S_SyncStart", start));
+  EXPECT_EQ(0, Push());
+  EXPECT_EQ("payload", ReadFile(tmp_.Sub("share1/file")));
   std::string keys = tmp_.Sub("usr/karo/etc/.encrypt");
   std::string upload = tmp_.Sub("var/spool/s2s/upload");
   std::filesystem::create_directories(tmp_.Sub("empty"));
@@ -216,9 +185,11 @@ TEST_F(ServerDaemonTest, HostileClientsAreRefused) {
             Command("CL1", "S2S_SyncStart", start, kOtherUser, kOtherPassword));
   EXPECT_EQ(kPairedElsewhere,
             Command("CLM", "S2S_SyncStart", start, kOtherUser, kOtherPassword));
-  EXPECT_EQ(kBadId, Command("CL1", "S2S_SyncFinish",
-                            {"finishType=\"share\"", "name=\"share1\""},
-                            kOtherUser, kOtherPassword));
+  EXPECT_EQ(kBadId, Command("CL1", "S2S_SyncFinish", finish, kOtherUser,
+                            kOtherPassword));
+  // Only the client that holds the sync may finish it.
+  EXPECT_EQ(kNotSyncing, Command("CLM", "S2S_SyncFinish", finish, kOtherUser,
+                                 kOtherPassword));
   // An oversized upload does not stay: the next upload clears it.
   EXPECT_EQ(0, Rsync(kOtherUser, kOtherPassword,
                      {tmp_.Sub("big"), "s2sspool/big"}, port));
@@ -234,8 +205,25 @@ TEST_F(ServerDaemonTest, HostileClientsAreRefused) {
                       {"--early-input=" + tmp_.Sub("cmd"), "s2scmd/a..b",
                        tmp_.Sub("empty") + "/"},
                       port));
-  EXPECT_EQ(0, Command("CL1", "S2S_SyncFinish",
-                       {"finishType=\"share\"", "name=\"share1\""}));
+  EXPECT_EQ(0, Command("CL1", "S2S_SyncFinish", finish));
+  EXPECT_NE(0, Push());
+  // A dry run needs no running sync from the client that feeds the share,
+  // and the daemon changes nothing.
+  EXPECT_EQ(0,
+            Rsync(kUser, kPassword,
+                  {"-n", "-r", "--delete", tmp_.Sub("empty") + "/", "share1/"},
+                  port));
+  EXPECT_EQ("payload", ReadFile(tmp_.Sub("share1/file")));
+  // Nothing is left in the spool once the connections are over: each
+  // command's cleaner removes its files when its connection has ended.
+  const std::string replies = tmp_.Sub("var/spool/s2s/reply");
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+  while (!std::filesystem::is_empty(replies) &&
+         std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::yield();
+  }
+  EXPECT_TRUE(std::filesystem::is_empty(replies));
+  EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("var/spool/s2s/early")));
 }
 
 }  // namespace

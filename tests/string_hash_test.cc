@@ -16,7 +16,6 @@ TEST(StringHash, KeepsInsertionOrderAndHonoursCapacity) {
   EXPECT_STREQ(KLIBCSzHashKeyAt(h, 0), "b");
   EXPECT_STREQ(KLIBCSzHashValueAt(h, 0), "3");
   EXPECT_EQ(KLIBCSzHashKeyAt(h, 2), nullptr);
-
   EXPECT_EQ(KLIBCSzHashGetValue(h, "c"), nullptr);
   EXPECT_EQ(KLIBCErrGet(), KERR_NOT_FOUND);
   EXPECT_EQ(KLIBCSzHashRemove(h, "b"), 0);
@@ -25,12 +24,11 @@ TEST(StringHash, KeepsInsertionOrderAndHonoursCapacity) {
   KLIBCSzHashClear(h);
   EXPECT_EQ(KLIBCSzHashCount(h), 0);
   KLIBCSzHashFree(h);
-
   EXPECT_EQ(KLIBCSzHashAlloc(0), nullptr);
   EXPECT_EQ(KLIBCErrGet(), KERR_INVALID_ARG);
 }
 
-TEST(StringList, PushesCopiesInOrder) {
+TEST(StringListAndString, CopiesInOrderAndFormats) {
   KSZLIST* l = KLIBCSzListAlloc();
   char s[] = "one";
   EXPECT_EQ(KLIBCSzListPush(l, s), 0);
@@ -41,12 +39,9 @@ TEST(StringList, PushesCopiesInOrder) {
   EXPECT_STREQ(KLIBCSzListGet(l, 0), "one");
   EXPECT_EQ(KLIBCSzListGet(l, 2), nullptr);
   KLIBCSzListFree(l);
-}
-
-TEST(FormattedString, FormatsAndReleases) {
-  char* s = KLIBCStrGet("SHARE_%s_%d", "a", 7);
-  EXPECT_STREQ(s, "SHARE_a_7");
-  KLIBCStrPut(s);
+  char* f = KLIBCStrGet("SHARE_%s_%d", "a", 7);
+  EXPECT_STREQ(f, "SHARE_a_7");
+  KLIBCStrPut(f);
   KLIBCStrPut(nullptr);
 }
 

@@ -1,43 +1,57 @@
 #include "S2S/sync_obj_schedule.h"
 
 #include <gtest/gtest.h>
+#include <stdio.h>
+#include <string.h>
 
 #include <string>
+#include <vector>
 
 #include "testutil.h"
 
 namespace {
 
 using S2S::Schedule;
-using s2s_test::LogCapture;
+using s2s_test::Has;
+using s2s_test::ScopedTZ;
 
-const char kPrefix[] = "[NOTE] S2S/sync_obj(";
+// A schedule written "<mode> <what> <HH:MM> [<period>x<repeat>]": mode W, M,
+// Y or O; <what> is the week string for W, the begin date YYYY-MM-DD else.
+Schedule Make(const std::string& spec) {
+  char mode = 0, what[16] = "";
+  int hour = 0, minute = 0;
+  long period = 0, repeat = 0;
+  int n = sscanf(spec.c_str(), "%c %15s %d:%d %ldx%ld", &mode, what, &hour,
+                 &minute, &period, &repeat);
+  EXPECT_TRUE(n == 4 || n == 6) << spec;
+  Schedule s;
+  s.SetMode(static_cast<S2S::SCHD_MODE>(std::string("..WMYO").find(mode)));
+  if (mode == 'W') {
+    s.SetWeekSchedule(what);
+  } else {
+    int y = 0, m = 0, d = 0;
+    EXPECT_EQ(sscanf(what, "%d-%d-%d", &y, &m, &d), 3) << spec;
+    s.SetBeginYear(y);
+    s.SetBeginMonth(m);
+    s.SetBeginDay(d);
+  }
+  s.SetStartHour(hour);
+  s.SetStartMinute(minute);
+  s.SetPeriod(period);
+  s.SetRepeatTimesInDay(repeat);
+  return s;
+}
 
-// What Validate() logged after the prefix and line number, or "" if
-// nothing was logged.
+// What Validate() logged after the prefix and line number, first line only
+// ("" if nothing was logged).
 std::string ValidateMessage(const Schedule& s, bool* ok) {
-  LogCapture log;
+  s2s_test::LogCapture log;
   *ok = s.Validate();
   std::string text = log.Text();
   if (text.empty()) return text;
-  EXPECT_EQ(text.rfind(kPrefix, 0), 0u) << text;
-  return text.substr(text.find("): ") + 3);
-}
-
-TEST(Schedule, DefaultIsAValidManualSchedule) {
-  Schedule s;
-  EXPECT_EQ(s.GetMode(), S2S::SCHD_MANUAL);
-  EXPECT_EQ(s.GetModeStr(), "manual");
-  bool ok = false;
-  EXPECT_EQ(ValidateMessage(s, &ok), "");
-  EXPECT_TRUE(ok);
-  // Every other member of the broken-down begin is zero, tm_isdst included.
-  struct tm b = s.GetScheduleBegin();
-  EXPECT_EQ(b.tm_year, 114);
-  EXPECT_EQ(b.tm_mon, 0);
-  EXPECT_EQ(b.tm_mday, 1);
-  EXPECT_EQ(b.tm_isdst, 0);
-  EXPECT_EQ(b.tm_sec, 0);
+  EXPECT_EQ(text.rfind("[NOTE] S2S/sync_obj(", 0), 0u) << text;
+  text = text.substr(text.find("): ") + 3);
+  return text.substr(0, text.find('\n') + 1);
 }
 
 TEST(Schedule, ModeStringsAreAsymmetricForUnknownValues) {
@@ -53,6 +67,9 @@ TEST(Schedule, ModeStringsAreAsymmetricForUnknownValues) {
     s.SetMode(S2S::SCHD_ONCE);
     s.SetModeByStr(c.text);
     EXPECT_EQ(s.GetMode(), c.mode) << c.text;
+    if (*c.text != '\0' && c.text[0] != 'W') {
+      EXPECT_EQ(s.GetModeStr(), c.text);
+    }
   }
   Schedule s;
   for (int m : {2, 6, 7, -1}) {
@@ -61,88 +78,63 @@ TEST(Schedule, ModeStringsAreAsymmetricForUnknownValues) {
   }
 }
 
-TEST(Schedule, ZeroPeriodOrRepeatClearsTheOther) {
+TEST(Schedule, SettersNormalisePeriodRepeatAndWeek) {
   Schedule s;
   s.SetRepeatTimesInDay(5);
-  s.SetPeriod(600);
-  EXPECT_EQ(s.GetRepeatTimesInDay(), 5);
-  s.SetPeriod(0);
+  s.SetPeriod(0);  // a zero period or repeat clears the other
   EXPECT_EQ(s.GetRepeatTimesInDay(), 0);
   s.SetPeriod(600);
-  s.SetRepeatTimesInDay(3);
   s.SetRepeatTimesInDay(0);
   EXPECT_EQ(s.GetPeriodSeconds(), 0);
   s.SetPeriod(1, 30);
   EXPECT_EQ(s.GetPeriodSeconds(), 5400);
-  EXPECT_EQ(s.GetPeriodHourPart(), 1);
-  EXPECT_EQ(s.GetPeriodMinutePart(), 30);
   s.SetPeriod(5430);
   EXPECT_EQ(s.GetPeriodHourPart(), 1);
   EXPECT_EQ(s.GetPeriodMinutePart(), 30);
-}
 
-TEST(Schedule, WeekScheduleIsNormalisedToSevenFlags) {
   const struct {
-    const char* in;
-    const char* stored;
-  } cases[] = {{"0000000", "1111111"},  {"101", "1111111"},
+    const char *in, *stored;
+  } weeks[] = {{"0000000", "1111111"},  {"101", "1111111"},
                {"", "1111111"},         {"0a00000", "0100000"},
                {"10000001", "1000000"}, {"0000010", "0000010"}};
-  for (const auto& c : cases) {
-    Schedule s;
+  for (const auto& w : weeks) {
     s.SetWeekSchedule("0010000");
-    s.SetWeekSchedule(c.in);
-    EXPECT_EQ(s.GetWeekSchedule(), c.stored) << c.in;
+    s.SetWeekSchedule(w.in);
+    EXPECT_EQ(s.GetWeekSchedule(), w.stored) << w.in;
   }
 }
 
 TEST(Schedule, ValidateReportsTheFirstBrokenRule) {
   const struct {
-    const char* what;
-    int hour, minute;
-    long period, repeat;
-    int year, month, day, mode;
-    const char* message;  // "" when valid
+    const char *spec, *message;  // "" when valid
   } cases[] = {
-      {"negative hour", -1, 0, 0, 0, 2014, 1, 1, 0, "Invalid begin hour\n"},
-      {"hour 24", 24, 0, 0, 0, 2014, 1, 1, 0, "Invalid begin hour\n"},
-      {"minute 60", 0, 60, 0, 0, 2014, 1, 1, 0, "Invalid begin minute\n"},
-      {"period a day", 0, 0, 86400, 1, 2014, 1, 1, 0,
-       "Invalid period or repeat\n"},
-      {"negative period", 0, 0, -60, 1, 2014, 1, 1, 0,
-       "Invalid period or repeat\n"},
-      {"repeat 96", 0, 0, 60, 96, 2014, 1, 1, 0, "Invalid period\n"},
-      {"last run tomorrow", 23, 0, 3600, 1, 2014, 1, 1, 0,
+      {"O 2014-01-01 -1:00", "Invalid begin hour\n"},
+      {"O 2014-01-01 24:00", "Invalid begin hour\n"},
+      {"O 2014-01-01 00:60", "Invalid begin minute\n"},
+      {"O 2014-01-01 00:00 86400x1", "Invalid period or repeat\n"},
+      {"O 2014-01-01 00:00 -60x1", "Invalid period or repeat\n"},
+      {"O 2014-01-01 00:00 60x96", "Invalid period\n"},
+      {"O 2014-01-01 23:00 3600x1",
        "Invalid repeat in day [82800 + 3600 * 1]\n"},
-      {"last run 23:59", 22, 59, 3600, 1, 2014, 1, 1, 0, ""},
-      {"29 February 2015", 0, 0, 0, 0, 2015, 2, 29, 0, "Invalid begin date\n"},
-      {"29 February 2016", 0, 0, 0, 0, 2016, 2, 29, 0, ""},
-      {"month 13", 0, 0, 0, 0, 2014, 13, 1, 0, "Invalid begin date\n"},
-      {"before the epoch", 0, 0, 0, 0, 1960, 1, 1, 0, "Invalid begin\n"},
-      {"mode 6", 0, 0, 0, 0, 2014, 1, 1, 6, "Invalid schedule mode [6]\n"},
-      {"mode -1", 0, 0, 0, 0, 2014, 1, 1, -1, "Invalid schedule mode [-1]\n"},
-      {"once", 0, 0, 0, 0, 2014, 1, 1, S2S::SCHD_ONCE, ""},
+      {"O 2014-01-01 22:59 3600x1", ""},  // the last run at 23:59
+      {"O 2015-02-29 00:00", "Invalid begin date\n"},
+      {"O 2016-02-29 00:00", ""},
+      {"O 2014-13-01 00:00", "Invalid begin date\n"},
+      {"O 1960-01-01 00:00", "Invalid begin\n"},  // before the epoch
   };
-  s2s_test::ScopedTZ tz("UTC");
+  ScopedTZ tz("UTC");
+  bool ok = false;
+  EXPECT_EQ(ValidateMessage(Schedule(), &ok), "");  // manual by default
+  EXPECT_TRUE(ok);
   for (const auto& c : cases) {
+    EXPECT_EQ(ValidateMessage(Make(c.spec), &ok), c.message) << c.spec;
+    EXPECT_EQ(ok, *c.message == '\0') << c.spec;
+  }
+  for (int mode : {6, -1}) {
     Schedule s;
-    s.SetStartHour(c.hour);
-    s.SetStartMinute(c.minute);
-    s.SetPeriod(c.period);
-    s.SetRepeatTimesInDay(c.repeat);
-    s.SetBeginYear(c.year);
-    s.SetBeginMonth(c.month);
-    s.SetBeginDay(c.day);
-    s.SetMode(static_cast<S2S::SCHD_MODE>(c.mode));
-    bool ok = true;
-    std::string message = ValidateMessage(s, &ok);
-    if (std::string(c.message) == "Invalid begin\n") {
-      // The normalised date follows on a second line.
-      EXPECT_EQ(message.substr(0, 14), c.message) << c.what;
-    } else {
-      EXPECT_EQ(message, c.message) << c.what;
-    }
-    EXPECT_EQ(ok, *c.message == '\0') << c.what;
+    s.SetMode(static_cast<S2S::SCHD_MODE>(mode));
+    EXPECT_EQ(ValidateMessage(s, &ok),
+              "Invalid schedule mode [" + std::to_string(mode) + "]\n");
   }
 }
 
@@ -158,6 +150,150 @@ TEST(Schedule, GetDaysToNextSyncCountsFromToday) {
     EXPECT_EQ(S2S::GetDaysToNextSync(c.wday, c.week), c.days)
         << c.wday << " " << c.week;
   }
+}
+
+// Local "YYYY-MM-DD HH:MM[:SS]" in the current zone, with " D" or " S" after
+// it to pick the daylight or standard reading of a doubled hour.
+long Local(const std::string& text) {
+  struct tm t;
+  memset(&t, 0, sizeof t);
+  int n = sscanf(text.c_str(), "%d-%d-%d %d:%d:%d", &t.tm_year, &t.tm_mon,
+                 &t.tm_mday, &t.tm_hour, &t.tm_min, &t.tm_sec);
+  EXPECT_GE(n, 5) << text;
+  const char flag = text[text.size() - 2] == ' ' ? text.back() : 0;
+  struct tm want = t;
+  t.tm_year -= 1900;
+  t.tm_mon -= 1;
+  t.tm_isdst = flag == 'D' ? 1 : flag == 'S' ? 0 : -1;
+  long s = mktime(&t);
+  // The clock must show the time as written, or the case is mistyped.
+  EXPECT_EQ(t.tm_hour * 60 + t.tm_min, want.tm_hour * 60 + want.tm_min) << text;
+  return s;
+}
+
+struct Case {
+  const char* schedule;
+  const char* now;
+  const char* next;  // local time, or "0"
+};
+
+void Check(const char* zone, const std::vector<Case>& cases) {
+  ScopedTZ tz(zone);
+  for (const Case& c : cases) {
+    Schedule s = Make(c.schedule);
+    ASSERT_TRUE(s.Validate()) << c.schedule;
+    long want = std::string(c.next) == "0" ? 0 : Local(c.next);
+    EXPECT_EQ(s.GetNextScheduledSeconds(Local(c.now)), want)
+        << zone << " " << c.schedule << " now " << c.now << " want " << c.next;
+  }
+}
+
+// No daylight-saving change lies between `now` and the answer in any zone,
+// so these hold everywhere.
+const std::vector<Case> kEverywhere = {
+    // Weekly: strictly later than now; repeats; chosen weekdays.
+    {"W 1111111 08:00", "2025-01-15 07:59:59", "2025-01-15 08:00"},
+    {"W 1111111 08:00", "2025-01-15 08:00", "2025-01-16 08:00"},
+    {"W 0000010 08:00", "2025-01-17 09:00", "2025-01-24 08:00"},
+    {"W 0000010 08:00", "2025-01-15 12:00", "2025-01-17 08:00"},
+    {"W 1111111 08:00 3600x2", "2025-01-15 08:00", "2025-01-15 09:00"},
+    {"W 1111111 08:00 3600x2", "2025-01-15 09:30", "2025-01-15 10:00"},
+    {"W 1111111 08:00 3600x2", "2025-01-15 10:00", "2025-01-16 08:00"},
+    {"W 1000000 23:30", "2025-01-18 23:45", "2025-01-19 23:30"},
+    {"W 1111111 23:00 1800x1", "2024-12-31 23:45", "2025-01-01 23:00"},
+    // Monthly: this month's day, else next month's; missing days roll on.
+    {"M 2014-01-15 08:00", "2025-01-14 12:00", "2025-01-15 08:00"},
+    {"M 2014-01-15 08:00", "2025-01-15 08:00", "2025-02-15 08:00"},
+    {"M 2014-01-15 08:00", "2025-01-16 00:00", "2025-02-15 08:00"},
+    {"M 2014-01-31 08:00", "2025-01-31 09:00", "2025-03-03 08:00"},
+    {"M 2014-01-30 08:00", "2025-01-31 09:00", "2025-03-02 08:00"},
+    {"M 2014-01-31 08:00", "2024-01-31 09:00", "2024-03-02 08:00"},
+    {"M 2014-01-29 08:00", "2024-02-10 00:00", "2024-02-29 08:00"},
+    {"M 2014-01-01 08:00", "2024-12-31 12:00", "2025-01-01 08:00"},
+    {"M 2014-01-01 08:00 600x3", "2025-02-01 08:25", "2025-02-01 08:30"},
+    // Yearly: 29 February of a common year is 1 March.
+    {"Y 2016-02-29 08:00", "2025-01-10 00:00", "2025-03-01 08:00"},
+    {"Y 2016-02-29 08:00", "2024-01-10 00:00", "2024-02-29 08:00"},
+    {"Y 2016-02-29 08:00", "2024-02-29 09:00", "2025-03-01 08:00"},
+    {"Y 2014-01-20 08:00", "2025-01-21 00:00", "2026-01-20 08:00"},
+    {"Y 2014-12-31 08:00", "2024-12-31 07:00", "2024-12-31 08:00"},
+    // Once: its date at the start time and repeats, then over.
+    {"O 2025-01-16 08:00", "2025-01-15 10:00", "2025-01-16 08:00"},
+    {"O 2025-01-14 08:00", "2025-01-15 10:00", "0"},
+    {"O 2025-01-15 08:00 3600x2", "2025-01-15 08:30", "2025-01-15 09:00"},
+    {"O 2025-01-15 08:00 3600x2", "2025-01-15 10:00", "0"},
+    {"O 2027-01-15 08:00", "2025-01-15 10:00", "2027-01-15 08:00"},
+};
+
+// Around daylight-saving changes. Every broken-down time inherits its DST
+// flag, so a run on the day of a change, or a month or year after a
+// candidate read on the other side of one, comes out as mktime reads the
+// start time with that flag.
+// Berlin: 2025-03-30 02:00 -> 03:00, 2025-10-26 03:00 -> 02:00.
+const std::vector<Case> kBerlin = {
+    {"W 1111111 02:30", "2025-03-30 01:00", "2025-03-30 03:30"},
+    {"W 1111111 02:30", "2025-03-29 12:00", "2025-03-30 03:30"},
+    {"W 1111111 08:00", "2025-03-29 12:00", "2025-03-30 09:00"},
+    {"W 1111111 08:00", "2025-03-30 12:00", "2025-03-31 08:00"},
+    {"W 1111111 01:00 3600x3", "2025-03-30 01:30", "2025-03-30 03:00"},
+    {"W 1111111 08:00", "2025-10-25 12:00", "2025-10-26 07:00"},
+    {"W 1111111 02:30", "2025-10-26 01:00", "2025-10-26 02:30 D"},
+    {"M 2014-01-15 08:00", "2025-10-16 10:00", "2025-11-15 07:00"},
+    {"M 2014-01-31 08:00", "2025-04-05 12:00", "2025-05-01 08:00"},
+};
+// New York: 2025-03-09 02:00 -> 03:00, 2025-11-02 02:00 -> 01:00.
+const std::vector<Case> kNewYork = {
+    {"W 1111111 02:30", "2025-03-09 00:30", "2025-03-09 03:30"},
+    {"W 1111111 01:30", "2025-11-02 00:30", "2025-11-02 01:30 D"},
+    {"W 1111111 01:30", "2025-11-02 01:45 D", "2025-11-02 01:30 S"},
+    {"M 2014-01-09 08:00", "2025-02-10 12:00", "2025-03-09 09:00"},
+    {"M 2014-01-31 08:00", "2025-04-10 12:00", "2025-05-01 08:00"},
+};
+// Lord Howe, half-hour shifts: 2025-04-06 02:00 -> 01:30,
+// 2025-10-05 02:00 -> 02:30.
+const std::vector<Case> kLordHowe = {
+    {"W 1111111 02:15", "2025-10-05 01:00", "2025-10-05 02:45"},
+    {"W 1111111 08:00", "2025-10-04 12:00", "2025-10-05 08:30"},
+    {"W 1111111 01:45", "2025-04-06 01:00", "2025-04-06 01:45 D"},
+    {"W 1111111 08:00", "2025-04-05 12:00", "2025-04-06 07:30"},
+    {"Y 2014-10-05 08:00", "2025-07-01 12:00", "2025-10-05 08:00"},
+};
+
+TEST(NextScheduledSeconds, ModeTableInEveryZoneAndAroundDstChanges) {
+  for (const char* zone :
+       {"UTC", "Europe/Berlin", "America/New_York", "Australia/Lord_Howe"}) {
+    Check(zone, kEverywhere);
+  }
+  Check("Europe/Berlin", kBerlin);
+  Check("America/New_York", kNewYork);
+  Check("Australia/Lord_Howe", kLordHowe);
+}
+
+TEST(NextScheduledSeconds, ManualRealtimeNegativeNowAndFailures) {
+  ScopedTZ tz("Europe/Berlin");
+  Schedule s;
+  for (long now : {0L, 1L, 1735689600L}) {
+    s.SetMode(S2S::SCHD_MANUAL);
+    EXPECT_EQ(s.GetNextScheduledSeconds(now), 0);
+    s.SetMode(S2S::SCHD_REALTIME);
+    EXPECT_EQ(s.GetNextScheduledSeconds(now), now + 1);
+  }
+  for (int mode = 0; mode <= 6; ++mode) {
+    s.SetMode(static_cast<S2S::SCHD_MODE>(mode));
+    EXPECT_EQ(s.GetNextScheduledSeconds(-5), -1) << mode;
+  }
+  s2s_test::LogCapture log;
+  s.SetMode(static_cast<S2S::SCHD_MODE>(9));
+  EXPECT_EQ(s.GetNextScheduledSeconds(1735689600L), -1);
+  EXPECT_TRUE(Has(log.Text(), "[ERROR] S2S/sync_obj("));
+  EXPECT_TRUE(Has(log.Text(), "): Unknown schedule mode [9]\n"));
+  // A day that never has a run cannot make the walk go on for ever.
+  log.Clear();
+  s.SetMode(S2S::SCHD_WEEKLY);
+  s.SetPeriod(60);
+  s.SetRepeatTimesInDay(-1);
+  EXPECT_EQ(s.GetNextScheduledSeconds(1735689600L), -1);
+  EXPECT_TRUE(Has(log.Text(), "Fail to align to scheduled day"));
 }
 
 }  // namespace

@@ -1,38 +1,45 @@
+// Shares, events, server settings and tasks: their validation, their text
+// dumps, and their mapping to the flat maps in which they cross an IPC link.
 #include "S2S/sync_obj_task.h"
 
 #include <gtest/gtest.h>
 
 #include <list>
+#include <sstream>
 #include <string>
+#include <thread>
 
+#include "S2S/ipc.h"
+#include "S2S/sync_obj_dump.h"
+#include "S2S/sync_obj_pobject.h"
 #include "S2S/sync_obj_share.h"
 #include "testutil.h"
 
 namespace {
 
+using S2S::PObject;
 using S2S::SyncInfo;
+using S2S::SyncTask;
 using S2S::TaskInfo;
-using s2s_test::LogCapture;
+using s2s_test::Has;
 
 // Validate()'s answer and what it logged after the "[NOTE] S2S/sync_obj(
-// <line>): " prefix ("" when nothing was logged).
+// <line>): " prefix of its last message ("" when nothing was logged).
 template <typename T>
 std::string Validated(const T& obj, bool* ok) {
-  LogCapture log;
+  s2s_test::LogCapture log;
   *ok = obj.Validate();
   std::string text = log.Text();
   if (text.empty()) return text;
-  EXPECT_EQ(text.rfind("[NOTE] S2S/sync_obj(", 0), 0u) << text;
-  return text.substr(text.find("): ") + 3);
+  EXPECT_TRUE(Has(text, "[NOTE] S2S/sync_obj(")) << text;
+  return text.substr(text.rfind("): ") + 3);
 }
 
-// The message of a Validate() that must fail.
 template <typename T>
-std::string Rejection(const T& obj) {
-  bool ok = true;
-  std::string message = Validated(obj, &ok);
-  EXPECT_FALSE(ok) << message;
-  return message;
+std::string Dump(const T& value) {
+  std::ostringstream out;
+  out << value;
+  return out.str();
 }
 
 SyncInfo ValidSyncInfo() {
@@ -42,10 +49,36 @@ SyncInfo ValidSyncInfo() {
   return info;
 }
 
-TEST(ShareAndEvent, RelativePathIsMadeAbsoluteOnly) {
+SyncTask FullTask() {
+  SyncTask task;
+  task.SetID(0xFFFFFFFFFFFFFFF0ULL);
+  TaskInfo& info = task.GetInfo();
+  info.SetName("nightly");
+  info.SetShareList({"docs", "photos", "docs"});
+  SyncInfo sync = ValidSyncInfo();
+  sync.SetPassword("s3cret");
+  sync.SetServerIP("10.0.0.2");
+  sync.SetCompression(true);
+  sync.SetBlockLevelSync(true);
+  sync.SetSSHPort(2222);
+  sync.SetMaxBandwidth(4096);
+  info.SetSyncInfo(sync);
+  S2S::Schedule& s = info.GetSchedule();
+  s.SetMode(S2S::SCHD_WEEKLY);
+  s.SetWeekSchedule("0101010");
+  s.SetBeginYear(2024);
+  s.SetBeginMonth(2);
+  s.SetBeginDay(29);
+  s.SetStartHour(8);
+  s.SetStartMinute(5);
+  s.SetPeriod(5430);  // the seconds below a minute do not travel
+  s.SetRepeatTimesInDay(3);
+  return task;
+}
+
+TEST(ShareAndEvent, RelativePathIsMadeAbsoluteAndBothDump) {
   const struct {
-    const char* in;
-    const char* stored;
+    const char *in, *stored;
   } cases[] = {{"", "/"},     {"/", "/"},      {"//x", "//x"},
                {"x/", "/x/"}, {"a/b", "/a/b"}, {"/a/../b", "/a/../b"}};
   for (const auto& c : cases) {
@@ -53,9 +86,18 @@ TEST(ShareAndEvent, RelativePathIsMadeAbsoluteOnly) {
     e.SetRelativePath(c.in);
     EXPECT_EQ(e.GetRelativePath(), c.stored) << c.in;
   }
-  S2S::Event e;  // empty until set, not "/"
-  EXPECT_EQ(e.GetRelativePath(), "");
-  EXPECT_EQ(e.GetStatus(), 0);
+  S2S::Share share;
+  share.SetID(18446744073709551615ULL);
+  share.SetName("docs");
+  EXPECT_EQ(Dump(share), "id: ... 18446744073709551615\nname: . docs\n");
+  S2S::Event event;
+  event.SetID(3);
+  event.SetShareName("docs");
+  event.SetRelativePath("a/b");
+  event.SetStatus(static_cast<S2S::EVENT_STATUS>(-1));
+  EXPECT_EQ(Dump(event),
+            "id: ............ 3\nshare_name: .... docs\n"
+            "relative_path: . /a/b\nstatus: ........ -1\n");
 }
 
 TEST(SyncInfo, FlagSettersTouchOnlyTheirBit) {
@@ -63,13 +105,12 @@ TEST(SyncInfo, FlagSettersTouchOnlyTheirBit) {
   info.SetSyncConfigFlag(0xF0);
   info.SetSSH(true);
   EXPECT_EQ(info.GetSyncConfigFlag(), 0xF2u);
-  EXPECT_FALSE(info.UseCompression());
   info.SetCompression(true);
   info.SetBlockLevelSync(true);
   EXPECT_EQ(info.GetSyncConfigFlag(), 0xF7u);
   info.SetSSH(false);
   EXPECT_EQ(info.GetSyncConfigFlag(), 0xF5u);
-  EXPECT_TRUE(info.UseBlockLevelSync());
+  EXPECT_TRUE(info.UseBlockLevelSync() && info.UseCompression());
   EXPECT_FALSE(info.UseSSH());
 }
 
@@ -97,28 +138,28 @@ TEST(SyncInfo, ValidateNeedsAServerAUserAndAPort) {
   }
 }
 
-TEST(TaskInfo, ValidateChecksInOrder) {
-  TaskInfo task;
-  EXPECT_EQ(Rejection(task), "Empty server ip and name\n");
-  task.SetSyncInfo(ValidSyncInfo());
-  task.GetSchedule().SetStartHour(24);
-  EXPECT_EQ(Rejection(task), "Invalid begin hour\n");
-  task.GetSchedule().SetStartHour(8);
-  task.SetShareList({"unknown"});
-  // The name is looked at before the share list; no line end follows.
-  EXPECT_EQ(Rejection(task), "Empty task name");
-  task.SetName("nightly");
-  task.SetShareList({});
-  EXPECT_EQ(Rejection(task), "Empty share list");
-}
-
-TEST(TaskInfo, EveryShareMustBeSyncable) {
+TEST(TaskInfo, ValidateChecksInOrderAndEveryShareMustBeSyncable) {
   s2s_test::TempRoot root;
   ASSERT_TRUE(
       root.Write("/etc/s2s/shares.conf",
                  "[docs]\n\tpath=\"/volume1/docs\"\n\tvolume=\"/volume1\"\n"
                  "[usb]\n\tpath=\"/media/usb/p\"\n\tvolume=\"/media/usb\"\n"
                  "\tvolume_type=\"3\"\n"));
+  TaskInfo task;
+  bool ok = true;
+  EXPECT_EQ(Validated(task, &ok), "Empty server ip and name\n");
+  task.SetSyncInfo(ValidSyncInfo());
+  task.GetSchedule().SetStartHour(24);
+  EXPECT_EQ(Validated(task, &ok), "Invalid begin hour\n");
+  task.GetSchedule().SetStartHour(8);
+  task.SetShareList({"unknown"});
+  // The name is looked at before the share list; no line end follows.
+  EXPECT_EQ(Validated(task, &ok), "Empty task name");
+  task.SetName("nightly");
+  task.SetShareList({});
+  EXPECT_EQ(Validated(task, &ok), "Empty share list");
+  EXPECT_FALSE(ok);
+  // An unknown share is reported by the host layer first.
   const struct {
     std::list<std::string> shares;
     const char* message;  // "" when valid
@@ -128,39 +169,151 @@ TEST(TaskInfo, EveryShareMustBeSyncable) {
       {{"missing", "usb"}, "Share 'missing' is not valid\n"},
   };
   for (const auto& c : cases) {
-    TaskInfo task;
-    task.SetName("nightly");
-    task.SetSyncInfo(ValidSyncInfo());
     task.SetShareList(c.shares);
-    LogCapture log;
-    bool ok = task.Validate();
+    EXPECT_EQ(Validated(task, &ok), c.message);
     EXPECT_EQ(ok, *c.message == '\0') << c.message;
-    // An unknown share is reported by the host layer first.
-    std::string text = log.Text();
-    if (!ok) {
-      EXPECT_EQ(text.substr(text.rfind("): ") + 3), c.message);
-      EXPECT_NE(text.rfind("[NOTE] S2S/sync_obj("), std::string::npos);
-    }
   }
 }
 
-TEST(SyncTask, SetInfoCopiesEveryField) {
-  TaskInfo info;
-  info.SetName("nightly");
-  info.SetShareList({"a", "b"});
-  info.SetSyncInfo(ValidSyncInfo());
-  info.GetSchedule().SetMode(S2S::SCHD_MONTHLY);
-  S2S::SyncTask task;
-  task.SetID(7);
-  task.SetInfo(info);
-  const TaskInfo before = info;
-  EXPECT_TRUE(task.GetInfo() == before);
-  info.SetName("changed");
-  info.SetShareList({"c"});
-  info.GetSchedule().SetMode(S2S::SCHD_ONCE);
-  EXPECT_TRUE(task.GetInfo() == before);
-  EXPECT_FALSE(task.GetInfo() == info);
-  EXPECT_EQ(task.GetID(), 7u);
+TEST(SyncTaskDump, ScheduleWithItsLastRunAndTaskWithoutPassword) {
+  S2S::Schedule s;
+  s.SetMode(S2S::SCHD_MONTHLY);
+  s.SetStartHour(8);
+  s.SetStartMinute(5);
+  s.SetPeriod(5430);
+  s.SetRepeatTimesInDay(2);
+  s.SetBeginDay(9);
+  std::ostringstream out;
+  out << s;
+  EXPECT_EQ(out.str(),
+            "mode: ................ monthly\n"
+            "week_schd: ............. 1111111\n"
+            "schedule_begin: ...... 2014-01-09 08:05:00\n"
+            "period: .............. 01:30\n"
+            "repeat_times_in_day: . 2\n"
+            "last sync in day: .... 11:06\n");
+  EXPECT_EQ(out.fill(), '0');  // the fill is left behind
+
+  SyncTask task = FullTask();
+  task.SetID(42);
+  task.GetInfo().SetShareList({"a", "b"});
+  std::string dump = Dump(task);
+  EXPECT_EQ(dump.substr(0, dump.find("mode: ")),
+            "id: ................... 42\n"
+            "name: ................. nightly\n"
+            "share_list: ........... a,b,\n"
+            "<Server Info>\n"
+            "user: ................. admin\n"
+            "server_ip: ............ 10.0.0.2\n"
+            "server_name: .......... backup\n"
+            "use compression: ...... yes\n"
+            "use block level sync: . yes\n"
+            "use ssh: .............. no\n"
+            "ssh port: ............. 2222\n"
+            "max bandwidth: ........ 4096\n"
+            "<Schedule>\n");
+  EXPECT_FALSE(Has(dump, "s3cret"));
+}
+
+// The way tasks really travel: as maps between processes' IPC ends. The
+// serving end rebuilds the task and sends it back as a map of its own.
+TEST(SyncTaskMapping, TaskCrossesAnIpcLinkAndIsRebuiltEqual) {
+  SyncTask task = FullTask();
+  PObject map;
+  map["other"] = "kept";
+  S2S::SyncTask2PObj(task, map);
+  EXPECT_EQ(map["other"].asString(), "kept");
+  EXPECT_EQ(map["schedule_mode"].asInt32(), 2);
+  EXPECT_EQ(map["period_hour"].asInt32(), 1);
+  EXPECT_EQ(map["period_minute"].asInt32(), 30);
+  EXPECT_EQ(map["compress"].asUInt64(), 1u);
+  EXPECT_EQ(map["ssh"].asUInt64(), 0u);
+  EXPECT_EQ(map["share_list"].asArray().size(), 3u);
+
+  s2s_test::TempDir dir;
+  S2S::IPCListener listener;
+  ASSERT_EQ(listener.prepare(dir.Sub("ipc.sock")), 0);
+  std::thread server([&listener] {
+    S2S::IPCSender end;
+    if (listener.isReady() != 1 || end.assign(listener.accept()) != 0) return;
+    PObject request, reply;
+    if (end.recv(request) != 0) return;
+    SyncTask rebuilt;
+    S2S::PObj2SyncTask(request, rebuilt);
+    S2S::SyncTask2PObj(rebuilt, reply);
+    end.send(reply);
+  });
+  S2S::IPCSender client;
+  ASSERT_EQ(client.connect(dir.Sub("ipc.sock")), 0);
+  PObject reply;
+  EXPECT_EQ(client.send(map, true, reply), 0);
+  server.join();
+  SyncTask back;
+  S2S::PObj2SyncTask(reply, back);
+  EXPECT_EQ(back.GetInfo().GetSchedule().GetPeriodSeconds(), 5400);
+  back.GetInfo().GetSchedule().SetPeriod(5430);
+  EXPECT_TRUE(back == task);
+  EXPECT_EQ(back.GetInfo().GetSyncInfo().GetPassword(), "s3cret");
+}
+
+TEST(SyncTaskMapping, WhatTheMapLacksIsResetExceptForServerSettings) {
+  SyncTask task = FullTask();
+  PObject map;
+  map["name"] = "renamed";
+  map["status"] = -2;
+  map["sync_result"] = 5;
+  S2S::TASK_STATUS status;
+  S2S::TASK_RESULT result;
+  S2S::PObj2SyncTask(map, task, status, result);
+  EXPECT_EQ(task.GetID(), 0xFFFFFFFFFFFFFFF0ULL);
+  TaskInfo want;
+  want.SetName("renamed");
+  EXPECT_TRUE(task.GetInfo() == want);
+  EXPECT_EQ(status, -2);
+  EXPECT_EQ(result, 5);
+  S2S::PObj2SyncTask(PObject(), task, status, result);
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(result, 0);
+
+  // PObj2SyncInfo, by contrast, keeps what the map lacks.
+  SyncInfo sync = FullTask().GetInfo().GetSyncInfo();
+  PObject only_user;
+  only_user["user"] = "other";
+  S2S::PObj2SyncInfo(only_user, sync);
+  EXPECT_EQ(sync.GetUser(), "other");
+  EXPECT_EQ(sync.GetPassword(), "s3cret");
+  EXPECT_TRUE(sync.UseCompression());
+}
+
+TEST(SyncTaskMapping, ScheduleKeysAreAppliedThroughTheSetters) {
+  const struct {
+    const char* what;
+    int hour, minute, repeat;  // -1: key absent
+    long period, repeat_out;
+  } cases[] = {
+      {"period 0, repeat 3", 0, 0, 3, 0, 3},
+      {"period 1:00, repeat 0", 1, 0, 0, 0, 0},
+      {"period 0:30, repeat 2", 0, 30, 2, 1800, 2},
+      {"hour without minute", 2, -1, -1, 0, 0},
+  };
+  for (const auto& c : cases) {
+    PObject map;
+    if (c.hour >= 0) map["period_hour"] = c.hour;
+    if (c.minute >= 0) map["period_minute"] = c.minute;
+    if (c.repeat >= 0) map["repeat_times_in_day"] = c.repeat;
+    SyncTask task;
+    S2S::PObj2SyncTask(map, task);
+    const S2S::Schedule& s = task.GetInfo().GetSchedule();
+    EXPECT_EQ(s.GetPeriodSeconds(), c.period) << c.what;
+    EXPECT_EQ(s.GetRepeatTimesInDay(), c.repeat_out) << c.what;
+  }
+  PObject map;
+  map["week_schd"] = "0000000";
+  map["schedule_mode"] = 9;
+  SyncTask task;
+  S2S::PObj2SyncTask(map, task);
+  EXPECT_EQ(task.GetInfo().GetSchedule().GetWeekSchedule(), "1111111");
+  EXPECT_EQ(task.GetInfo().GetSchedule().GetMode(), 9);
 }
 
 }  // namespace
