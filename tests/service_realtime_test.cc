@@ -332,22 +332,18 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   EXPECT_LE(0, Arrival(odd[2] + odd[0], "both\n"));
   EXPECT_TRUE(WaitFor([&] { return Same(); }, 10));
 
-  // A burst: 10,000 files in 1,000 new directories. The deadline is for
-  // a loaded machine, where each file costs milliseconds on both sides.
+  // A burst: 1,000 files in 100 new directories, far more paths than one
+  // batch pushes one by one.
   size_t runs_before = RsyncRuns();
-  for (int d = 0; d < 1000; ++d) {
+  for (int d = 0; d < 100; ++d) {
     std::string dir = client_ + "/burst/d" + std::to_string(d);
     fs::create_directories(dir);
     for (int f = 0; f < 10; ++f) WriteFile(dir + "/f" + std::to_string(f), "b");
   }
-  ASSERT_TRUE(WaitFor([&] { return Files(server_ + "/burst") == 10000; }, 300))
+  ASSERT_TRUE(WaitFor([&] { return Files(server_ + "/burst") == 1000; }, 120))
       << Log();
   EXPECT_TRUE(Same());
-  size_t runs = RsyncRuns() - runs_before;
-  std::printf(
-      "[ burst    ] 10,000 files in 1,000 directories: %zu rsync runs (%s)\n",
-      runs, GetParam());
-  EXPECT_LE(runs, 10u);
+  EXPECT_LE(RsyncRuns() - runs_before, 10u);
 
   // The share's directory goes: no longer watched, and watched again when
   // it is back.
@@ -356,7 +352,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
       [&] {
         const PObject share = Share();
         return !share["watching"].asBool() &&
-               share["message"].asString().find("went away") !=
+               share["message"].asString().find("deleted, moved") !=
                    std::string::npos;
       },
       10))

@@ -420,7 +420,7 @@ void WriteBlob(const std::string& path, int mb) {
 
 TEST_F(ServiceTest, ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce) {
   WriteFile(app_.ClientShare("docs") + "/a.txt", "alpha\n");
-  WriteBlob(app_.ClientShare("big") + "/blob", 100);
+  WriteBlob(app_.ClientShare("big") + "/blob", 4);
   // The next run, as the service sees the clock, is 3 s away.
   StartDaemon(OffsetTo(57));
   unsigned long long sched = Add("sched", {"docs"}, EveryMinute());
@@ -439,12 +439,12 @@ TEST_F(ServiceTest, ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce) {
             again["message"].asString().find("running already"));
   ASSERT_TRUE(WaitFor(Ended(manual, "ok"), 30));
   EXPECT_EQ(1u, Runs(manual).size()) << "the second run was started";
-  EXPECT_EQ(100u << 20,
+  EXPECT_EQ(4u << 20,
             std::filesystem::file_size(app_.ServerShare("big") + "/blob"));
   // rsync's --stats of the run: one file, all of it sent as data.
   PObject big = Runs(manual)[0]["shares"].asArray()[0];
   EXPECT_EQ(1u, big["files"].asUInt64());
-  EXPECT_EQ(100u << 20, big["bytes"].asUInt64());
+  EXPECT_EQ(4u << 20, big["bytes"].asUInt64());
   EXPECT_EQ(0u, big["matched"].asUInt64());
   EXPECT_LT(0u, big["speed"].asUInt64());
   EXPECT_EQ(0, StopDaemon());
@@ -471,13 +471,13 @@ TEST_F(ServiceTest, ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce) {
 }
 
 TEST_F(ServiceTest, CancelEndsALongTransferAndTheServerShowsTheTaskIdle) {
-  WriteBlob(app_.ClientShare("big") + "/blob", 400);
+  WriteBlob(app_.ClientShare("big") + "/blob", 40);
   StartDaemon(0);
   unsigned long long id = Add("long", {"big"}, S2S::Schedule());
-  // 100 MiB/s: long enough for rsync to report its progress.
+  // 10 MiB/s: long enough for rsync to report its progress.
   PObject limit = Action("update", id);
   limit["task"] = PObject::Map();
-  limit["task"]["max_bandwidth"] = 102400u;
+  limit["task"]["max_bandwidth"] = 10240u;
   ASSERT_EQ(0u, Request(limit)["result"].asUInt64());
   ASSERT_EQ(0u, Request(Action("run", id))["result"].asUInt64());
   // Wait for the data transfer itself.

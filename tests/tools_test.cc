@@ -343,19 +343,20 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
 // runs nest inside the transfer's wait without disturbing it.
 TEST_F(ToolsTest, TaskFileRunWithBeaconsDuringTheTransfer) {
   std::string client = MakeClient("client", "CLIENT-A");
-  WriteBlob(client + "/volume1/big/blob", 64);
+  WriteBlob(client + "/volume1/big/blob", 8);
   std::string task = tmp_.Sub("t.task");
   WriteFile(task,
             "[Task]\n\tname=\"filetask\"\n\tserver_ip=\"127.0.0.1\"\n"
             "\tuser=\"s2s\"\n\tshares=\"docs:big\"\n\tport=\"" +
                 port_ + "\"\n\tpassword_file=\"" + pw_file_ + "\"\n");
-  Child c =
-      RunProgram(tmp_.path(), {S2S_CLIENT_PROGRAM, "--root", client,
-                               "--task-file", task, "--beacon-interval", "0"});
+  // Two seconds of transfer: time for beacons while it runs.
+  Child c = RunProgram(
+      tmp_.path(), {S2S_CLIENT_PROGRAM, "--root", client, "--task-file", task,
+                    "--beacon-interval", "0", "--max-bandwidth", "4096"});
   ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
   EXPECT_NE(std::string::npos, c.out.find("beacon: transfer running")) << c.out;
   EXPECT_NE(std::string::npos, c.out.find("2/2 shares synced")) << c.out;
-  EXPECT_EQ(64u << 20,
+  EXPECT_EQ(8u << 20,
             std::filesystem::file_size(server_ + "/volume1/big/blob"));
   Child status = RunProgram(tmp_.path(),
                             {S2S_SERVER_PROGRAM, "--root", server_, "status"});
@@ -623,8 +624,8 @@ TEST_F(ToolsTest, DryRunListsTheChangesAndChangesNothingOnTheServer) {
 // had not arrived, from the part the server kept.
 TEST_F(ToolsTest, ACutTransferResumesFromWhatArrived) {
   std::string client = MakeClient("client", "CLIENT-A");
-  const double kSize = 48 << 20;
-  WriteBlob(client + "/volume1/big/blob", 48);
+  const double kSize = 24 << 20;
+  WriteBlob(client + "/volume1/big/blob", 24);
   // Slow enough to be cut where the test wants it.
   Child c =
       Spawn(tmp_.path(), Client(client, "big", {"--max-bandwidth", "16384"}));
@@ -691,9 +692,12 @@ TEST_F(ToolsTest, TheDeleteGuardHoldsBackAMassDeletionUntilConfirmed) {
 // no file), and the next run clears what the killed one left behind.
 TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
   std::string client = MakeClient("client", "CLIENT-A");
-  WriteBlob(client + "/volume1/big/blob", 400);
+  WriteBlob(client + "/volume1/big/blob", 16);
+  // At 1 MiB/s the transfer outlasts the test.
   Child c =
-      Spawn(tmp_.path(), Client(client, "big", {"--beacon-interval", "0"}));
+      Spawn(tmp_.path(),
+            Client(client, "big",
+                   {"--beacon-interval", "0", "--max-bandwidth", "1024"}));
   std::vector<std::pair<pid_t, pid_t>> rsyncs;
   for (int waited = 0; waited < 20000 && rsyncs.size() < 2; waited += 2) {
     rsyncs = RsyncChildren(c.pid);
