@@ -1,6 +1,7 @@
 #include "appliances.h"
 
 #include <pwd.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -207,16 +208,24 @@ bool ScriptedServer::Start(const std::string& user,
        {"spool", "upload", "reply", "last", "status", "answer", "pad"}) {
     if (!MakeDirs(dir_ + "/" + d)) return false;
   }
-  std::string hook = dir_ + "/hook.sh";
-  if (!WriteScript(hook, kScriptedHook)) return false;
-  std::vector<RsyncModule> modules = {
-      {"s2scmd",
-       dir_ + "/reply",
-       {"read only = yes", "early exec = " + hook + " early",
-        "pre-xfer exec = " + hook + " pre"}},
-      {"s2sspool", dir_ + "/upload", {"read only = no", "write only = yes"}},
-  };
-  if (!daemon_.Start(modules, user, password)) return false;
+  std::string hook = dir_ + "/hook.sh", secrets = dir_ + "/rsyncd.secrets";
+  std::string auth =
+      "\tauth users = " + user + "\n\tsecrets file = " + secrets + "\n";
+  std::string conf = "use chroot = no\nsocket options = TCP_NODELAY\nuid = " +
+                     std::to_string(geteuid()) +
+                     "\ngid = " + std::to_string(getegid()) +
+                     "\n[s2scmd]\n\tpath = " + dir_ + "/reply\n" + auth +
+                     "\tread only = yes\n\tearly exec = " + hook +
+                     " early\n\tpre-xfer exec = " + hook +
+                     " pre\n[s2sspool]\n\tpath = " + dir_ + "/upload\n" + auth +
+                     "\tread only = no\n\twrite only = yes\n";
+  if (!WriteScript(hook, kScriptedHook) ||
+      !WriteFile(secrets, user + ":" + password + "\n") ||
+      chmod(secrets.c_str(), 0600) != 0 ||
+      !WriteFile(dir_ + "/rsyncd.conf", conf) ||
+      !daemon_.StartWithConfig(dir_ + "/rsyncd.conf")) {
+    return false;
+  }
   port_env_.reset();
   port_env_.reset(
       new ScopedEnv("S2S_RSYNC_PORT", std::to_string(daemon_.port())));

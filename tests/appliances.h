@@ -15,14 +15,12 @@
 
 namespace s2s_test {
 
-class Appliances {
+class Appliances : NoCopy {
  public:
   // `handler`: the server's command handler program, which the daemon's
   // hooks run. S2S_ROOT points at the client root while the object lives.
   explicit Appliances(const std::string& handler);
   ~Appliances();
-  Appliances(const Appliances&) = delete;
-  Appliances& operator=(const Appliances&) = delete;
 
   // Declares share `name` on both appliances (and on every client added
   // later), with an empty directory on each side. An encrypted share has its
@@ -92,11 +90,9 @@ class Appliances {
 // chose, and keeps the last request of each command as it arrived. For
 // answers the real handler never gives (a version of 3, garbage, a status
 // of 51) and for checking the lines that crossed the wire.
-class ScriptedServer {
+class ScriptedServer : NoCopy {
  public:
   explicit ScriptedServer(const std::string& dir);
-  ScriptedServer(const ScriptedServer&) = delete;
-  ScriptedServer& operator=(const ScriptedServer&) = delete;
 
   // Starts the daemon for `user` with `password`; S2S_RSYNC_PORT names its
   // port while the object lives.

@@ -7,9 +7,11 @@
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <string.h>
 #include <sys/sem.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
@@ -17,13 +19,13 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
-#include <functional>
 #include <mutex>
 #include <sstream>
 
 #include "S2S/is_syncedshare_detail.h"
 #include "S2S/logger.h"
 #include "S2S/syslog_sink.h"
+#include "gtest/gtest.h"
 
 namespace s2s_test {
 
@@ -87,14 +89,20 @@ pid_t SpawnListening(
     pid_t pid = Exec(args, -1, fd);
     if (fd >= 0) close(fd);
     if (pid < 0) return -1;
-    for (int waited = 0; waited < 5000; waited += 5) {
-      if (Accepts(*port)) return pid;
-      if (waitpid(pid, nullptr, WNOHANG) == pid) break;
-      timespec ts = {0, 5 * 1000 * 1000};
-      nanosleep(&ts, nullptr);
+    bool exited = false;
+    if (WaitUntil(
+            [&] {
+              exited = waitpid(pid, nullptr, WNOHANG) == pid;
+              return exited || Accepts(*port);
+            },
+            5) &&
+        !exited) {
+      return pid;
     }
-    kill(pid, SIGKILL);
-    waitpid(pid, nullptr, 0);
+    if (!exited) {  // a reaped pid may be someone else's by now
+      kill(pid, SIGKILL);
+      waitpid(pid, nullptr, 0);
+    }
   }
   *port = -1;
   return -1;
@@ -123,6 +131,68 @@ pid_t Exec(std::vector<std::string> args, int in, int out) {
   argv.push_back(nullptr);
   execvp(argv[0], argv.data());
   _exit(127);
+}
+
+int Child::Wait(int seconds) {
+  int pid_fd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+  pollfd exited = {pid_fd, POLLIN, 0};
+  if (pid_fd < 0 || poll(&exited, 1, seconds * 1000) != 1) {
+    ADD_FAILURE() << "still running after " << seconds << " s";
+    kill(pid, SIGKILL);
+  }
+  if (pid_fd >= 0) close(pid_fd);
+  int st = 0;
+  waitpid(pid, &st, 0);
+  code = WIFEXITED(st) ? WEXITSTATUS(st) : 128 + WTERMSIG(st);
+  out = ReadFile(out_path);
+  err = ReadFile(err_path);
+  return code;
+}
+
+Child Spawn(const std::string& dir, const std::vector<std::string>& argv,
+            const std::vector<std::string>& env) {
+  static int serial = 0;
+  Child c;
+  c.out_path = dir + "/out." + std::to_string(++serial);
+  c.err_path = dir + "/err." + std::to_string(serial);
+  c.pid = fork();
+  if (c.pid == 0) {
+    for (const std::string& e : env) {
+      if (e.find('=') == std::string::npos) {
+        unsetenv(e.c_str());
+      } else {
+        putenv(strdup(e.c_str()));
+      }
+    }
+    int out = open(c.out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    int err = open(c.err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    dup2(out, 1);
+    dup2(err, 2);
+    std::vector<char*> args;
+    for (const std::string& a : argv) args.push_back(strdup(a.c_str()));
+    args.push_back(nullptr);
+    execv(args[0], args.data());
+    _exit(127);
+  }
+  return c;
+}
+
+Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
+                 const std::vector<std::string>& env) {
+  Child c = Spawn(dir, argv, env);
+  c.Wait();
+  return c;
+}
+
+bool WaitUntil(const std::function<bool()>& done, double seconds) {
+  auto deadline = std::chrono::steady_clock::now() +
+                  std::chrono::milliseconds(static_cast<int>(seconds * 1000));
+  while (!done()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    timespec ts = {0, 5 * 1000 * 1000};
+    nanosleep(&ts, nullptr);
+  }
+  return true;
 }
 
 bool ReadAll(int fd, char* buf, size_t n) {
@@ -316,25 +386,6 @@ RsyncDaemon::RsyncDaemon(const std::string& dir) : dir_(dir) {}
 
 RsyncDaemon::~RsyncDaemon() { Stop(); }
 
-bool RsyncDaemon::Start(const std::vector<RsyncModule>& modules,
-                        const std::string& user, const std::string& password) {
-  std::string secrets = dir_ + "/rsyncd.secrets";
-  if (!WriteFile(secrets, user + ":" + password + "\n") ||
-      chmod(secrets.c_str(), 0600) != 0) {
-    return false;
-  }
-  std::string conf = "use chroot = no\nsocket options = TCP_NODELAY\n";
-  conf += "uid = " + std::to_string(geteuid()) + "\n";
-  conf += "gid = " + std::to_string(getegid()) + "\n";
-  for (const RsyncModule& m : modules) {
-    conf += "[" + m.name + "]\n\tpath = " + m.path + "\n";
-    conf += "\tauth users = " + user + "\n\tsecrets file = " + secrets + "\n";
-    for (const std::string& line : m.extra) conf += "\t" + line + "\n";
-  }
-  std::string conf_path = dir_ + "/rsyncd.conf";
-  return WriteFile(conf_path, conf) && StartWithConfig(conf_path);
-}
-
 bool RsyncDaemon::StartWithConfig(const std::string& conf) {
   Stop();
   std::string log = dir_ + "/rsyncd.log";
@@ -365,6 +416,7 @@ ScopedEnv::ScopedEnv(const std::string& name, const std::string& value)
   had_ = old != nullptr;
   if (had_) old_ = old;
   setenv(name.c_str(), value.c_str(), 1);
+  tzset();
 }
 
 ScopedEnv::~ScopedEnv() {
@@ -373,14 +425,6 @@ ScopedEnv::~ScopedEnv() {
   } else {
     unsetenv(name_.c_str());
   }
-}
-
-ScopedTZ::ScopedTZ(const std::string& tz) : env_(new ScopedEnv("TZ", tz)) {
-  tzset();
-}
-
-ScopedTZ::~ScopedTZ() {
-  env_.reset();
   tzset();
 }
 

@@ -7,20 +7,26 @@
 #include <sys/types.h>
 
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <string>
 #include <vector>
 
 namespace s2s_test {
 
+// The plumbing below owns files, descriptors and processes: none is copied.
+struct NoCopy {
+  NoCopy() = default;
+  NoCopy(const NoCopy&) = delete;
+  NoCopy& operator=(const NoCopy&) = delete;
+};
+
 // A fresh directory under $TMPDIR (or /tmp), removed with everything in it
 // when the object goes away.
-class TempDir {
+class TempDir : NoCopy {
  public:
   TempDir();
   ~TempDir();
-  TempDir(const TempDir&) = delete;
-  TempDir& operator=(const TempDir&) = delete;
 
   const std::string& path() const { return path_; }
   // path() + "/" + name.
@@ -32,12 +38,10 @@ class TempDir {
 
 // Redirects a descriptor (1 or 2) into a temporary file for its lifetime and
 // hands back what was written.
-class CaptureFd {
+class CaptureFd : NoCopy {
  public:
   explicit CaptureFd(int fd);
   ~CaptureFd();
-  CaptureFd(const CaptureFd&) = delete;
-  CaptureFd& operator=(const CaptureFd&) = delete;
 
   // Everything written so far (flushes stdio first).
   std::string Text();
@@ -50,12 +54,10 @@ class CaptureFd {
 
 // Collects what the library sends to the system log while it lives. Each
 // entry is the formatted message; priorities are kept beside them.
-class SyslogCapture {
+class SyslogCapture : NoCopy {
  public:
   SyslogCapture();
   ~SyslogCapture();
-  SyslogCapture(const SyslogCapture&) = delete;
-  SyslogCapture& operator=(const SyslogCapture&) = delete;
 
   std::vector<std::string> Messages() const;
   std::vector<int> Priorities() const;
@@ -98,29 +100,15 @@ int FreeLoopbackPort();
 // whether or not they are accepted.
 int LoopbackListener(int* port);
 
-// One module of a test daemon: name, directory, and further rsyncd.conf
-// lines ("key = value") for it.
-struct RsyncModule {
-  std::string name;
-  std::string path;
-  std::vector<std::string> extra;
-};
-
 // A real rsync daemon on 127.0.0.1 at a free port, in the foreground
-// (--no-detach), started by this object and stopped by its own pid. Its
-// configuration, secrets file (mode 0600) and log live in `dir`.
-class RsyncDaemon {
+// (--no-detach), started by this object and stopped by its own pid. Its log
+// lives in `dir`.
+class RsyncDaemon : NoCopy {
  public:
   explicit RsyncDaemon(const std::string& dir);
   ~RsyncDaemon();
-  RsyncDaemon(const RsyncDaemon&) = delete;
-  RsyncDaemon& operator=(const RsyncDaemon&) = delete;
 
-  // Writes a configuration with `modules`, each open to `user` with
-  // `password`, and starts the daemon on it. False when it does not answer.
-  bool Start(const std::vector<RsyncModule>& modules, const std::string& user,
-             const std::string& password);
-  // Starts the daemon on a configuration written elsewhere.
+  // Starts the daemon on configuration `conf`; false when it does not answer.
   bool StartWithConfig(const std::string& conf);
   // SIGTERM to the daemon, then waits for it. Idempotent.
   void Stop();
@@ -139,12 +127,10 @@ class RsyncDaemon {
 // A real sshd on 127.0.0.1 at a free port with a generated host key, which
 // lets one generated client key in and runs `forced_command` for it. Files
 // live in `dir`; the daemon is stopped by its own pid.
-class SshServer {
+class SshServer : NoCopy {
  public:
   explicit SshServer(const std::string& dir);
   ~SshServer();
-  SshServer(const SshServer&) = delete;
-  SshServer& operator=(const SshServer&) = delete;
 
   // Generates the keys, writes the client's private key to `client_key`
   // (mode 0600) and a known_hosts line for the server to `known_hosts`, and
@@ -161,13 +147,11 @@ class SshServer {
 };
 
 // Sets an environment variable for the lifetime of the object and restores
-// the previous value afterwards.
-class ScopedEnv {
+// the previous value afterwards; the C library rereads TZ (tzset) both times.
+class ScopedEnv : NoCopy {
  public:
   ScopedEnv(const std::string& name, const std::string& value);
   ~ScopedEnv();
-  ScopedEnv(const ScopedEnv&) = delete;
-  ScopedEnv& operator=(const ScopedEnv&) = delete;
 
  private:
   std::string name_;
@@ -211,12 +195,10 @@ bool RunQuiet(const std::vector<std::string>& args);
 // A program run by the test with its standard input and output (standard
 // error included) on pipes; stopped by its own pid (SIGTERM) at the latest
 // when the object goes away.
-class PipedProcess {
+class PipedProcess : NoCopy {
  public:
   PipedProcess() = default;
   ~PipedProcess();
-  PipedProcess(const PipedProcess&) = delete;
-  PipedProcess& operator=(const PipedProcess&) = delete;
 
   // Starts `args` (looked up in PATH, no shell); false when it cannot.
   bool Start(std::vector<std::string> args);
@@ -237,21 +219,38 @@ class PipedProcess {
   std::string output_;
 };
 
+// A program started by Spawn: its exit code and what it wrote to standard
+// output and standard error, once Wait has returned.
+struct Child {
+  pid_t pid = -1;
+  std::string out_path, err_path;
+  std::string out, err;
+  int code = -1;
+
+  // Waits for the child, at most `seconds` (then it is killed); its exit
+  // code, or 128 + signal.
+  int Wait(int seconds = 60);
+};
+
+// Starts `argv` (a path, no shell) with output in files in `dir`; each of
+// `env` is "NAME=VALUE" to set or "NAME" to remove in the child.
+Child Spawn(const std::string& dir, const std::vector<std::string>& argv,
+            const std::vector<std::string>& env = {});
+// Spawn, then Wait.
+Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
+                 const std::vector<std::string>& env = {});
+
+// Polls `done` every few milliseconds until it holds (true) or `seconds`
+// have passed (false).
+bool WaitUntil(const std::function<bool()>& done, double seconds);
+
 // Writes an executable shell script `body` (without the "#!/bin/sh" line)
 // at `path`; true on success.
 bool WriteScript(const std::string& path, const std::string& body);
 
-// A ScopedEnv for TZ that also makes the C library reread it (tzset) when
-// it is set and when it is restored.
-class ScopedTZ {
- public:
-  explicit ScopedTZ(const std::string& tz);
-  ~ScopedTZ();
-  ScopedTZ(const ScopedTZ&) = delete;
-  ScopedTZ& operator=(const ScopedTZ&) = delete;
-
- private:
-  std::unique_ptr<ScopedEnv> env_;
+// TZ set for the lifetime of the object.
+struct ScopedTZ : ScopedEnv {
+  explicit ScopedTZ(const std::string& tz) : ScopedEnv("TZ", tz) {}
 };
 
 }  // namespace s2s_test

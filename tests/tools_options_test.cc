@@ -35,7 +35,7 @@ TEST(ClientOptions, TaskFileKeysThenOptionsOnTop) {
                         "[Task]\n\tname=\"nightly\"\n\tid=\"7\"\n"
                         "\tserver_ip=\"10.0.0.9\"\n\tport=\"8873\"\n"
                         "\tuser=\"s2s\"\n\tshares=\"docs:photos\"\n"
-                        "\texcludes=\"*.tmp\"\n\tcompress=\"yes\"\n"
+                        "\texcludes=\":*.tmp::\"\n\tcompress=\"yes\"\n"
                         "\tdelta=\"no\"\n\tssh=\"no\"\n\tssh_port=\"2222\"\n"
                         "\tpassword_file=\"/p\"\n"));
   ClientOptions o;
@@ -49,6 +49,7 @@ TEST(ClientOptions, TaskFileKeysThenOptionsOnTop) {
   EXPECT_EQ("127.0.0.1", o.spec.server_ip);  // the option wins
   EXPECT_EQ(8873u, o.spec.port);
   EXPECT_EQ((std::list<std::string>{"a", "b"}), o.spec.shares);
+  // Empty pieces of a list are dropped.
   EXPECT_EQ(std::list<std::string>{"*.tmp"}, o.spec.excludes);
   EXPECT_TRUE(o.spec.compress);
   EXPECT_TRUE(o.spec.delta);
@@ -124,13 +125,8 @@ TEST(ClientOptions, TaskSpecAppliesTheServersNameRules) {
   }
 }
 
-TEST(ClientOptions, SplitListDropsEmptyPieces) {
-  EXPECT_EQ((std::list<std::string>{"a", "b"}), SplitList(":a::b:"));
-  EXPECT_TRUE(SplitList("").empty());
-}
-
 // A readable password file is refused end to end in tools_test.
-TEST(Secret, FirstLineOfTheFileAndEnvironmentIsConsumed) {
+TEST(Secret, FirstLineOfTheFileWinsAndTheEnvironmentIsConsumed) {
   s2s_test::TempDir tmp;
   std::string path = tmp.Sub("pw");
   ASSERT_TRUE(WriteFile(path, "s3cret-line\nsecond line\n"));
@@ -143,13 +139,9 @@ TEST(Secret, FirstLineOfTheFileAndEnvironmentIsConsumed) {
   chmod(tmp.Sub("empty").c_str(), 0600);
   EXPECT_FALSE(ReadPassword(tmp.Sub("empty"), pw, error));
 
-  // The variable is read once and removed, so that rsync and every other
-  // child does not inherit it; a file given as well wins over it.
-  setenv(kPasswordEnv, "from-env", 1);
-  ASSERT_TRUE(ReadPassword("", pw, error));
-  EXPECT_EQ("from-env", pw);
-  EXPECT_EQ(nullptr, getenv(kPasswordEnv));
-  EXPECT_FALSE(ReadPassword("", pw, error));
+  // A file given wins over the variable, which is removed all the same so
+  // that rsync and every other child does not inherit it (read from the
+  // variable alone in tools_test).
   setenv(kPasswordEnv, "from-env", 1);
   ASSERT_TRUE(ReadPassword(path, pw, error));
   EXPECT_EQ("s3cret-line", pw);
