@@ -100,20 +100,6 @@ TEST(ShareAndEvent, RelativePathIsMadeAbsoluteAndBothDump) {
             "relative_path: . /a/b\nstatus: ........ -1\n");
 }
 
-TEST(SyncInfo, FlagSettersTouchOnlyTheirBit) {
-  SyncInfo info;
-  info.SetSyncConfigFlag(0xF0);
-  info.SetSSH(true);
-  EXPECT_EQ(info.GetSyncConfigFlag(), 0xF2u);
-  info.SetCompression(true);
-  info.SetBlockLevelSync(true);
-  EXPECT_EQ(info.GetSyncConfigFlag(), 0xF7u);
-  info.SetSSH(false);
-  EXPECT_EQ(info.GetSyncConfigFlag(), 0xF5u);
-  EXPECT_TRUE(info.UseBlockLevelSync() && info.UseCompression());
-  EXPECT_FALSE(info.UseSSH());
-}
-
 TEST(SyncInfo, ValidateNeedsAServerAUserAndAPort) {
   const struct {
     const char *ip, *name, *user;
