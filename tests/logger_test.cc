@@ -93,6 +93,11 @@ TEST_F(LoggerTest, InitializeFailuresKeepThePreviousStream) {
                                dir_.Sub("missing/dir/log"), 5),
             -1);
   EXPECT_EQ(Logger::GetStream(), stdout);
+  // Out-of-range types select a file as well.
+  ASSERT_EQ(Logger::Initialize(static_cast<Logger::Type>(9), Logger::Error,
+                               dir_.Sub("any.log"), 7),
+            0);
+  EXPECT_EQ(Logger::GetType(), Logger::File);
 }
 
 TEST_F(LoggerTest, DestroyOfFileLogSwitchesToStandardOutput) {
