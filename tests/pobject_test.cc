@@ -101,12 +101,7 @@ TEST(PObject, NumericIndexWalksMapsInKeyOrderAndNeverWritesArrays) {
   EXPECT_EQ(ca[0u].asString(), "only");
   EXPECT_TRUE(ca[5u].isNull());
   EXPECT_TRUE(cs[0u].isNull());
-  try {
-    a[0u];
-    FAIL() << "non-const numeric index on an array must throw";
-  } catch (const std::out_of_range& e) {
-    EXPECT_STREQ(e.what(), "out_of_range: PObject::operator[]");
-  }
+  EXPECT_THROW(a[0u], std::out_of_range);
   EXPECT_THROW(s[0u], std::out_of_range);
   EXPECT_THROW(n[0u], std::out_of_range);
 }

@@ -155,24 +155,13 @@ TEST(RsyncerSplitTest, SplitsAtEachSeparatorKeepingEmptyPieces) {
   }
 }
 
-// The wrapper settings every invocation starts from, what the Rsyncer
-// copies into them, and the time-outs of the two kinds of run.
-TEST(RsyncerTaskTest, SwitchesConnectionAndTimeOuts) {
+// What the Rsyncer copies into the wrapper settings of a run.
+TEST(RsyncerTaskTest, SwitchesAndConnection) {
   Rsyncer::RsyncTask task;
-  // Every run deletes, keeps numeric ids, authenticates and stores owners
-  // through the server's pseudo root unless its owner says otherwise.
-  EXPECT_TRUE(task.getDelete() && task.getNumericIds() &&
-              task.getKaroAuthUse() && task.getKaroAuthRequire() &&
-              task.getKaroPseudoRoot());
   // Block-level sync is rsync's delta transfer, not its compression.
   task.SetBlockLevelSync(true);
   EXPECT_TRUE(task.getDeltaCopy());
   EXPECT_FALSE(task.getCompress());
-  // A test task runs quietly, every other one with the debug log.
-  task.SetTestTask(true);
-  EXPECT_FALSE(task.getDebugLog());
-  task.SetTestTask(false);
-  EXPECT_TRUE(task.getDebugLog());
 
   S2S::SyncInfo info;
   info.SetServerIP("127.0.0.9");
@@ -194,20 +183,9 @@ TEST(RsyncerTaskTest, SwitchesConnectionAndTimeOuts) {
     EXPECT_EQ("backup", t.GetUser());
     EXPECT_EQ(ssh, t.getSsh());
     EXPECT_EQ(ssh ? 2222u : 0u, t.getPort());  // the port only for SSH
-    EXPECT_EQ(ssh, t.getDebugLog());
+    EXPECT_EQ(ssh, t.getDebugLog());           // a test task runs quietly
     EXPECT_FALSE(t.getCompress());  // transfer options are the callers'
   }
-
-  // No server address: the wrapper refuses before starting rsync.
-  Rsyncer::RsyncTask command;
-  EXPECT_EQ(Rsyncer::RsyncTask::kBadSettings,
-            command.ExecuteCmd({"command=\"S2S_Pairing\""}, nullptr));
-  EXPECT_EQ(60u, command.getTimeout());
-  Rsyncer::RsyncTask data;
-  data.setTimeout(5);
-  EXPECT_EQ(Rsyncer::RsyncTask::kBadSettings,
-            data.Execute("/src/", "share", nullptr, "", {}));
-  EXPECT_EQ(600u, data.getTimeout());
 }
 
 }  // namespace

@@ -222,53 +222,16 @@ TEST(PStreamTest, MalformedOrTooDeepInputIsAProtocolError) {
     EXPECT_EQ(r, c.logged.empty() ? 0 : S2S::kProtocolError) << c.logged;
     EXPECT_TRUE(Has(log.Text(), c.logged)) << log.Text();
   }
-}
-
-// Every prefix of a message, and the message with any one byte changed,
-// decodes to a clean answer: success, -2 or -5, and never a hang.
-TEST(PStreamTest, TruncatedAndCorruptedMessagesFailCleanly) {
-  std::mt19937 rng(3);
-  PObject msg = RandomValue(rng, 0);
-  msg["list"] = RandomValue(rng, 3);
-  msg["n"] = 1234567ull;
-  msg["nested"]["deeper"].asArray().push_back(RandomValue(rng, 2));
-  msg["nested"]["null"] = PObject();
-  for (int i = 0; i < 4; ++i)
-    msg["r" + std::to_string(i)] = RandomValue(rng, 1);
-  const std::string bytes = Wire().Encode(msg);
-  ASSERT_GT(bytes.size(), 60u);
-  for (size_t len = 0; len < bytes.size(); ++len) {
-    PObject obj;
-    int r = Wire().Decode(bytes.substr(0, len), obj);
-    EXPECT_TRUE(r == S2S::kIOError || r == S2S::kProtocolError)
-        << "prefix " << len << " gave " << r;
-  }
-  const unsigned char probes[] = {0x00, 0x01, 0x10, 0x40, 0x41, 0x42, 0xFF};
-  for (size_t at = 0; at < bytes.size(); ++at) {
-    for (unsigned char p : probes) {
-      std::string bad = bytes;
-      bad[at] = static_cast<char>(p);
-      PObject obj;
-      int r = Wire().Decode(bad, obj);
-      EXPECT_TRUE(r == 0 || r == S2S::kIOError || r == S2S::kProtocolError)
-          << "byte " << at << " = " << int(p) << " gave " << r;
-    }
-  }
+  // Cut short inside a string: the end of the stream, not a hang, and not
+  // a shorter string.
+  PObject cut;
+  EXPECT_EQ(Wire().Decode(Bytes({0x10, 0, 5, 'a', 'b'}), cut), S2S::kIOError);
 }
 
 // Another thread may read the status while messages are encoded.
 TEST(PStreamTest, StatusIsReadableDuringEncoding) {
   Wire w;
   ASSERT_TRUE(w.ok());
-  std::string history = "x";
-  unsigned long long first = 9, second = 9;
-  w.stream_.GetStatus(history, first, second);
-  EXPECT_EQ(history, "");
-  EXPECT_EQ(first, 0u);
-  w.stream_.UpdateStatus(3, 4);
-  w.stream_.GetStatus(history, first, second);
-  EXPECT_EQ(first, 3u);
-  EXPECT_EQ(second, 4u);
   std::atomic<bool> done{false};
   std::thread reader([&] {
     std::string h;
