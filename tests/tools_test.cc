@@ -19,8 +19,10 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cstdint>
 #include <filesystem>
 #include <fstream>
+#include <random>
 #include <string>
 #include <vector>
 
@@ -107,13 +109,15 @@ bool EndsWithin(pid_t pid, int seconds) {
   return ok;
 }
 
-// A file of `mb` megabytes that is not all one byte.
+// A file of `mb` megabytes that neither compresses nor repeats itself, so
+// that a delta transfer finds no block of it anywhere but in its own copy.
 void WriteBlob(const std::string& path, int mb) {
   std::ofstream blob(path, std::ios::binary);
-  std::string chunk(1 << 20, 'x');
+  std::mt19937_64 random(static_cast<unsigned>(mb));
+  std::vector<std::uint64_t> chunk((1 << 20) / sizeof(std::uint64_t));
   for (int i = 0; i < mb; ++i) {
-    chunk[i] = static_cast<char>(i);
-    blob << chunk;
+    for (std::uint64_t& word : chunk) word = random();
+    blob.write(reinterpret_cast<const char*>(chunk.data()), 1 << 20);
   }
 }
 
