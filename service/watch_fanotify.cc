@@ -223,19 +223,27 @@ void FanotifySource::Read(std::vector<S2S::Event>& out) {
   for (int reads = 0; reads < kReadsPerWake; ++reads) {
     ssize_t len = read(fd_, buf, sizeof buf);
     if (len <= 0) break;
-    const fanotify_event_metadata* md =
-        reinterpret_cast<const fanotify_event_metadata*>(buf);
-    for (; FAN_EVENT_OK(md, len); md = FAN_EVENT_NEXT(md, len)) {
-      if (overflow || md->vers != FANOTIFY_METADATA_VERSION) continue;
-      if ((md->mask & FAN_Q_OVERFLOW) ||
+    const char* next = buf;
+    size_t left = static_cast<size_t>(len);
+    while (left >= sizeof(fanotify_event_metadata)) {
+      // Records follow each other at 4-byte alignment: the metadata, which
+      // holds a 64-bit mask, is copied out rather than read in place.
+      fanotify_event_metadata md;
+      memcpy(&md, next, sizeof md);
+      if (md.event_len < sizeof md || md.event_len > left) break;
+      const char* event = next;
+      next += md.event_len;
+      left -= md.event_len;
+      if (overflow || md.vers != FANOTIFY_METADATA_VERSION) continue;
+      if ((md.mask & FAN_Q_OVERFLOW) ||
           (limits_.queue != 0 && ++taken > limits_.queue)) {
         // Past the queue's limit the rest is lost, as the kernel does.
         overflow = true;
         Overflow();
         continue;
       }
-      const char* at = reinterpret_cast<const char*>(md) + md->metadata_len;
-      const char* end = reinterpret_cast<const char*>(md) + md->event_len;
+      const char* at = event + md.metadata_len;
+      const char* end = event + md.event_len;
       while (at + sizeof(fanotify_event_info_header) <= end) {
         const fanotify_event_info_header* hdr =
             reinterpret_cast<const fanotify_event_info_header*>(at);
@@ -254,12 +262,12 @@ void FanotifySource::Read(std::vector<S2S::Event>& out) {
                                  : "";
           if (!dir.empty()) {
             bool self = name[0] == '\0' || strcmp(name, ".") == 0;
-            Report(md->mask, fsid,
+            Report(md.mask, fsid,
                    self ? dir : (dir == "/" ? "" : dir) + "/" + name, out);
           }
           // Every path below a moved directory changed.
-          if ((md->mask & FAN_ONDIR) &&
-              (md->mask & (FAN_MOVED_FROM | FAN_MOVED_TO))) {
+          if ((md.mask & FAN_ONDIR) &&
+              (md.mask & (FAN_MOVED_FROM | FAN_MOVED_TO))) {
             dirs_.clear();
           }
           break;
