@@ -293,16 +293,16 @@ void BM_TreeWalkBaseline(benchmark::State& state) {
   for (auto _ : state) {
     double t0 = Now();
     size_t dirs = 0;
-    std::vector<std::string> todo = {tree};
-    while (!todo.empty()) {
-      std::string dir = todo.back();
-      todo.pop_back();
+    std::vector<std::string> unvisited = {tree};
+    while (!unvisited.empty()) {
+      std::string dir = unvisited.back();
+      unvisited.pop_back();
       ++dirs;
       DIR* d = opendir(dir.c_str());
       while (dirent* e = d == nullptr ? nullptr : readdir(d)) {
         if (e->d_type == DT_DIR && strcmp(e->d_name, ".") != 0 &&
             strcmp(e->d_name, "..") != 0) {
-          todo.push_back(dir + "/" + e->d_name);
+          unvisited.push_back(dir + "/" + e->d_name);
         }
       }
       if (d != nullptr) closedir(d);

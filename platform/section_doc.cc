@@ -179,27 +179,15 @@ std::pair<size_t, bool> SectionDoc::Intern(std::string_view name) {
   return {sections_.size() - 1, true};
 }
 
-int SectionDoc::Load(const char* file) {
-  Clear();
-  text_.clear();
-  if (!ReadAll(file, &text_)) {
-    text_.clear();
-    return -1;
-  }
-  if (text_.find('\0') != std::string::npos) {
-    text_.clear();
-    KLIBCErrSet(KERR_FILE_FORMAT);
-    return -1;
-  }
-  if (IndexWritersForm(nullptr)) return 0;
-  // What a person typed: parsed whole, and written back in the writers'
-  // form.
-  std::string text;
-  text.swap(text_);
-  return Parse(text, nullptr);
-}
+int SectionDoc::Load(const char* file) { return Read(file, nullptr); }
 
 int SectionDoc::LoadOne(const char* file, const std::string& name) {
+  return Read(file, &name);
+}
+
+// What a person typed is parsed whole, and written back in the writers'
+// form; a file already in that form is only indexed.
+int SectionDoc::Read(const char* file, const std::string* only) {
   Clear();
   text_.clear();
   if (!ReadAll(file, &text_)) {
@@ -211,10 +199,10 @@ int SectionDoc::LoadOne(const char* file, const std::string& name) {
     KLIBCErrSet(KERR_FILE_FORMAT);
     return -1;
   }
-  if (IndexWritersForm(&name)) return 0;
+  if (IndexWritersForm(only)) return 0;
   std::string text;
   text.swap(text_);
-  return Parse(text, &name);
+  return Parse(text, only);
 }
 
 // Parses `text` whole, keeping only section `*only` when `only` is given.

@@ -79,6 +79,8 @@ class SectionDoc {
  private:
   using KeyIndex = std::unordered_map<std::string, size_t>;
   bool IndexWritersForm(const std::string* only);
+  // Load and LoadOne: `only` keeps that one section alone.
+  int Read(const char* file, const std::string* only);
   int Parse(const std::string& text, const std::string* only);
   bool ParseLine(std::string_view line, const std::string* only,
                  std::vector<std::unique_ptr<KeyIndex>>* keys, long* current);
