@@ -4,20 +4,18 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <filesystem>
 #include <functional>
 #include <string>
-#include <thread>
 #include <tuple>
 #include <vector>
 
-#include "S2S/ipc.h"
 #include "S2S/sync_obj_pobject.h"
 #include "appliances.h"
+#include "s2sd_process.h"
 #include "service/batcher.h"
 #include "service/config.h"
 #include "testutil.h"
@@ -121,72 +119,24 @@ TEST(Batcher, SettlesAfterTheLastChangeButNeverPastTheMaximumDelay) {
 
 using S2S::PObject;
 using s2s_test::ReadFile;
+using s2s_test::WaitUntil;
 using s2s_test::WriteFile;
 namespace fs = std::filesystem;
 
-class RealtimeTest : public ::testing::TestWithParam<const char*> {
+class RealtimeTest : public s2s_test::S2sdTest,
+                     public ::testing::WithParamInterface<const char*> {
  protected:
-  RealtimeTest() : app_(S2S_CMD_HANDLER) {}
-
   void SetUp() override {
-    ASSERT_TRUE(app_.AddShare("docs"));
-    ASSERT_TRUE(app_.StartServer());
-    bin_ = tmp_.Sub("bin");
-    fs::create_directories(bin_);
-    rsync_log_ = tmp_.Sub("rsync.log");
-    // Every rsync the service runs, one line each; none reaches the server
-    // while the file `unreachable_` exists.
-    unreachable_ = tmp_.Sub("unreachable");
-    ASSERT_TRUE(s2s_test::WriteScript(
-        bin_ + "/rsync", "[ -e " + unreachable_ +
-                             " ] && exit 10\necho \"$*\" >> " + rsync_log_ +
-                             "\nexec /usr/bin/rsync \"$@\"\n"));
-    ASSERT_TRUE(
-        WriteFile(ConfigPath(), "[Service]\n\tbeacon_interval=\"3600\"\n"));
+    SetUpServer({"docs"}, "");
     client_ = app_.ClientShare("docs");
     server_ = app_.ServerShare("docs");
-  }
-
-  void TearDown() override { StopDaemon(); }
-
-  void StartDaemon(const std::vector<std::string>& extra = {}) {
-    unlink(s2s_service::SocketPath().c_str());
-    std::string path = bin_ + ":" + getenv("PATH");
-    std::string log = tmp_.Sub("s2sd.log");
-    std::vector<std::string> args = {S2SD_PROGRAM, "--foreground", "--log", log,
-                                     "-v"};
-    args.insert(args.end(), extra.begin(), extra.end());
-    pid_ = fork();
-    if (pid_ == 0) {
-      setenv("PATH", path.c_str(), 1);
-      std::vector<char*> argv;
-      for (std::string& a : args) argv.push_back(&a[0]);
-      argv.push_back(nullptr);
-      execv(S2SD_PROGRAM, argv.data());
-      _exit(127);
-    }
-    ASSERT_TRUE(WaitFor(
-        [this] { return Request("status")["result"].isInteger(); }, 10));
-  }
-
-  void StopDaemon() {
-    if (pid_ <= 0) return;
-    kill(pid_, SIGTERM);
-    waitpid(pid_, nullptr, 0);
-    pid_ = -1;
   }
 
   PObject Request(const std::string& action, const PObject& more = PObject()) {
     PObject req = more;
     if (!req.isMap()) req = PObject::Map();
     req["action"] = action;
-    S2S::IPCSender sender;
-    PObject reply;
-    if (sender.connect(s2s_service::SocketPath()) == 0) {
-      sender.send(req, true, reply);
-    }
-    sender.close();
-    return reply;
+    return s2sd_.Request(req);
   }
 
   // Adds the realtime task over docs with the test's change source, a
@@ -212,7 +162,7 @@ class RealtimeTest : public ::testing::TestWithParam<const char*> {
     PObject reply = Request("add", req);
     EXPECT_EQ(0u, reply["result"].asUInt64()) << reply["message"].asString();
     PObject status;
-    WaitFor(
+    WaitUntil(
         [&] {
           status = Status();
           return status["state"].asString() == "watching";
@@ -227,31 +177,33 @@ class RealtimeTest : public ::testing::TestWithParam<const char*> {
     return reply["realtime"][0u];
   }
 
-  static bool WaitFor(const std::function<bool()>& done, double seconds) {
-    auto start = std::chrono::steady_clock::now();
-    while (!done()) {
-      if (s2s_test::SecondsSince(start) > seconds) return false;
-      std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    }
-    return true;
-  }
-
   // Seconds until `path` on the server holds `content` (-1: not within
   // `seconds`).
   double Arrival(const std::string& path, const std::string& content,
                  double seconds = 10) {
     auto start = std::chrono::steady_clock::now();
     bool ok =
-        WaitFor([&] { return ReadFile(server_ + path) == content; }, seconds);
+        WaitUntil([&] { return ReadFile(server_ + path) == content; }, seconds);
     return ok ? s2s_test::SecondsSince(start) : -1;
   }
 
   bool Gone(const std::string& path) {
-    return WaitFor(
+    return WaitUntil(
         [&] { return !fs::exists(fs::symlink_status(server_ + path)); }, 10);
   }
 
   bool Same() { return s2s_test::RunQuiet({"diff", "-r", client_, server_}); }
+
+  // WaitUntil for a check that compares or walks whole trees: asked every
+  // 50 ms, so that the asking leaves the machine to the daemon under test.
+  static bool WaitSlowly(const std::function<bool()>& done, double seconds) {
+    return WaitUntil(
+        [&] {
+          usleep(50 * 1000);
+          return done();
+        },
+        seconds);
+  }
 
   size_t Files(const std::string& dir) {
     std::error_code ec;
@@ -273,8 +225,6 @@ class RealtimeTest : public ::testing::TestWithParam<const char*> {
     return n;
   }
 
-  std::string Log() { return ReadFile(tmp_.Sub("s2sd.log")); }
-
   // The status of the task's share.
   PObject Share() {
     const PObject status = Status();
@@ -285,10 +235,7 @@ class RealtimeTest : public ::testing::TestWithParam<const char*> {
     return share["watching"].asBool();
   }
 
-  s2s_test::Appliances app_;
-  s2s_test::TempDir tmp_;
-  std::string bin_, rsync_log_, client_, server_, unreachable_;
-  pid_t pid_ = -1;
+  std::string client_, server_;
 };
 
 #define SKIP_UNLESS_SOURCE(status)                         \
@@ -308,7 +255,9 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   WriteFile(client_ + "/a.txt", "alpha\n");
   double took = Arrival("/a.txt", "alpha\n");
   EXPECT_LE(0, took);
-  EXPECT_LT(took, 0.2 + 1) << "settle delay plus a second";
+  // Pushed for the change itself: far sooner than the 30 s most a batch
+  // waits or the hourly full sync, with room for a loaded machine.
+  EXPECT_LT(took, 0.2 + 5) << "settle delay plus five seconds";
 
   // Deleted, renamed, made and filled at once, any bytes in names.
   fs::create_directories(client_ + "/old/sub");
@@ -330,7 +279,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   EXPECT_LE(0, Arrival("/new/sub/x", "x\n"));
   EXPECT_LE(0, Arrival("/quick/deep/er/f49", "q"));
   EXPECT_LE(0, Arrival(odd[2] + odd[0], "both\n"));
-  EXPECT_TRUE(WaitFor([&] { return Same(); }, 10));
+  EXPECT_TRUE(WaitSlowly([&] { return Same(); }, 10));
 
   // A burst: 1,000 files in 100 new directories, far more paths than one
   // batch pushes one by one.
@@ -340,7 +289,8 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
     fs::create_directories(dir);
     for (int f = 0; f < 10; ++f) WriteFile(dir + "/f" + std::to_string(f), "b");
   }
-  ASSERT_TRUE(WaitFor([&] { return Files(server_ + "/burst") == 1000; }, 120))
+  ASSERT_TRUE(
+      WaitSlowly([&] { return Files(server_ + "/burst") == 1000; }, 120))
       << Log();
   EXPECT_TRUE(Same());
   EXPECT_LE(RsyncRuns() - runs_before, 10u);
@@ -348,7 +298,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   // The share's directory goes: no longer watched, and watched again when
   // it is back.
   fs::rename(client_, client_ + ".away");
-  EXPECT_TRUE(WaitFor(
+  EXPECT_TRUE(WaitUntil(
       [&] {
         const PObject share = Share();
         return !share["watching"].asBool() &&
@@ -358,7 +308,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
       10))
       << Log();
   fs::rename(client_ + ".away", client_);
-  EXPECT_TRUE(WaitFor([&] { return Watching(); }, 10));
+  EXPECT_TRUE(WaitUntil([&] { return Watching(); }, 10));
   WriteFile(client_ + "/back.txt", "back\n");
   EXPECT_LE(0, Arrival("/back.txt", "back\n"));
 
@@ -367,7 +317,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   id = PObject::Map();
   id["id"] = 1u;
   ASSERT_EQ(0u, Request("disable", id)["result"].asUInt64());
-  EXPECT_TRUE(WaitFor(
+  EXPECT_TRUE(WaitUntil(
       [&] { return app_.ServerRegistry("TASK_live", "status") == "idle"; },
       10));
   EXPECT_TRUE(Request("status")["realtime"].asArray().empty());
@@ -387,13 +337,13 @@ TEST_P(RealtimeTest, OverflowWatchLimitAndAnUnreachableServerEndEqual) {
   SKIP_UNLESS_SOURCE(added);
   // Into the share's directory, which is watched, and into directories
   // that are not; while s2sd is stopped, so that the events pile up.
-  kill(pid_, SIGSTOP);
+  kill(s2sd_.pid(), SIGSTOP);
   for (int i = 0; i < 300; ++i) {
     std::string dir = i < 100 ? "" : "/tree/d" + std::to_string(i % 10) + "/e";
     WriteFile(client_ + dir + "/f" + std::to_string(i), std::to_string(i));
   }
-  kill(pid_, SIGCONT);
-  EXPECT_TRUE(WaitFor([&] { return Same(); }, 30)) << Log();
+  kill(s2sd_.pid(), SIGCONT);
+  EXPECT_TRUE(WaitSlowly([&] { return Same(); }, 30)) << Log();
   const PObject status = Status();
   EXPECT_LE(1u, status["overflows"].asUInt64());
   if (std::string(GetParam()) == "inotify") {
@@ -408,7 +358,7 @@ TEST_P(RealtimeTest, OverflowWatchLimitAndAnUnreachableServerEndEqual) {
   // The server unreachable: the change waits, and arrives once it answers.
   WriteFile(unreachable_, "");
   WriteFile(client_ + "/later.txt", "later\n");
-  EXPECT_TRUE(WaitFor(
+  EXPECT_TRUE(WaitUntil(
       [&] {
         const PObject s = Status();
         return s["state"].asString() == "retry_wait" &&

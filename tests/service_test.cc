@@ -2,10 +2,8 @@
 // s2sd itself as a process against a real server appliance, driven through
 // its control socket.
 #include <poll.h>
-#include <signal.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -18,11 +16,11 @@
 #include <string>
 #include <vector>
 
-#include "S2S/ipc.h"
 #include "S2S/is_syncedshare.h"
 #include "S2S/sync_obj_pobject.h"
 #include "appliances.h"
 #include "gtest/gtest.h"
+#include "s2sd_process.h"
 #include "service/config.h"
 #include "service/history.h"
 #include "service/record.h"
@@ -201,61 +199,21 @@ struct Transfer {
   std::string share;
 };
 
-class ServiceTest : public ::testing::Test {
+class ServiceTest : public s2s_test::S2sdTest {
  protected:
-  ServiceTest() : app_(S2S_CMD_HANDLER) {}
-
   void SetUp() override {
-    for (const char* share : {"docs", "big", "photos"}) {
-      ASSERT_TRUE(app_.AddShare(share));
-    }
-    ASSERT_TRUE(app_.StartServer());
-    bin_ = tmp_.Sub("bin");
-    std::filesystem::create_directories(bin_);
-    rsync_log_ = tmp_.Sub("rsync.log");
-    // Every rsync the service runs, with its start and end.
-    ASSERT_TRUE(s2s_test::WriteScript(
-        bin_ + "/rsync",
-        "echo \"start $(date +%s%N) $$ $*\" >> " + rsync_log_ +
-            "\n/usr/bin/rsync \"$@\"\nrc=$?\necho \"end $(date +%s%N) $$\" "
-            ">> " +
-            rsync_log_ + "\nexit $rc\n"));
+    SetUpServer({"docs", "big", "photos"}, "\tmax_parallel=\"2\"\n");
     std::string error;
     ASSERT_TRUE(MakeDirs(HistoryDir(), error)) << error;
-    ASSERT_TRUE(WriteFile(ConfigPath(),
-                          "[Service]\n\tmax_parallel=\"2\"\n"
-                          "\tbeacon_interval=\"3600\"\n"));
   }
 
-  void TearDown() override { StopDaemon(); }
-
-  // Starts s2sd on the client root, its schedules' clock `offset` seconds
-  // ahead, and waits for its socket.
+  // Starts s2sd, its schedules' clock `offset` seconds ahead.
   void StartDaemon(long offset) {
-    unlink(SocketPath().c_str());
-    std::string path = bin_ + ":" + getenv("PATH");
-    pid_ = fork();
-    if (pid_ == 0) {
-      setenv("PATH", path.c_str(), 1);
-      std::string log = tmp_.Sub("s2sd.log");
-      execl(S2SD_PROGRAM, S2SD_PROGRAM, "--foreground", "--log", log.c_str(),
-            "-v", "--clock-offset", std::to_string(offset).c_str(), nullptr);
-      _exit(127);
-    }
-    ASSERT_TRUE(WaitFor(
-        [this] { return Request(Action("status"))["result"].isInteger(); }, 10))
-        << ReadFile(tmp_.Sub("s2sd.log"));
+    S2sdTest::StartDaemon({"--clock-offset", std::to_string(offset)});
   }
 
   // SIGTERM, and the exit code.
-  int StopDaemon() {
-    if (pid_ <= 0) return -1;
-    kill(pid_, SIGTERM);
-    int st = 0;
-    waitpid(pid_, &st, 0);
-    pid_ = -1;
-    return WIFEXITED(st) ? WEXITSTATUS(st) : 128 + WTERMSIG(st);
-  }
+  int StopDaemon() { return s2sd_.Stop(); }
 
   static PObject Action(const std::string& action, unsigned long long id = 0) {
     PObject req;
@@ -265,18 +223,13 @@ class ServiceTest : public ::testing::Test {
     return req;
   }
 
-  PObject Request(const PObject& request) {
-    S2S::IPCSender sender;
-    PObject reply;
-    if (sender.connect(SocketPath()) == 0) sender.send(request, true, reply);
-    sender.close();
-    return reply;
-  }
+  PObject Request(const PObject& request) { return s2sd_.Request(request); }
 
-  // Adds a task over `shares` with `schedule`; its id.
+  // `settings` are task keys set beside.
   unsigned long long Add(const std::string& name,
                          const std::list<std::string>& shares,
-                         const S2S::Schedule& schedule) {
+                         const S2S::Schedule& schedule,
+                         const PObject& settings = PObject()) {
     S2S::SyncTask t;
     t.GetInfo().SetName(name);
     t.GetInfo().SetShareList(shares);
@@ -285,6 +238,9 @@ class ServiceTest : public ::testing::Test {
     PObject req = Action("add");
     S2S::SyncTask2PObj(t, req["task"]);
     req["task"].asMap().erase("id");
+    if (settings.isMap()) {
+      for (const auto& it : settings.asMap()) req["task"][it.first] = it.second;
+    }
     PObject reply = Request(req);
     EXPECT_EQ(0u, reply["result"].asUInt64()) << reply["message"].asString();
     return reply["id"].asUInt64();
@@ -311,8 +267,9 @@ class ServiceTest : public ::testing::Test {
     auto start = std::chrono::steady_clock::now();
     bool ok = done();
     while (!ok && s2s_test::SecondsSince(start) < seconds) {
+      // Other signs (a transfer's start in the rsync log) come without a
+      // history change; ask again at least every 100 ms.
       pollfd p = {fd, POLLIN, 0};
-      // The socket appears without a history change; poll that in slices.
       poll(&p, 1, 100);
       char buf[4096];
       while (read(fd, buf, sizeof buf) > 0) {
@@ -398,15 +355,6 @@ class ServiceTest : public ::testing::Test {
     localtime_r(&now, &t);
     return At(t.tm_year + 1900, t.tm_mon + 1, t.tm_mday, 12, 0) + second - now;
   }
-
-  static bool MakeDirs(const std::string& dir, std::string& error) {
-    return s2s_service::MakeDirs(dir, error);
-  }
-
-  s2s_test::Appliances app_;
-  s2s_test::TempDir tmp_;
-  std::string bin_, rsync_log_;
-  pid_t pid_ = -1;
 };
 
 void WriteBlob(const std::string& path, int mb) {
@@ -425,8 +373,7 @@ TEST_F(ServiceTest, ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce) {
   StartDaemon(OffsetTo(57));
   unsigned long long sched = Add("sched", {"docs"}, EveryMinute());
   unsigned long long manual = Add("manual", {"big"}, S2S::Schedule());
-  ASSERT_TRUE(WaitFor(Ended(sched, "ok"), 30))
-      << ReadFile(tmp_.Sub("s2sd.log"));
+  ASSERT_TRUE(WaitFor(Ended(sched, "ok"), 30)) << Log();
   EXPECT_EQ("alpha\n", ReadFile(app_.ServerShare("docs") + "/a.txt"));
   EXPECT_EQ("schedule", Runs(sched)[0]["trigger"].asString());
   EXPECT_TRUE(Runs(manual).empty()) << "a manual task ran by itself";
@@ -513,13 +460,17 @@ TEST_F(ServiceTest, CancelEndsALongTransferAndTheServerShowsTheTaskIdle) {
 
 TEST_F(ServiceTest, SharedShareNeverAtOnceAndNoMoreThanMaxParallelRuns) {
   for (const char* share : {"docs", "big", "photos"}) {
-    WriteBlob(app_.ClientShare(share) + "/blob", 60);
+    WriteBlob(app_.ClientShare(share) + "/blob", 1);
   }
   StartDaemon(OffsetTo(57));
-  // Four tasks due at the same minute; two of them over docs.
-  for (const char* name : {"a", "b"}) Add(name, {"docs"}, EveryMinute());
-  Add("c", {"big"}, EveryMinute());
-  Add("d", {"photos"}, EveryMinute());
+  // Four tasks due at the same minute; two of them over docs. At 1 MiB/s
+  // each transfer lasts a second, long enough to overlap the next.
+  PObject slow;
+  slow = PObject::Map();
+  slow["max_bandwidth"] = 1024u;
+  for (const char* name : {"a", "b"}) Add(name, {"docs"}, EveryMinute(), slow);
+  Add("c", {"big"}, EveryMinute(), slow);
+  Add("d", {"photos"}, EveryMinute(), slow);
   ASSERT_TRUE(WaitFor(
       [&] {
         for (unsigned long long id = 1; id <= 4; ++id) {
@@ -528,7 +479,7 @@ TEST_F(ServiceTest, SharedShareNeverAtOnceAndNoMoreThanMaxParallelRuns) {
         return true;
       },
       60))
-      << ReadFile(tmp_.Sub("s2sd.log"));
+      << Log();
   std::vector<Transfer> transfers = Transfers();
   ASSERT_EQ(4u, transfers.size()) << ReadFile(rsync_log_);
   size_t most = 0;
@@ -554,7 +505,7 @@ TEST_F(ServiceTest, SteadyRunsSendOnlyTheCommandsTheirSharesNeed) {
   const std::pair<int, int> expected[] = {{3 + 2 * 2 + 1, 2}, {2 * 2 + 1, 2}};
   for (const auto& want : expected) {
     std::pair<int, int> before = Served();
-    ASSERT_EQ("ok", RunOnce(id)) << ReadFile(tmp_.Sub("s2sd.log"));
+    ASSERT_EQ("ok", RunOnce(id)) << Log();
     std::pair<int, int> after = Served();
     EXPECT_EQ(want.first, after.first - before.first) << app_.DaemonLog();
     EXPECT_EQ(want.second, after.second - before.second);
@@ -568,16 +519,15 @@ TEST_F(ServiceTest, AClientItsServerForgotPairsAgainWithinTheRun) {
   ASSERT_TRUE(app_.StartServer(/*old_server=*/true)) << app_.DaemonLog();
   StartDaemon(0);
   unsigned long long id = Add("forgotten", {"docs"}, S2S::Schedule());
-  ASSERT_EQ("ok", RunOnce(id)) << ReadFile(tmp_.Sub("s2sd.log"));
+  ASSERT_EQ("ok", RunOnce(id)) << Log();
   {
     s2s_test::ScopedEnv root("S2S_ROOT", app_.server_root());
     ASSERT_EQ(0, s2s_svr_reset_pair());
   }
   ASSERT_NE("CLIENT-A", app_.ServerRegistry("PairedClientInfo", "clientID"));
   WriteFile(app_.ClientShare("docs") + "/after.txt", "again\n");
-  ASSERT_EQ("ok", RunOnce(id)) << ReadFile(tmp_.Sub("s2sd.log"));
-  EXPECT_TRUE(s2s_test::Has(ReadFile(tmp_.Sub("s2sd.log")),
-                            "not paired with this client [247]"));
+  ASSERT_EQ("ok", RunOnce(id)) << Log();
+  EXPECT_TRUE(s2s_test::Has(Log(), "not paired with this client [247]"));
   EXPECT_EQ("CLIENT-A", app_.ServerRegistry("PairedClientInfo", "clientID"));
   EXPECT_EQ("again\n", ReadFile(app_.ServerShare("docs") + "/after.txt"));
 }
