@@ -15,7 +15,6 @@
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
-#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -70,16 +69,6 @@ std::vector<std::pair<pid_t, std::string>> AllProcs(const char* file) {
   return out;
 }
 
-// Command lines of every process now, NUL-separated arguments as spaces.
-std::vector<std::string> AllCommandLines() {
-  std::vector<std::string> out;
-  for (auto& p : AllProcs("cmdline")) {
-    std::replace(p.second.begin(), p.second.end(), '\0', ' ');
-    if (!p.second.empty()) out.push_back(p.second);
-  }
-  return out;
-}
-
 // The rsync processes whose parent is `parent`, with the session each is
 // in.
 std::vector<std::pair<pid_t, pid_t>> RsyncChildren(pid_t parent) {
@@ -119,11 +108,6 @@ void WriteBlob(const std::string& path, int mb) {
     for (std::uint64_t& word : chunk) word = random();
     blob.write(reinterpret_cast<const char*>(chunk.data()), 1 << 20);
   }
-}
-
-void SleepMs(int ms) {
-  timespec ts = {ms / 1000, (ms % 1000) * 1000000L};
-  nanosleep(&ts, nullptr);
 }
 
 // Bytes of file data a run's summary says were sent: "N files and 20.1 MiB
@@ -384,7 +368,8 @@ TEST_F(ToolsTest, PasswordNeverOnACommandLineOrInTheLogs) {
   int st = 0;
   std::string environ_path = "/proc/" + std::to_string(c.pid) + "/environ";
   while (waitpid(c.pid, &st, WNOHANG) == 0) {
-    for (const std::string& cmd : AllCommandLines()) {
+    for (auto& [pid, cmd] : AllProcs("cmdline")) {
+      std::replace(cmd.begin(), cmd.end(), '\0', ' ');
       EXPECT_EQ(std::string::npos, cmd.find(kPassword)) << cmd;
       if (cmd.find("rsync") == 0 &&
           cmd.find(":" + port_) != std::string::npos) {
@@ -498,9 +483,10 @@ TEST_F(ToolsTest, SyncsAShareAndOperatorCommandsOnARunningServer) {
 
 TEST_F(ToolsTest, SigtermCancelsARunningTransfer) {
   std::string client = MakeClient("client", "CLIENT-A");
-  // Big enough that the transfer is still running when the signal comes.
-  WriteBlob(client + "/volume1/big/blob", 400);
-  Child c = Spawn(tmp_.path(), Client(client, "big"));
+  // At 1 MiB/s the transfer is still running when the signal comes.
+  WriteBlob(client + "/volume1/big/blob", 8);
+  Child c =
+      Spawn(tmp_.path(), Client(client, "big", {"--max-bandwidth", "1024"}));
   // This client's own transfer, not a command before it: tests running
   // beside it push shares of the same name.
   ASSERT_TRUE(s2s_test::WaitUntil(
@@ -573,26 +559,26 @@ TEST_F(ToolsTest, ACutTransferResumesFromWhatArrived) {
   Child c =
       Spawn(tmp_.path(), Client(client, "big", {"--max-bandwidth", "16384"}));
   const std::string share = server_ + "/volume1/big";
-  bool past_half = false;
-  for (int waited = 0; waited < 60000 && !past_half; waited += 5) {
-    std::error_code ec;
-    for (const auto& e : std::filesystem::directory_iterator(share, ec)) {
-      // rsync's temporary file of the blob, growing.
-      past_half =
-          past_half || (e.path().filename().string().find(".blob.") == 0 &&
-                        e.file_size(ec) > kSize * 0.6);
-    }
-    if (!past_half) SleepMs(5);
-  }
+  bool past_half = s2s_test::WaitUntil(
+      [&] {
+        std::error_code ec;
+        for (const auto& e : std::filesystem::directory_iterator(share, ec)) {
+          // rsync's temporary file of the blob, growing.
+          if (e.path().filename().string().find(".blob.") == 0 &&
+              e.file_size(ec) > kSize * 0.6) {
+            return true;
+          }
+        }
+        return false;
+      },
+      60);
   kill(c.pid, SIGTERM);
   ASSERT_TRUE(past_half) << "the transfer was never seen half done";
   ASSERT_EQ(kExitCancelled, c.Wait()) << c.out << c.err;
   // The daemon's side keeps the part once its connection has ended.
   const std::string part = share + "/.s2s-partial/blob";
-  for (int waited = 0; waited < 30000 && !std::filesystem::exists(part);
-       waited += 5)
-    SleepMs(5);
-  ASSERT_TRUE(std::filesystem::exists(part));
+  ASSERT_TRUE(
+      s2s_test::WaitUntil([&] { return std::filesystem::exists(part); }, 30));
   Child next = RunProgram(tmp_.path(), Client(client, "big"));
   ASSERT_EQ(kExitOk, next.code) << next.out << next.err;
   EXPECT_GT(SentBytes(next.out), 0) << next.out;
@@ -642,10 +628,12 @@ TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
             Client(client, "big",
                    {"--beacon-interval", "0", "--max-bandwidth", "1024"}));
   std::vector<std::pair<pid_t, pid_t>> rsyncs;
-  for (int waited = 0; waited < 20000 && rsyncs.size() < 2; waited += 2) {
-    rsyncs = RsyncChildren(c.pid);
-    SleepMs(2);
-  }
+  s2s_test::WaitUntil(
+      [&] {
+        rsyncs = RsyncChildren(c.pid);
+        return rsyncs.size() >= 2;
+      },
+      20);
   ASSERT_EQ(2u, rsyncs.size()) << "no transfer with a beacon beside it";
   for (const auto& r : rsyncs) {
     EXPECT_EQ(r.first, r.second) << "rsync is not in a session of its own";

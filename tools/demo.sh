@@ -140,7 +140,7 @@ step "the client service: s2sd --foreground --root $client"
 offset=0 spare=10
 if [ -n "${S2S_DEMO_QUICK:-}" ]; then
   now=$(date +%s)
-  offset=$(((now / 60 + 1) * 60 - 5 - now)) spare=2
+  offset=$(((now / 60 + 1) * 60 - 4 - now)) spare=2
 fi
 S2S_RSYNC_PORT=$port "$s2sd_bin" --foreground --root "$client" \
   --log "$work/s2sd.log" --clock-offset "$offset" &
@@ -156,7 +156,7 @@ ctl status
 # shows its history; fails unless that run went well.
 await_run() {
   local task=$1 limit=$2 json
-  for _ in $(seq $((limit * 2))); do
+  for _ in $(seq $((limit * 5))); do
     json=$(ctl --json history "$task" --limit 1)
     if grep -q '"outcome": "\(ok\|failed\|cancelled\)"' <<<"$json"; then
       ctl history "$task"
@@ -164,7 +164,7 @@ await_run() {
       cat "$work/s2sd.log" >&2
       return 1
     fi
-    sleep 0.5
+    sleep 0.2
   done
   echo "demo: $task did not run within $limit s" >&2
   cat "$work/s2sd.log" >&2
