@@ -1,0 +1,16 @@
+# Included by CTest after the discovered cases: the long ones by name, so
+# that a run with no timings of its own yet (a fresh clone) starts them
+# before the short ones and two parallel lanes end close together. The
+# figures are seconds on a loaded 2-core machine; only their order matters.
+set(s2s_long_cases
+    "ServerDaemonTest.SyncRunGuardedAgainstHostileClients" 10
+    "RsyncerKeyTest.KeyFilesTravelOverSshEvenWithSshOff" 8
+    "ServiceTest.SharedShareNeverAtOnceAndNoMoreThanMaxParallelRuns" 6
+    "ServiceTest.ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce" 6
+    "ToolsTest.ACutTransferResumesFromWhatArrived" 6
+    "ServiceTest.CancelEndsALongTransferAndTheServerShowsTheTaskIdle" 5
+    "ToolsTest.TaskFileRunWithBeaconsDuringTheTransfer" 5)
+while(s2s_long_cases)
+  list(POP_FRONT s2s_long_cases name cost)
+  set_tests_properties("${name}" PROPERTIES COST ${cost})
+endwhile()
