@@ -6,9 +6,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <filesystem>
-#include <thread>
 
 #include "daemon_config.h"
 #include "gtest/gtest.h"
@@ -217,12 +215,8 @@ TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   // Nothing is left in the spool once the connections are over: each
   // command's cleaner removes its files when its connection has ended.
   const std::string replies = tmp_.Sub("var/spool/s2s/reply");
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-  while (!std::filesystem::is_empty(replies) &&
-         std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  EXPECT_TRUE(std::filesystem::is_empty(replies));
+  EXPECT_TRUE(s2s_test::WaitUntil(
+      [&] { return std::filesystem::is_empty(replies); }, 10));
   EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("var/spool/s2s/early")));
 }
 

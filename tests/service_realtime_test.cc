@@ -230,10 +230,6 @@ class RealtimeTest : public s2s_test::S2sdTest,
     const PObject status = Status();
     return status["shares"][0u];
   }
-  bool Watching() {
-    const PObject share = Share();
-    return share["watching"].asBool();
-  }
 
   std::string client_, server_;
 };
@@ -308,7 +304,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
       10))
       << Log();
   fs::rename(client_ + ".away", client_);
-  EXPECT_TRUE(WaitUntil([&] { return Watching(); }, 10));
+  EXPECT_TRUE(WaitUntil([&] { return Share()["watching"].asBool(); }, 10));
   WriteFile(client_ + "/back.txt", "back\n");
   EXPECT_LE(0, Arrival("/back.txt", "back\n"));
 

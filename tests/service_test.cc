@@ -212,9 +212,6 @@ class ServiceTest : public s2s_test::S2sdTest {
     S2sdTest::StartDaemon({"--clock-offset", std::to_string(offset)});
   }
 
-  // SIGTERM, and the exit code.
-  int StopDaemon() { return s2sd_.Stop(); }
-
   static PObject Action(const std::string& action, unsigned long long id = 0) {
     PObject req;
     req = PObject::Map();
@@ -394,7 +391,7 @@ TEST_F(ServiceTest, ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce) {
   EXPECT_EQ(4u << 20, big["bytes"].asUInt64());
   EXPECT_EQ(0u, big["matched"].asUInt64());
   EXPECT_LT(0u, big["speed"].asUInt64());
-  EXPECT_EQ(0, StopDaemon());
+  EXPECT_EQ(0, s2sd_.Stop());
 
   // At 12:10:30: the missed slots give one catch-up run; tasks and history
   // are still there.
@@ -450,7 +447,7 @@ TEST_F(ServiceTest, CancelEndsALongTransferAndTheServerShowsTheTaskIdle) {
   // SIGTERM during the next transfer: cancelled the same way, and s2sd ends.
   ASSERT_EQ(0u, Request(Action("run", id))["result"].asUInt64());
   ASSERT_TRUE(WaitFor([&] { return BigTransfersStarted() == 2; }, 30));
-  EXPECT_EQ(0, StopDaemon());
+  EXPECT_EQ(0, s2sd_.Stop());
   PObject::Array runs = History(HistoryDir()).Runs(id, 1);
   ASSERT_EQ(1u, runs.size());
   EXPECT_EQ("cancelled", runs[0]["outcome"].asString());
