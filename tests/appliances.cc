@@ -173,7 +173,7 @@ S2S::SyncInfo Appliances::Info() const {
 
 namespace {
 
-// early: spool the command; pre: answer it from status/<name> and
+// early: spool the command (or the id of its upload); pre: answer it from status/<name> and
 // answer/<name> (grown with a hole to the size in pad/<name>), keep it in
 // last/<name> and count it in log.
 const char kScriptedHook[] = R"SH(
@@ -184,7 +184,7 @@ pre)
   id=${RSYNC_REQUEST#s2scmd/}
   case "$id" in *[!0-9a-f]*|'') exit 1 ;; esac
   cmd="$dir/spool/$RSYNC_PID"
-  [ -s "$cmd" ] || cmd="$dir/upload/$id"
+  grep -q '^command=' "$cmd" || cmd="$dir/upload/$id"
   name=$(sed -n 's/^command="\([A-Za-z0-9_]*\)"$/\1/p' "$cmd")
   [ -n "$name" ] || exit 1
   cp "$cmd" "$dir/last/$name"
