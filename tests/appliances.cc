@@ -92,8 +92,10 @@ bool Appliances::StartServer(bool old_server) {
   config.gid = getegid();
   config.old_server = old_server;
   {
-    // The generator writes below the root it runs under.
+    // The generator writes below the root it runs under; the daemon runs
+    // its hooks through the handler, as s2s-server starts it.
     ScopedEnv server("S2S_ROOT", server_root_);
+    ScopedEnv shell("RSYNC_SHELL", handler_);
     if (S2S::server::WriteDaemonConfig(config) != 0 ||
         !daemon_.StartWithConfig(S2S::server::DaemonConfigPath())) {
       return false;
