@@ -226,16 +226,22 @@ int RunCommand(const RsyncSettings& s, const boost::function<bool()>& cancel) {
 
   std::vector<std::string> pull = {"rsync"};
   for (const std::string& o : TransportOptions(s)) pull.push_back(o);
-  if (text.size() <= kMaxEarlyInput) {
-    pull.push_back("--early-input=" + command_file);
-  } else {
-    // Too large to travel with the request itself: spool it first.
+  if (text.size() > kMaxEarlyInput) {
+    // Too large to travel with the request itself: spool it first, and
+    // send only its request id, which names the upload.
     std::vector<std::string> push = pull;
     push.insert(push.end(),
                 {"--", command_file, RemoteSpec(s, kSpoolModule, id)});
     int status = RunAndLog(push, s, cancel, "command upload");
     if (status != 0) return status;
+    command_file = dir.File("id");
+    if (!WriteWhole(command_file, "requestID=\"" + id + "\"\n", 0600)) {
+      Log(LOG_ERR, "cannot write %s: %s", command_file.c_str(),
+          strerror(errno));
+      return RsyncWrapper::kStartFailed;
+    }
   }
+  pull.push_back("--early-input=" + command_file);
   std::string reply_file = dir.File(id);
   // A server may answer with anything: rsync skips a reply over the cap
   // (and says so), and no file it writes may grow past it.

@@ -110,15 +110,15 @@ int WriteDaemonConfig(const DaemonConfig& c) {
     LOG_ERROR("handler path or root holds characters a shell interprets");
     return -1;
   }
-  if (c.user.empty() || c.password.empty() || !ShellSafe(c.user) ||
-      c.user.find('/') != std::string::npos || !OneLine(c.password)) {
+  if (c.password.empty() || !IsValidDaemonUser(c.user) ||
+      !OneLine(c.password)) {
     LOG_ERROR("daemon user or password cannot be written to a secrets file");
     return -1;
   }
   std::error_code ec;
   for (const std::string& dir :
-       {KaroRootPath("/etc/s2s"), KaroRootPath("/var/run"), EarlyDir(),
-        UploadDir(), ReplyDir(), KaroRootPath(KARO_SHARE_KEY_DIR)}) {
+       {KaroRootPath("/etc/s2s"), KaroRootPath("/var/run"), UploadDir(),
+        ReplyDir(), KaroRootPath(KARO_SHARE_KEY_DIR)}) {
     std::filesystem::create_directories(dir, ec);
     if (ec) {
       LOG_ERROR("cannot create %s: %s", dir.c_str(), ec.message().c_str());
@@ -140,8 +140,8 @@ int WriteDaemonConfig(const DaemonConfig& c) {
     std::string line;
     while (std::getline(in, line)) {
       std::string name = line.substr(0, line.find(':'));
-      if (name.size() == line.size() || name == c.user || !ShellSafe(name) ||
-          name.find('/') != std::string::npos) {
+      if (name.size() == line.size() || name == c.user ||
+          !IsValidDaemonUser(name)) {
         continue;
       }
       secrets += line + "\n";
@@ -174,11 +174,15 @@ int WriteDaemonConfig(const DaemonConfig& c) {
   // client's data transfer (-a --delete), so the key module cannot refuse
   // those options; its hook confines a push to the key file of a share
   // whose sync the pusher holds, and trees are filtered and removed.
+  // A command is one hook: the early input carries it, the early hook
+  // answers it into the connection's daemon user's directory, and the same
+  // connection pulls the answer. The path keeps one user's pulls (a glob
+  // included) away from the others' replies.
   conf += std::string("[") + kCommandModule + "]\n\tpath = " + ReplyDir() +
-          "\n\tread only = yes\n\tlist = no\n\tmax connections = 64\n"
+          "/%RSYNC_USER_NAME%\n\tread only = yes\n\tlist = no\n"
+          "\tmax connections = 64\n"
           "\trefuse options = delete recursive\n" +
-          auth + "\tearly exec = " + hook +
-          " early\n\tpre-xfer exec = " + hook + " pre\n";
+          auth + "\tearly exec = " + hook + " early\n";
   conf += std::string("[") + kSpoolModule + "]\n\tpath = " + UploadDir() +
           "\n\tread only = no\n\twrite only = yes\n\tlist = no\n"
           "\tmax connections = 16\n"

@@ -3,11 +3,12 @@
 //
 // Modules: one per configured share (named after the share, "@share@" for an
 // encrypted one, whose module is its encrypted lower directory), each
-// guarded by the handler's "data" hook; "s2scmd" (command replies, with the
-// early and pre hooks), "s2sspool" (write-only upload of large commands)
-// and "s2skeys" (the key-file directory, guarded by the "keys" hook). All
-// modules require the daemon users; each has a connection limit and refuses
-// the options it has no use for (deletes everywhere but the share modules).
+// guarded by the handler's "data" hook; "s2scmd" (commands, answered by the
+// early hook into a reply directory per daemon user), "s2sspool" (write-only
+// upload of large commands) and "s2skeys" (the key-file directory, guarded by
+// the "keys" hook). All modules require the daemon users; each has a connection
+// limit and refuses the options it has no use for (deletes everywhere but the
+// share modules).
 #ifndef S2S_SERVER_DAEMON_CONFIG_H_
 #define S2S_SERVER_DAEMON_CONFIG_H_
 

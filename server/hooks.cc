@@ -184,81 +184,91 @@ bool IsDryRunReceiver(const std::vector<std::string>& args) {
   return false;
 }
 
-std::string EarlyDir() { return KaroRootPath("/var/spool/s2s/early"); }
 std::string UploadDir() { return KaroRootPath("/var/spool/s2s/upload"); }
 std::string ReplyDir() { return KaroRootPath("/var/spool/s2s/reply"); }
 
-int EarlyHook(const HookEnv& env, FILE* in) {
-  if (!IsPid(env.pid)) {
-    LOG_ERROR("early hook without a valid RSYNC_PID");
-    return 1;
-  }
-  std::string data;
-  char buf[4096];
-  size_t n;
-  while ((n = fread(buf, 1, sizeof buf, in)) > 0 &&
-         data.size() <= kMaxCommandFile) {
-    data.append(buf, n);
-  }
-  std::string path = EarlyDir() + "/" + env.pid;
-  unlink(path.c_str());  // a leftover of a crashed connection with this pid
-  if (!WriteNew(path, data)) {
-    LOG_ERROR("cannot spool the command to %s: %s", path.c_str(),
-              strerror(errno));
-    return 1;
-  }
-  return 0;
+bool IsValidDaemonUser(const std::string& user) {
+  return !user.empty() && user.size() <= 64 && user != "." && user != ".." &&
+         user.find_first_not_of(
+             "abcdefghijklmnopqrstuvwxyz"
+             "ABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789._-+") == std::string::npos;
 }
 
-int PreHook(const HookEnv& env, bool old_server, FILE* out) {
-  std::string id = RequestId(env.request, kCommandModule);
-  if (!IsPid(env.pid) || id.empty()) {
-    LOG_WARNING("refused a command pull from %s: bad request",
-                env.host_addr.c_str());
-    // With a reason the client's rsync reports a refusal (exit 4) rather
-    // than a dropped connection.
-    if (out != nullptr) fprintf(out, "malformed request id\n");
+std::string ReplyPath(const std::string& user, const std::string& id) {
+  return ReplyDir() + "/" + user + "/" + id;
+}
+
+std::string CommandRequestId(const std::string& text) {
+  static const std::string kKey = "requestID=\"";
+  if (text.size() < 2 || text.back() != '\n') return "";
+  size_t begin = text.rfind('\n', text.size() - 2);
+  begin = begin == std::string::npos ? 0 : begin + 1;
+  std::string line = text.substr(begin, text.size() - 1 - begin);
+  if (line.size() < kKey.size() + 1 ||
+      line.compare(0, kKey.size(), kKey) != 0 || line.back() != '"') {
+    return "";
+  }
+  std::string id = line.substr(kKey.size(), line.size() - kKey.size() - 1);
+  return IsValidRequestId(id) ? id : "";
+}
+
+int CommandHook(const HookEnv& env, bool old_server, FILE* in,
+                std::string* id_out) {
+  if (!IsPid(env.pid) || !IsValidDaemonUser(env.user)) {
+    LOG_ERROR("command hook without a valid RSYNC_PID and RSYNC_USER_NAME");
     return 1;
   }
+  time_t arrival = time(nullptr);
   std::string text;
-  std::string early = EarlyDir() + "/" + env.pid;
-  // The connection began when its early input was spooled.
-  struct stat st;
-  time_t arrival = stat(early.c_str(), &st) == 0 ? st.st_mtime : time(nullptr);
-  if (!ReadLimited(early, kMaxCommandFile, &text) || text.empty()) {
-    ReadLimited(UploadDir() + "/" + id, kMaxCommandFile, &text);
+  char buf[4096];
+  size_t n;
+  while (text.size() <= kMaxCommandFile &&
+         (n = fread(buf, 1, sizeof buf, in)) > 0) {
+    text.append(buf, n);
   }
-  // Remembered for the post hook, which no longer sees the request.
-  std::string mark = EarlyDir() + "/" + env.pid + ".id";
-  unlink(mark.c_str());
-  WriteNew(mark, id);
+  std::string id = CommandRequestId(text);
+  if (id.empty()) {
+    // Without an id there is no reply to write: the daemon ends the
+    // connection, which the client reports as refused.
+    LOG_WARNING("refused a command from %s: no valid request id",
+                env.host_addr.c_str());
+    return 1;
+  }
+  if (text.size() == std::string("requestID=\"\"\n").size() + id.size()) {
+    // Only the id: the command was too large to travel with the
+    // connection and was uploaded under it; it arrived with its upload.
+    std::string upload = UploadDir() + "/" + id;
+    struct stat st;
+    if (stat(upload.c_str(), &st) == 0) arrival = st.st_mtime;
+    if (!ReadLimited(upload, kMaxCommandFile, &text)) text.clear();
+  }
   std::string answer;
   int status = text.empty()
                    ? kMalformed
                    : RunCommand(text, id, env, old_server, arrival, &answer);
   std::string reply = "status=" + std::to_string(status) + "\n" + answer;
-  std::string path = ReplyDir() + "/" + id;
+  // One reply directory per daemon user, which is all that user's pulls
+  // can reach: the command module's path names it.
+  std::string dir = ReplyDir() + "/" + env.user;
+  if (mkdir(dir.c_str(), 0700) != 0 && errno != EEXIST) {
+    LOG_ERROR("cannot create %s: %s", dir.c_str(), strerror(errno));
+    return 1;
+  }
+  std::string path = dir + "/" + id;
   if (!WriteNew(path, reply)) {
     LOG_ERROR("cannot write the reply %s: %s", path.c_str(), strerror(errno));
     return 1;
   }
+  if (id_out != nullptr) *id_out = id;
   return 0;
 }
 
-int PostHook(const HookEnv& env) {
-  if (!IsPid(env.pid)) return 0;
-  std::string early = EarlyDir() + "/" + env.pid;
-  std::string id;
-  if (ReadLimited(early + ".id", 64, &id) && IsValidRequestId(id)) {
-    unlink((UploadDir() + "/" + id).c_str());
-    unlink((ReplyDir() + "/" + id).c_str());
-  }
-  unlink((early + ".id").c_str());
-  unlink(early.c_str());
-  return 0;
+void RemoveCommandFiles(const std::string& user, const std::string& id) {
+  unlink((UploadDir() + "/" + id).c_str());
+  unlink(ReplyPath(user, id).c_str());
 }
 
-int CleanUpAfterConnection(const HookEnv& env) {
+int CleanUpAfterConnection(const HookEnv& env, const std::string& id) {
   if (!IsPid(env.pid)) return -1;
   pid_t connection = static_cast<pid_t>(std::stol(env.pid));
   pid_t child = fork();
@@ -284,10 +294,12 @@ int CleanUpAfterConnection(const HookEnv& env) {
     }
     if ((p.revents & POLLIN) == 0) _exit(0);
   }
-  PostHook(env);
-  for (const std::string& dir : {EarlyDir(), UploadDir(), ReplyDir()}) {
-    PruneStale(dir);
-  }
+  RemoveCommandFiles(env.user, id);
+  PruneStale(UploadDir());
+  // The users' directories stay: a reply may be on its way into one.
+  ForEachEntry(ReplyDir(), [](const std::string& path, const struct stat& st) {
+    if (S_ISDIR(st.st_mode)) PruneStale(path);
+  });
   _exit(0);
 }
 

@@ -1,12 +1,12 @@
 // The rsync daemon's hooks, as modes of the command handler program.
 //
-//   early  (s2scmd, early exec)    spools the early input of this connection
-//   pre    (s2scmd, pre-xfer exec) reads the command (spooled early input,
-//          else the file uploaded to s2sspool), runs it, writes the reply
-//          file named by the request id into the command module
-//   post   (daemon configurations of older versions: s2scmd, post-xfer
-//          exec) removes the spool, upload and reply; the handler now does
-//          that after "pre" in a process of its own (CleanUpAfterConnection)
+//   early  (s2scmd, early exec) reads the command from the connection's
+//          early input (or, when that holds only its request id, from the
+//          file uploaded to s2sspool under the id), runs it and writes the
+//          reply the same connection then pulls, named by the request id,
+//          into the daemon user's own directory of the command module; it
+//          leaves a process that removes the reply and upload once the
+//          connection has ended (CleanUpAfterConnection)
 //   data   (share modules, pre-xfer exec) lets a push through only from the
 //          client holding the share's running sync, and a dry run from the
 //          client that feeds the share
@@ -58,21 +58,34 @@ struct HookEnv {
 // "--sender" (the daemon sends) makes it false.
 bool IsDryRunReceiver(const std::vector<std::string>& args);
 
-// The spool directories under the root: early input, uploads, replies.
-std::string EarlyDir();
+// The spool directories under the root: uploads, replies.
 std::string UploadDir();
 std::string ReplyDir();
 
-int EarlyHook(const HookEnv& env, FILE* in);
-// `out`, when given, receives a refusal of the request itself.
-int PreHook(const HookEnv& env, bool old_server, FILE* out = nullptr);
-int PostHook(const HookEnv& env);
+// Whether `user` (RSYNC_USER_NAME) can name a reply directory: 1-64 of
+// letters, digits and "._-+", not "." or "..".
+bool IsValidDaemonUser(const std::string& user);
+// Where the reply to request `id` of daemon user `user` is written.
+std::string ReplyPath(const std::string& user, const std::string& id);
+// The request id of a command file's last line, requestID="<id>", or ""
+// when that line is missing or the id is not valid.
+std::string CommandRequestId(const std::string& text);
+
+// The early hook: reads the command from `in`, runs it and writes its
+// reply (whatever the command's status). Returns 0 and sets `*id` to the
+// request id when the reply was written; 1 (logged) when the input names no
+// valid request id, the environment is not a daemon connection's, or the
+// reply cannot be written.
+int CommandHook(const HookEnv& env, bool old_server, FILE* in,
+                std::string* id = nullptr);
+// Removes the reply and the upload of request `id` of daemon user `user`.
+void RemoveCommandFiles(const std::string& user, const std::string& id);
 // Leaves behind a process that waits for the daemon's connection process
-// (RSYNC_PID) to end, then does what PostHook does and removes stale spool
+// (RSYNC_PID) to end, then removes the command's files and stale spool
 // entries, so that neither the command nor the next one waits for a
 // cleanup hook. Returns 0 in the caller, or -1 (logged) when no process
 // could be started; stale entries are then pruned after a later command.
-int CleanUpAfterConnection(const HookEnv& env);
+int CleanUpAfterConnection(const HookEnv& env, const std::string& id);
 // `out` receives the refusal, which the daemon shows the client.
 int DataHook(const HookEnv& env, FILE* out);
 int KeyHook(const HookEnv& env, FILE* out);

@@ -1,13 +1,23 @@
 // s2s-cmd-handler: the program the server's rsync daemon runs from its hooks.
 //
 //   s2s-cmd-handler [--root DIR] [--old-server] MODE
+//   s2s-cmd-handler -c "HOOK LINE"
 //   s2s-cmd-handler --help | --version
 //
 // --root sets the appliance root (as S2S_ROOT does) for the registry, the
-// share configuration and the spool directories.
+// share configuration and the spool directories. "-c" makes it the shell
+// the daemon runs its hooks through (RSYNC_SHELL): a hook line of its own
+// configuration runs without a shell in between, any other goes to
+// /bin/sh.
+#include <ctype.h>
+#include <limits.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <unistd.h>
+
+#include <string>
+#include <vector>
 
 #include "S2S/logger.h"
 #include "hooks.h"
@@ -34,13 +44,56 @@ const char kHelp[] =
     "  --root DIR     appliance root (as $S2S_ROOT) of the registry, shares\n"
     "                 and spool directories\n"
     "  --old-server   answer as a server of protocol version 0\n"
+    "  -c LINE        run a hook line as the daemon's hook shell would\n"
     "\n"
     "Its inputs are the daemon's RSYNC_* variables; it logs to syslog.\n"
     "Exit codes: 0 lets the transfer go on, 2 usage, anything else refuses.\n";
 
+// "-c LINE" from the daemon: the words of LINE when it is a hook line this
+// program's configuration wrote, "exec PROGRAM ARGS...", with PROGRAM this
+// very program; otherwise the system's shell runs LINE.
+std::vector<std::string> HookWords(const char* line) {
+  std::vector<std::string> words;
+  std::string word;
+  for (const char* p = line;; ++p) {
+    if (*p == ' ' || *p == '\0') {
+      if (!word.empty()) words.push_back(word);
+      word.clear();
+      if (*p == '\0') break;
+    } else if (isalnum(static_cast<unsigned char>(*p)) ||
+               strchr("/._-+", *p) != nullptr) {
+      word += *p;
+    } else {
+      return {};
+    }
+  }
+  if (words.size() < 3 || words[0] != "exec") return {};
+  char self[PATH_MAX], named[PATH_MAX];
+  ssize_t n = readlink("/proc/self/exe", self, sizeof self - 1);
+  if (n <= 0 || realpath(words[1].c_str(), named) == nullptr) return {};
+  self[n] = '\0';
+  if (strcmp(self, named) != 0) return {};
+  words.erase(words.begin());
+  return words;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
+  std::vector<std::string> words;
+  std::vector<char*> hook_argv;
+  if (argc == 3 && strcmp(argv[1], "-c") == 0) {
+    words = HookWords(argv[2]);
+    if (words.empty()) {
+      execl("/bin/sh", "sh", "-c", argv[2], static_cast<char*>(nullptr));
+      perror("/bin/sh");
+      return 127;
+    }
+    for (std::string& w : words) hook_argv.push_back(&w[0]);
+    hook_argv.push_back(nullptr);
+    argc = static_cast<int>(words.size());
+    argv = hook_argv.data();
+  }
   bool old_server = false;
   const char* mode = nullptr;
   for (int i = 1; i < argc; ++i) {
@@ -66,21 +119,19 @@ int main(int argc, char** argv) {
   if (mode == nullptr) {
     fprintf(stderr,
             "usage: %s [--root DIR] [--old-server] "
-            "early|pre|post|data|keys|keys-done|upload|upload-done\n",
+            "early|data|keys|keys-done|upload|upload-done\n",
             argv[0]);
     return 2;
   }
   S2S::Logger::Initialize(S2S::Logger::Syslog, S2S::Logger::Note, "", 0);
   using namespace S2S::server;
   HookEnv env = HookEnv::FromEnvironment();
-  if (strcmp(mode, "early") == 0) return EarlyHook(env, stdin);
-  if (strcmp(mode, "pre") == 0) {
-    int rc = PreHook(env, old_server, stdout);
-    fflush(stdout);
-    CleanUpAfterConnection(env);
+  if (strcmp(mode, "early") == 0) {
+    std::string id;
+    int rc = CommandHook(env, old_server, stdin, &id);
+    if (rc == 0) CleanUpAfterConnection(env, id);
     return rc;
   }
-  if (strcmp(mode, "post") == 0) return PostHook(env);
   if (strcmp(mode, "data") == 0) return DataHook(env, stdout);
   if (strcmp(mode, "keys") == 0) return KeyHook(env, stdout);
   if (strcmp(mode, "keys-done") == 0) return KeyDoneHook();

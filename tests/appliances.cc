@@ -92,8 +92,10 @@ bool Appliances::StartServer(bool old_server) {
   config.gid = getegid();
   config.old_server = old_server;
   {
-    // The generator writes below the root it runs under.
+    // The generator writes below the root it runs under; the daemon runs
+    // its hooks through the handler, as s2s-server starts it.
     ScopedEnv server("S2S_ROOT", server_root_);
+    ScopedEnv shell("RSYNC_SHELL", handler_);
     if (S2S::server::WriteDaemonConfig(config) != 0 ||
         !daemon_.StartWithConfig(S2S::server::DaemonConfigPath())) {
       return false;
@@ -173,7 +175,7 @@ S2S::SyncInfo Appliances::Info() const {
 
 namespace {
 
-// early: spool the command; pre: answer it from status/<name> and
+// early: spool the command (or the id of its upload); pre: answer it from status/<name> and
 // answer/<name> (grown with a hole to the size in pad/<name>), keep it in
 // last/<name> and count it in log.
 const char kScriptedHook[] = R"SH(
@@ -184,7 +186,7 @@ pre)
   id=${RSYNC_REQUEST#s2scmd/}
   case "$id" in *[!0-9a-f]*|'') exit 1 ;; esac
   cmd="$dir/spool/$RSYNC_PID"
-  [ -s "$cmd" ] || cmd="$dir/upload/$id"
+  grep -q '^command=' "$cmd" || cmd="$dir/upload/$id"
   name=$(sed -n 's/^command="\([A-Za-z0-9_]*\)"$/\1/p' "$cmd")
   [ -n "$name" ] || exit 1
   cp "$cmd" "$dir/last/$name"

@@ -111,9 +111,8 @@ TEST(DataHook, OnlyArgumentsThatMakeTheDaemonRunDryCountAsADryRun) {
 class HookTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    for (const std::string& d : {EarlyDir(), UploadDir(), ReplyDir()}) {
-      std::filesystem::create_directories(d);
-    }
+    std::filesystem::create_directories(UploadDir());
+    std::filesystem::create_directories(ReplyDir());
     env_.pid = "4242";
     env_.host_addr = "127.0.0.1";
     env_.user = "u";
@@ -129,20 +128,19 @@ class HookTest : public ::testing::Test {
     std::filesystem::create_directories(tmp_.Sub("etc/s2s"));
     WriteFile(tmp_.Sub("etc/s2s/shares.conf"), conf);
   }
-  // Runs `text` as request `id` through the pre hook; the reply's status.
+  // Runs `text` as request `id` through the early hook; the reply's status.
   int Status(const std::string& text, const std::string& id) {
-    if (Pull(text + "requestID=\"" + id + "\"\n", "s2scmd/" + id) != 0) {
-      return -1;
-    }
-    std::string reply = ReadFile(ReplyDir() + "/" + id);
+    if (Early(text + "requestID=\"" + id + "\"\n") != 0) return -1;
+    std::string reply = ReadFile(ReplyPath(env_.user, id));
     return reply.compare(0, 7, "status=") == 0 ? std::stoi(reply.substr(7))
                                                : -1;
   }
-  // Spools `text` as this connection's early input and runs the pre hook.
-  int Pull(const std::string& text, const std::string& request) {
-    WriteFile(EarlyDir() + "/" + env_.pid, text);
-    env_.request = request;
-    return PreHook(env_, false);
+  // Feeds `text` to the early hook as a connection's early input.
+  int Early(const std::string& text) {
+    FILE* in = fmemopen(const_cast<char*>(text.data()), text.size(), "r");
+    int rc = CommandHook(env_, false, in);
+    fclose(in);
+    return rc;
   }
 
   s2s_test::TempDir tmp_;
@@ -150,11 +148,17 @@ class HookTest : public ::testing::Test {
   HookEnv env_;
 };
 
-TEST_F(HookTest, RequestIdOutsideTheReplyDirectoryIsRefused) {
+TEST_F(HookTest, RequestIdsAndUsersThatCouldEscapeTheReplyDirectoryAreRefused) {
   std::string cmd = "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\n";
-  for (const char* req : {"s2scmd/../x", "s2scmd/a/b", "s2scmd/", "other/abc",
-                          "s2scmd/abc s2scmd/def"}) {
-    EXPECT_EQ(1, Pull(cmd, req)) << req;
+  for (const char* id : {"../x", "a/b", "", "a b"}) {
+    EXPECT_EQ(1, Early(cmd + "requestID=\"" + id + "\"\n")) << id;
+  }
+  // The id on another line than the last, or missing.
+  EXPECT_EQ(1, Early("requestID=\"r\"\n" + cmd));
+  EXPECT_EQ(1, Early(cmd));
+  for (const char* user : {"..", ".", "a/b", ""}) {
+    env_.user = user;
+    EXPECT_EQ(1, Early(cmd + "requestID=\"r\"\n")) << user;
   }
   EXPECT_TRUE(std::filesystem::is_empty(ReplyDir()));
   EXPECT_FALSE(std::filesystem::exists(tmp_.path() + "/x"));
@@ -192,27 +196,26 @@ TEST_F(HookTest, BadCommandsGetAClearStatusAndWriteNothing) {
   for (const Case& c : cases) {
     EXPECT_EQ(c.status, Status(c.text, "req" + std::to_string(n++))) << c.text;
   }
-  // A request id inside the file that is not the one pulled.
-  ASSERT_EQ(0, Pull("command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\n"
-                    "requestID=\"other\"\n",
-                    "s2scmd/mine"));
-  EXPECT_EQ("status=241\n", ReadFile(ReplyDir() + "/mine"));
   EXPECT_EQ("", Registry());
 }
 
-TEST_F(HookTest, PostHookRemovesSpoolUploadAndReply) {
+TEST_F(HookTest, AnUploadedCommandRunsAndTheCleanupRemovesUploadAndReply) {
   std::string cmd =
       "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\nrequestID=\"r1\"\n";
-  ASSERT_EQ(0, Pull(cmd, "s2scmd/r1"));
-  EXPECT_EQ("status=0\n1\n", ReadFile(ReplyDir() + "/r1"));
-  struct stat st;
-  ASSERT_EQ(0, stat((ReplyDir() + "/r1").c_str(), &st));
-  EXPECT_EQ(0600u, st.st_mode & 0777);
   WriteFile(UploadDir() + "/r1", cmd);
-  EXPECT_EQ(0, PostHook(env_));
-  EXPECT_TRUE(std::filesystem::is_empty(ReplyDir()));
+  ASSERT_EQ(0, Early("requestID=\"r1\"\n"));
+  EXPECT_EQ("status=0\n1\n", ReadFile(ReplyPath("u", "r1")));
+  struct stat st;
+  ASSERT_EQ(0, stat(ReplyPath("u", "r1").c_str(), &st));
+  EXPECT_EQ(0600u, st.st_mode & 0777);
+  // An upload whose own id is another request's is not answered as this one.
+  WriteFile(UploadDir() + "/r2", cmd);
+  ASSERT_EQ(0, Early("requestID=\"r2\"\n"));
+  EXPECT_EQ("status=241\n", ReadFile(ReplyPath("u", "r2")));
+  RemoveCommandFiles("u", "r1");
+  RemoveCommandFiles("u", "r2");
+  EXPECT_TRUE(std::filesystem::is_empty(ReplyDir() + "/u"));
   EXPECT_TRUE(std::filesystem::is_empty(UploadDir()));
-  EXPECT_TRUE(std::filesystem::is_empty(EarlyDir()));
 }
 
 TEST_F(HookTest, ClientIdStaysWithItsDaemonUserAndALostRegistryStaysLost) {
@@ -320,17 +323,16 @@ TEST_F(HookTest, HeldLockTimesOutAndLateCommandsAreNotApplied) {
         Has(Registry(), "TASK_t1")) {
       _exit(14);
     }
-    // The same through the hook: the connection's early input is old.
-    std::string text =
-        "command=\"S2S_UpdateTaskStatus\"\nclientID=\"c1\"\n"
-        "taskName=\"t1\"\nrequestID=\"late\"\n";
-    std::string early = EarlyDir() + "/" + env_.pid;
-    WriteFile(early, text);
+    // The same through the hook: the command was uploaded long ago.
+    std::string upload = UploadDir() + "/late";
+    WriteFile(upload,
+              "command=\"S2S_UpdateTaskStatus\"\nclientID=\"c1\"\n"
+              "taskName=\"t1\"\nrequestID=\"late\"\n");
     struct timeval old[2] = {{time(nullptr) - kCommandBudgetSeconds - 5, 0},
                              {time(nullptr) - kCommandBudgetSeconds - 5, 0}};
-    env_.request = "s2scmd/late";
-    if (utimes(early.c_str(), old) != 0 || PreHook(env_, false) != 0 ||
-        ReadFile(ReplyDir() + "/late") != "status=242\n" ||
+    if (utimes(upload.c_str(), old) != 0 ||
+        Early("requestID=\"late\"\n") != 0 ||
+        ReadFile(ReplyPath("u", "late")) != "status=242\n" ||
         Has(Registry(), "TASK_t1")) {
       _exit(15);
     }

@@ -194,15 +194,31 @@ TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   EXPECT_EQ(0, Rsync(kOtherUser, kOtherPassword,
                      {tmp_.Sub("evil"), "s2sspool/next"}, port));
   EXPECT_FALSE(std::filesystem::exists(upload + "/big"));
-  // A malformed request id: the hook refuses the pull after the daemon has
-  // accepted it, which rsync reports as a broken connection.
+  // A malformed request id: the early hook refuses the command, which the
+  // daemon reports as a refusal at the start of the connection.
   WriteFile(tmp_.Sub("cmd"),
             "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\n"
             "requestID=\"a..b\"\n");
-  EXPECT_EQ(10, Rsync(kUser, kPassword,
-                      {"--early-input=" + tmp_.Sub("cmd"), "s2scmd/a..b",
-                       tmp_.Sub("empty") + "/"},
-                      port));
+  EXPECT_EQ(5, Rsync(kUser, kPassword,
+                     {"--early-input=" + tmp_.Sub("cmd"), "s2scmd/a..b",
+                      tmp_.Sub("empty") + "/"},
+                     port));
+  // One daemon user's pulls reach none of another's replies.
+  const std::string replies = tmp_.Sub("var/spool/s2s/reply");
+  std::filesystem::create_directories(replies + "/" + kUser);
+  WriteFile(replies + "/" + kUser + "/pending", "status=0\n");
+  WriteFile(tmp_.Sub("cmd"),
+            "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\n"
+            "requestID=\"r\"\n");
+  for (const std::string& path : std::vector<std::string>{
+           "s2scmd/*", "s2scmd/../" + std::string(kUser) + "/pending"}) {
+    Rsync(kOtherUser, kOtherPassword,
+          {"--early-input=" + tmp_.Sub("cmd"), path, tmp_.Sub("empty") + "/"},
+          port);
+  }
+  EXPECT_FALSE(std::filesystem::exists(tmp_.Sub("empty/pending")));
+  std::filesystem::remove(tmp_.Sub("empty/r"));
+  std::filesystem::remove(replies + "/" + kUser + "/pending");
   EXPECT_EQ(0, Command("CL1", "S2S_SyncFinish", finish));
   EXPECT_NE(0, Push());
   // A dry run needs no running sync from the client that feeds the share,
@@ -214,10 +230,15 @@ TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   EXPECT_EQ("payload", ReadFile(tmp_.Sub("share1/file")));
   // Nothing is left in the spool once the connections are over: each
   // command's cleaner removes its files when its connection has ended.
-  const std::string replies = tmp_.Sub("var/spool/s2s/reply");
   EXPECT_TRUE(s2s_test::WaitUntil(
-      [&] { return std::filesystem::is_empty(replies); }, 10));
-  EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("var/spool/s2s/early")));
+      [&] {
+        for (const auto& e :
+             std::filesystem::recursive_directory_iterator(replies)) {
+          if (!e.is_directory()) return false;
+        }
+        return true;
+      },
+      10));
 }
 
 }  // namespace

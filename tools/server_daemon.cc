@@ -18,6 +18,8 @@
 #include "daemon_config.h"
 #include "karo_process.h"
 #include "karo_root.h"
+#include "server_root.h"
+#include "server_shares.h"
 
 namespace s2s_tools {
 
@@ -116,6 +118,13 @@ bool IsOurDaemon(pid_t pid) {
   std::string address_arg = "--address=" + address;
   std::string config_arg = "--config=" + S2S::server::DaemonConfigPath();
   std::string log_arg = "--log-file=" + ServerLogPath();
+  // The handler is the shell of the daemon's hooks: it runs a hook line of
+  // its own configuration without a shell in between, and any other
+  // through /bin/sh.
+  std::string handler = DefaultHandler();
+  if (!handler.empty() && access(handler.c_str(), X_OK) == 0) {
+    setenv("RSYNC_SHELL", handler.c_str(), 1);
+  }
   execlp("rsync", "rsync", "--daemon", "--no-detach", address_arg.c_str(),
          port_arg.c_str(), config_arg.c_str(), log_arg.c_str(),
          static_cast<char*>(nullptr));
@@ -152,6 +161,8 @@ bool StartServerDaemon(const std::string& address, int port, pid_t& pid,
     error = "no daemon configuration; run 's2s-server config' first";
     return false;
   }
+  // A configuration written by an earlier version gets this version's hooks.
+  if (RegenerateServerConfig(error) < 0) return false;
   sockaddr_in sa;
   if (!ParseAddress(address, 0, sa)) {
     error = "not an IPv4 address: " + address;

@@ -138,10 +138,9 @@ bool GiveTree(const std::string& path, bool deep, uid_t uid, gid_t gid,
 // The directories the daemon and its hooks write to.
 std::vector<std::string> StateDirs() {
   std::vector<std::string> dirs = {
-      KaroRootPath("/usr/karo/etc"),    S2S::server::EarlyDir(),
-      S2S::server::UploadDir(),         S2S::server::ReplyDir(),
-      KaroRootPath(KARO_SHARE_KEY_DIR), KaroRootPath("/var/log/s2s"),
-      KaroRootPath("/tmp/S2S")};
+      KaroRootPath("/usr/karo/etc"), S2S::server::UploadDir(),
+      S2S::server::ReplyDir(),       KaroRootPath(KARO_SHARE_KEY_DIR),
+      KaroRootPath("/var/log/s2s"),  KaroRootPath("/tmp/S2S")};
   List names(KLIBCSzListAlloc());
   int count = names ? KAROShareEnum(names.get()) : -1;
   for (int i = 0; i < count; ++i) {
