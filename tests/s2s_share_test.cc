@@ -60,7 +60,6 @@ TEST_F(ShareTest, ShareInfoNamesTheModuleAndItsDirectory) {
   for (const auto& c : cases) {
     S2S::ShareInfo info;
     ASSERT_EQ(S2S::GetShareInfo(c.name, info), 0);
-    EXPECT_EQ(info.GetName(), c.name);
     EXPECT_EQ(info.GetPath(), c.path);
     EXPECT_EQ(info.GetModulePath(), c.module_path);
     EXPECT_EQ(info.GetModuleName(), c.module);
