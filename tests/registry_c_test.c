@@ -31,9 +31,7 @@ int main(void) {
   if (mkdtemp(root) == NULL) return 1;
   setenv("S2S_ROOT", root, 1);
 
-  CHECK(S2SCheckServerInfo() == 0);
   CHECK(KAROUISetS2S(1, "client-1", "server-1") == 0);
-  CHECK(S2SServerIfOldClientPaired() == 1);
   KSZHASH* share = KLIBCSzHashAlloc(8);
   CHECK(KLIBCSzHashSetValue(share, "RunningID", "client-1") == 0);
   CHECK(S2SServerUpdateShare("docs", share) == 0);
@@ -41,14 +39,12 @@ int main(void) {
   char buf[64];
   CHECK(S2SServerGetShare("docs", "RunningID", buf, sizeof buf) == 8);
   CHECK(strcmp(buf, "client-1") == 0);
-
   CHECK(S2SServerUpdatePairInfo("client-1", "server-1") == S2S_SVR_OK);
   S2S_SVR_STATUS status;
   CHECK(s2s_svr_get_status(&status) == 0);
   CHECK(status.clientID != NULL &&
         strcmp(status.clientID, S2S_MULTI_SRC_MARKER) == 0);
   CHECK(s2s_svr_put_status(&status) == 0);
-  CHECK(s2s_svr_reset_pair() == 0);
 
   KLIBCSzHashFree(share);
   if (nftw(root, RemoveEntry, 16, FTW_DEPTH | FTW_PHYS) != 0) ++failures;
