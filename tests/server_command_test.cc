@@ -41,7 +41,7 @@ TEST(CommandFile, ParsesOrderedLinesAfterCommandAndClient) {
 }
 
 TEST(CommandFile, RefusesMalformedFiles) {
-  const char* const bad[] = {
+  const std::string bad[] = {
       "",
       "command=\"S2S_Pairing\"\n",                              // no client
       "clientID=\"c\"\ncommand=\"S2S_Pairing\"\n",              // wrong order
@@ -49,18 +49,16 @@ TEST(CommandFile, RefusesMalformedFiles) {
       "command=\"S2S_Pairing\"\nclientID=\"c\"\ndryRun=yes\n",  // unquoted
       "command=\"S2S_Pairing\"\nclientID=\"c\"\na=\"1\"\na=\"2\"\n",
       "command=\"S2S_Pairing\"\nclientID=\"c\"\nba d=\"1\"\n",
+      "command=\"x\"\nclientID=\"c\"\nv=\"" +
+          std::string(kMaxCommandFile, 'x') + "\"\n",
   };
-  for (const char* text : bad) {
+  for (const std::string& text : bad) {
     CommandFile cmd;
     std::string why;
-    EXPECT_EQ(kMalformed, ParseCommandFile(text, &cmd, &why)) << text;
+    EXPECT_EQ(kMalformed, ParseCommandFile(text, &cmd, &why))
+        << text.substr(0, 80);
     EXPECT_FALSE(why.empty());
   }
-  std::string huge = "command=\"x\"\nclientID=\"c\"\nv=\"" +
-                     std::string(kMaxCommandFile, 'x') + "\"\n";
-  CommandFile cmd;
-  std::string why;
-  EXPECT_EQ(kMalformed, ParseCommandFile(huge, &cmd, &why));
 }
 
 TEST(CommandFile, IdsThatCouldEscapeAPathAreRefused) {
@@ -150,7 +148,8 @@ class HookTest : public ::testing::Test {
   HookEnv env_;
 };
 
-TEST_F(HookTest, RequestIdOutsideTheReplyDirectoryIsRefused) {
+TEST_F(HookTest, BadRequestsGetAClearStatusAndWriteNothing) {
+  // A request id outside the reply directory gets no reply at all.
   std::string cmd = "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\n";
   for (const char* req : {"s2scmd/../x", "s2scmd/a/b", "s2scmd/", "other/abc",
                           "s2scmd/abc s2scmd/def"}) {
@@ -158,9 +157,7 @@ TEST_F(HookTest, RequestIdOutsideTheReplyDirectoryIsRefused) {
   }
   EXPECT_TRUE(std::filesystem::is_empty(ReplyDir()));
   EXPECT_FALSE(std::filesystem::exists(tmp_.path() + "/x"));
-}
 
-TEST_F(HookTest, BadCommandsGetAClearStatusAndWriteNothing) {
   struct Case {
     std::string text;
     int status;
