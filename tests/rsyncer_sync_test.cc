@@ -127,7 +127,8 @@ TEST_F(RsyncerSyncTest, SubPathWithExcludesThenWholeShareWithDelete) {
   EXPECT_FALSE(fs::exists(s + "/stray"));
 }
 
-TEST_F(RsyncerSyncTest, VanishedPathAndUnknownShareRunNothing) {
+TEST_F(RsyncerSyncTest,
+       VanishedPathUnknownShareAndUnwritableRequestsRunNothing) {
   ASSERT_NO_FATAL_FAILURE(StartShare("docs", app_.Info()));
   // Were anything run now, it would fail to connect.
   app_.StopServer();
@@ -139,6 +140,17 @@ TEST_F(RsyncerSyncTest, VanishedPathAndUnknownShareRunNothing) {
   EXPECT_EQ(-1, r_.RunSync(4, "nope", "/", {}, status));
   EXPECT_EQ(-5, status);
   EXPECT_TRUE(Has(log.Text(), "Fail to get share info of 'nope'\n"));
+  // Requests that cannot be written never reach the server either.
+  EXPECT_EQ(-1, r_.SendBeacon("", status));
+  EXPECT_EQ(-1, r_.FinishSync("share", "", status));
+  EXPECT_EQ(-1, r_.StartSyncShare("nope", status));
+  EXPECT_EQ(-5, status);
+  for (const char* line : {"SendBeacon: Fail to write command file\n",
+                           "FinishSync: Fail to write command file\n",
+                           "StartSyncShare: Fail to write command file\n",
+                           "Fail to start sync share 'nope' with ACL\n"}) {
+    EXPECT_TRUE(Has(log.Text(), line)) << line;
+  }
 }
 
 TEST_F(RsyncerSyncTest, ShareDescriptionIsLookedUpOnce) {
@@ -153,39 +165,6 @@ TEST_F(RsyncerSyncTest, ShareDescriptionIsLookedUpOnce) {
   ASSERT_EQ(0, S2S::GetShareInfo("docs", fresh));
   EXPECT_EQ("/moved/docs", fresh.GetPath());
   EXPECT_EQ(-1, r_.GetShareInfo("nope", fresh));
-}
-
-TEST_F(RsyncerSyncTest, RequestsThatCannotBeWritten) {
-  LogCapture log;
-  int status = -3;
-  EXPECT_EQ(-1, r_.SendBeacon("", status));
-  EXPECT_EQ(-1, r_.FinishSync("share", "", status));
-  EXPECT_EQ(-1, r_.StartSyncShare("nope", status));
-  EXPECT_EQ(-3, status);
-  std::string text = log.Text();
-  EXPECT_TRUE(Has(text, "SendBeacon: Fail to write command file\n"));
-  EXPECT_TRUE(Has(text, "FinishSync: Fail to write command file\n"));
-  EXPECT_TRUE(Has(text, "StartSyncShare: Fail to write command file\n"));
-  EXPECT_TRUE(Has(text, "Fail to start sync share 'nope' with ACL\n"));
-}
-
-// The fallback after 202 runs against a real old server in the pairing tests.
-TEST_F(RsyncerSyncTest, SyncStartDoesNotFallBackOnOtherRefusals) {
-  ASSERT_TRUE(app_.AddShare("docs"));
-  s2s_test::TempDir dir;
-  s2s_test::ScriptedServer server(dir.path());
-  ASSERT_TRUE(server.Start(app_.user(), "scripted-Pw-3"));
-  S2S::SyncInfo info = app_.Info();
-  info.SetPassword("scripted-Pw-3");
-  ASSERT_EQ(0, r_.Initialize(info));
-
-  server.Answer("S2S_SyncStart", 5);
-  int before = server.Count();
-  int status = -1;
-  ASSERT_EQ(0, r_.StartSyncShare("docs", status));
-  EXPECT_EQ(5, status);
-  EXPECT_EQ(before + 1, server.Count());
-  EXPECT_TRUE(Has(server.LastRequest("S2S_SyncStart"), "lenEncKey=\"0\"\n"));
 }
 
 // The /proc entries of the processes whose parent is this test.
@@ -264,10 +243,7 @@ TEST_F(RsyncerSyncTest, CancelStopsALargeTransferPromptly) {
     std::string now = names();
     return now.empty() || now == ".s2s-partial ";
   };
-  for (int i = 0; i < 300 && !settled(); ++i) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  EXPECT_TRUE(settled()) << names();
+  EXPECT_TRUE(s2s_test::WaitUntil(settled, 3)) << names();
 }
 
 }  // namespace

@@ -105,35 +105,27 @@ TEST_F(RsyncerTreeTest, AwkwardNamesLinksModesAndOwners) {
   EXPECT_EQ(Snapshot(c_), Snapshot(s_));
 }
 
-// Runs a command line of the acl tools; true on exit 0.
-bool Shell(const std::string& command) {
-  return system((command + " 2>/dev/null").c_str()) == 0;
-}
-
 TEST_F(RsyncerTreeTest, AclsAndExtendedAttributes) {
   std::string file = c_ + "/acl-file";
   ASSERT_TRUE(WriteFile(file, "guarded"));
   ASSERT_TRUE(fs::create_directories(c_ + "/acl-dir"));
-  if (!Shell("setfacl -m u:12345:r--,g:23456:rw- '" + file + "'") ||
-      !Shell("setfacl -d -m u:12345:rwx '" + c_ + "/acl-dir'")) {
+  if (!s2s_test::RunQuiet({"setfacl", "-m", "u:12345:r--,g:23456:rw-", file}) ||
+      !s2s_test::RunQuiet(
+          {"setfacl", "-d", "-m", "u:12345:rwx", c_ + "/acl-dir"})) {
     GTEST_SKIP() << "the temporary file system refuses ACLs";
   }
   bool xattrs = setxattr(file.c_str(), "user.s2s.note", "kept", 4, 0) == 0;
 
   ASSERT_EQ(0, Push()) << app_.DaemonLog();
-  auto acl = [](const std::string& path, const std::string& flags = "") {
-    std::string out;
-    FILE* p = popen(("getfacl -cp " + flags + " '" + path + "'").c_str(), "r");
-    if (p == nullptr) return out;
-    char buf[256];
-    while (fgets(buf, sizeof buf, p) != nullptr) out += buf;
-    pclose(p);
-    return out;
+  s2s_test::TempDir out;
+  auto acl = [&out](const std::string& path, const char* flags = "-cp") {
+    return s2s_test::RunProgram(out.path(), {"/usr/bin/getfacl", flags, path})
+        .out;
   };
   EXPECT_NE(acl(file).find("user:12345:r--"), std::string::npos);
   EXPECT_EQ(acl(file), acl(s_ + "/acl-file"));
-  EXPECT_EQ(acl(c_ + "/acl-dir", "-d"), acl(s_ + "/acl-dir", "-d"));
-  EXPECT_NE(acl(s_ + "/acl-dir", "-d").find("user:12345:rwx"),
+  EXPECT_EQ(acl(c_ + "/acl-dir", "-cpd"), acl(s_ + "/acl-dir", "-cpd"));
+  EXPECT_NE(acl(s_ + "/acl-dir", "-cpd").find("user:12345:rwx"),
             std::string::npos);
   if (xattrs) {
     char value[16] = {0};

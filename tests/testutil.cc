@@ -118,19 +118,36 @@ void RecordSyslog(int priority, const char* format, va_list ap) {
 
 }  // namespace
 
-pid_t Exec(std::vector<std::string> args, int in, int out) {
-  pid_t pid = fork();
-  if (pid != 0) return pid;
-  if (in >= 0) dup2(in, 0);
-  if (out >= 0) {
-    dup2(out, 1);
-    dup2(out, 2);
+namespace {
+
+// In a forked child: applies `env` (as Spawn takes it), puts `in`, `out` and
+// `err` (-1: inherited) on descriptors 0, 1 and 2 and runs `args`.
+[[noreturn]] void ExecChild(std::vector<std::string> args, int in, int out,
+                            int err, const std::vector<std::string>& env) {
+  for (const std::string& e : env) {
+    if (e.find('=') == std::string::npos) {
+      unsetenv(e.c_str());
+    } else {
+      putenv(strdup(e.c_str()));
+    }
+  }
+  const int fds[] = {in, out, err};
+  for (int i = 0; i < 3; ++i) {
+    if (fds[i] >= 0) dup2(fds[i], i);
   }
   std::vector<char*> argv;
   for (std::string& a : args) argv.push_back(&a[0]);
   argv.push_back(nullptr);
   execvp(argv[0], argv.data());
   _exit(127);
+}
+
+}  // namespace
+
+pid_t Exec(std::vector<std::string> args, int in, int out) {
+  pid_t pid = fork();
+  if (pid == 0) ExecChild(std::move(args), in, out, out, {});
+  return pid;
 }
 
 int Child::Wait(int seconds) {
@@ -157,22 +174,9 @@ Child Spawn(const std::string& dir, const std::vector<std::string>& argv,
   c.err_path = dir + "/err." + std::to_string(serial);
   c.pid = fork();
   if (c.pid == 0) {
-    for (const std::string& e : env) {
-      if (e.find('=') == std::string::npos) {
-        unsetenv(e.c_str());
-      } else {
-        putenv(strdup(e.c_str()));
-      }
-    }
-    int out = open(c.out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    int err = open(c.err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    dup2(out, 1);
-    dup2(err, 2);
-    std::vector<char*> args;
-    for (const std::string& a : argv) args.push_back(strdup(a.c_str()));
-    args.push_back(nullptr);
-    execv(args[0], args.data());
-    _exit(127);
+    ExecChild(
+        argv, -1, open(c.out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600),
+        open(c.err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600), env);
   }
   return c;
 }

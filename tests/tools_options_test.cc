@@ -105,11 +105,8 @@ TEST(ClientOptions, TaskSpecAppliesTheServersNameRules) {
   };
   const Case cases[] = {
       {"t1 ", "docs", "task name 't1 '"},
-      {" t1", "docs", "task name ' t1'"},
-      {"a/b", "docs", "task name"},
       {"t1", std::string("do\0cs", 5), "share name"},
-      {"t1", "docs ", "share name 'docs '"},
-      {"t1", "a=b", "share name"},
+      {"t1", "a=b", "share name 'a=b'"},
   };
   for (const Case& c : cases) {
     TaskSpec spec;
