@@ -207,17 +207,21 @@ TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   const std::string replies = tmp_.Sub("var/spool/s2s/reply");
   std::filesystem::create_directories(replies + "/" + kUser);
   WriteFile(replies + "/" + kUser + "/pending", "status=0\n");
-  WriteFile(tmp_.Sub("cmd"),
-            "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\n"
-            "requestID=\"r\"\n");
-  for (const std::string& path : std::vector<std::string>{
-           "s2scmd/*", "s2scmd/../" + std::string(kUser) + "/pending"}) {
-    Rsync(kOtherUser, kOtherPassword,
-          {"--early-input=" + tmp_.Sub("cmd"), path, tmp_.Sub("empty") + "/"},
-          port);
+  const std::string paths[] = {"s2scmd/*/pending",
+                               "s2scmd/../" + std::string(kUser) + "/pending"};
+  for (const std::string& path : paths) {
+    // Its own command goes through, under a request id of its own.
+    WriteFile(tmp_.Sub("cmd"),
+              "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\n"
+              "requestID=\"r" +
+                  std::to_string(path.size()) + "\"\n");
+    EXPECT_NE(5, Rsync(kOtherUser, kOtherPassword,
+                       {"--early-input=" + tmp_.Sub("cmd"), path,
+                        tmp_.Sub("empty") + "/"},
+                       port))
+        << path;
   }
-  EXPECT_FALSE(std::filesystem::exists(tmp_.Sub("empty/pending")));
-  std::filesystem::remove(tmp_.Sub("empty/r"));
+  EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("empty")));
   std::filesystem::remove(replies + "/" + kUser + "/pending");
   EXPECT_EQ(0, Command("CL1", "S2S_SyncFinish", finish));
   EXPECT_NE(0, Push());
