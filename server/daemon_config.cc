@@ -21,15 +21,14 @@
 namespace S2S {
 namespace server {
 
-namespace {
-
-// rsync runs hook commands through the shell: only plain path characters.
 bool ShellSafe(const std::string& s) {
   for (unsigned char c : s) {
     if (!isalnum(c) && strchr("/._-+", c) == nullptr) return false;
   }
   return true;
 }
+
+namespace {
 
 bool OneLine(const std::string& s) {
   return s.find_first_of("\r\n") == std::string::npos;

@@ -20,6 +20,10 @@
 namespace S2S {
 namespace server {
 
+// Whether `s` holds only characters a hook line may carry unquoted through
+// a shell (letters, digits and "/._-+"): true or false.
+bool ShellSafe(const std::string& s);
+
 struct DaemonConfig {
   // Absolute path of the command handler program the hooks run.
   std::string handler;

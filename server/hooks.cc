@@ -254,7 +254,7 @@ int CommandHook(const HookEnv& env, bool old_server, FILE* in,
     LOG_ERROR("cannot create %s: %s", dir.c_str(), strerror(errno));
     return 1;
   }
-  std::string path = dir + "/" + id;
+  std::string path = ReplyPath(env.user, id);
   if (!WriteNew(path, reply)) {
     LOG_ERROR("cannot write the reply %s: %s", path.c_str(), strerror(errno));
     return 1;

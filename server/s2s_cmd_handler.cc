@@ -9,17 +9,18 @@
 // the daemon runs its hooks through (RSYNC_SHELL): a hook line of its own
 // configuration runs without a shell in between, any other goes to
 // /bin/sh.
-#include <ctype.h>
 #include <limits.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 #include <unistd.h>
 
+#include <sstream>
 #include <string>
 #include <vector>
 
 #include "S2S/logger.h"
+#include "daemon_config.h"
 #include "hooks.h"
 #include "karo_root.h"
 
@@ -54,18 +55,10 @@ const char kHelp[] =
 // very program; otherwise the system's shell runs LINE.
 std::vector<std::string> HookWords(const char* line) {
   std::vector<std::string> words;
-  std::string word;
-  for (const char* p = line;; ++p) {
-    if (*p == ' ' || *p == '\0') {
-      if (!word.empty()) words.push_back(word);
-      word.clear();
-      if (*p == '\0') break;
-    } else if (isalnum(static_cast<unsigned char>(*p)) ||
-               strchr("/._-+", *p) != nullptr) {
-      word += *p;
-    } else {
-      return {};
-    }
+  std::istringstream split(line);
+  for (std::string word; std::getline(split, word, ' ');) {
+    if (!S2S::server::ShellSafe(word)) return {};
+    if (!word.empty()) words.push_back(word);
   }
   if (words.size() < 3 || words[0] != "exec") return {};
   char self[PATH_MAX], named[PATH_MAX];
