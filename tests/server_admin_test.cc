@@ -1,0 +1,143 @@
+// s2s-server's administration without a running daemon: the shares of a
+// root, SSH mode's files, and the words of a refused command line.
+#include <pwd.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <string>
+#include <vector>
+
+#include "gtest/gtest.h"
+#include "testutil.h"
+
+namespace {
+
+using s2s_test::Child;
+using s2s_test::Has;
+using s2s_test::ReadFile;
+
+// A row: the words after "s2s-server --root ROOT", the exit code, and what
+// its output says.
+struct Case {
+  std::vector<std::string> words;
+  int code;
+  std::string says;
+};
+
+void RunCases(const s2s_test::TempDir& tmp, const std::string& root,
+              const std::vector<Case>& cases) {
+  for (const Case& c : cases) {
+    std::vector<std::string> argv = {S2S_SERVER_PROGRAM, "--root", root};
+    argv.insert(argv.end(), c.words.begin(), c.words.end());
+    Child r = s2s_test::RunProgram(tmp.path(), argv, {"S2S_ROOT"});
+    std::string words;
+    for (const std::string& w : c.words) words += w + " ";
+    EXPECT_EQ(c.code, r.code) << words << "\n" << r.out << r.err;
+    EXPECT_TRUE(Has(r.out + r.err, c.says)) << words << "\n" << r.out << r.err;
+  }
+}
+
+// SSH mode for the daemon user "nobody": the user's key may only start the
+// daemon on a configuration the user can run, whose secrets only the user
+// reads; a share added later is handed to the user too. The daemon so
+// started, as that user, serves the modules.
+TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
+  const passwd* nobody = getpwnam("nobody");
+  if (geteuid() != 0 || nobody == nullptr) {
+    GTEST_SKIP() << "needs root and the user nobody";
+  }
+  s2s_test::TempDir tmp;
+  ASSERT_EQ(0, chmod(tmp.path().c_str(), 0755));
+  const std::string root = tmp.Sub("server"), pw = tmp.Sub("password");
+  const std::string key = tmp.Sub("key.pub"), keys = tmp.Sub("ssh/keys");
+  ASSERT_EQ(0, mkdir(tmp.Sub("ssh").c_str(), 0755));
+  ASSERT_TRUE(s2s_test::WriteFile(pw, "pw-ssh-admin\n"));
+  // The hooks run as the user, who may not reach the build tree.
+  const std::string handler = tmp.Sub("s2s-cmd-handler");
+  std::filesystem::copy(S2S_HANDLER_PROGRAM, handler);
+  ASSERT_EQ(0, chmod(pw.c_str(), 0600));
+  const std::string blob = "AAAAC3NzaC1lZDI1NTE5AAAAIBv2";
+  ASSERT_TRUE(s2s_test::WriteFile(key, "ssh-ed25519 " + blob + " me@client\n"));
+  ASSERT_TRUE(s2s_test::WriteFile(keys,
+                                  "ssh-rsa OTHER other@host\n"
+                                  "ssh-ed25519 " +
+                                      blob + " old\n"));
+  const std::string bad = tmp.Sub("bad.pub");
+  ASSERT_TRUE(s2s_test::WriteFile(bad, "not a key\n"));
+  RunCases(
+      tmp, root,
+      {{{"share", "list"}, 1, "no server root at " + root},
+       {{"init", "--share", "docs", "--user", "nobody", "--password-file", pw,
+         "--handler", handler},
+        0,
+        "config: daemon user nobody"},
+       {{"ssh-setup", "--user", "nobody", "--key-file", bad,
+         "--authorized-keys", keys},
+        1,
+        "not an OpenSSH public key"},
+       {{"ssh-setup", "--user", "nobody", "--key-file", tmp.Sub("none"),
+         "--authorized-keys", keys},
+        1,
+        "cannot read the public key"},
+       {{"ssh-setup", "--user", "daemon", "--key-file", key},
+        1,
+        "has no user daemon"},
+       {{"ssh-setup", "--user", "nobody", "--key-file", key,
+         "--authorized-keys", keys},
+        0,
+        "nobody may log in with that key only to run the daemon"},
+       {{"share", "add", "extra", "--encrypted"}, 0, "configuration rewritten"},
+       {{"share", "list"}, 0, root + "/volume1/extra, encrypted"},
+       {{"share", "remove", "nosuch"}, 1, "no share nosuch"},
+       {{"share", "remove", "extra"}, 0, "share: extra removed"},
+       {{"share", "move", "docs"}, 2, "share add NAME[=PATH]"},
+       {{"status", "extra"}, 2, "unexpected arguments to status"},
+       {{"reset-pairing"}, 0, "not bound to one client"},
+       {{"frobnicate"}, 2, "unknown command frobnicate"},
+       {{}, 2, "give a command"},
+       {{"start", "--port", "70000"}, 2, "bad port 70000"},
+       {{"config", "--password", "x"}, 2, "visible to every user"},
+       {{"status", "--no-such-option"}, 2, "unknown or incomplete option"},
+       {{"--version"}, 0, "s2s-server "},
+       {{"--help"}, 0, "ssh-setup --user USER --key-file FILE"}});
+
+  // The old line of the same key was replaced, the other key kept.
+  const std::string conf = root + "/etc/s2s/rsyncd-ssh.conf";
+  EXPECT_EQ(
+      "ssh-rsa OTHER other@host\nrestrict,command=\"rsync --server "
+      "--daemon --config=" +
+          conf + " .\" ssh-ed25519 " + blob + "\n",
+      ReadFile(keys));
+  struct stat st;
+  ASSERT_EQ(0, stat(keys.c_str(), &st));
+  EXPECT_EQ(nobody->pw_uid, st.st_uid);
+  EXPECT_EQ(0600u, st.st_mode & 07777);
+  const std::string secrets = root + "/etc/s2s/rsyncd-ssh.secrets";
+  ASSERT_EQ(0, stat(secrets.c_str(), &st));
+  EXPECT_EQ(nobody->pw_uid, st.st_uid);
+  EXPECT_EQ(0600u, st.st_mode & 07777);
+  EXPECT_EQ("nobody:pw-ssh-admin\n", ReadFile(secrets));
+  ASSERT_EQ(0, stat((root + "/volume1/extra").c_str(), &st));
+  EXPECT_EQ(nobody->pw_uid, st.st_uid) << "the added share stays root's";
+
+  // What the key's forced command runs, as the user, with rsync's remote
+  // shell standing in for the SSH login: a command and its reply.
+  const std::string shell = tmp.Sub("login"), command = tmp.Sub("command");
+  ASSERT_TRUE(s2s_test::WriteScript(
+      shell, "exec setpriv --reuid=" + std::to_string(nobody->pw_uid) +
+                 " --regid=" + std::to_string(nobody->pw_gid) +
+                 " --clear-groups rsync --server --daemon --config=" + conf +
+                 " .\n"));
+  ASSERT_TRUE(
+      s2s_test::WriteFile(command,
+                          "command=\"S2S_GetProtocolVer\"\nclientID=\"C1\"\n"
+                          "outfile=\"/v\"\nrequestID=\"r1\"\n"));
+  Child pull = s2s_test::RunProgram(
+      tmp.path(), {"rsync", "-e", shell, "--password-file", pw, "--early-input",
+                   command, "nobody@localhost::s2scmd/r1", tmp.path() + "/"});
+  EXPECT_EQ(0, pull.code) << pull.out << pull.err;
+  EXPECT_EQ("status=0\n1", ReadFile(tmp.Sub("r1")).substr(0, 10));
+}
+
+}  // namespace
