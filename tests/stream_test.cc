@@ -4,9 +4,7 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <string>
-#include <thread>
 
 #include "S2S/result_codes.h"
 #include "testutil.h"
@@ -179,27 +177,6 @@ TEST(PStreamTest, MalformedOrTooDeepInputIsAProtocolError) {
   // a shorter string.
   PObject cut;
   EXPECT_EQ(Wire().Decode(Bytes({0x10, 0, 5, 'a', 'b'}), cut), S2S::kIOError);
-}
-
-// Another thread may read the status while messages are encoded.
-TEST(PStreamTest, StatusIsReadableDuringEncoding) {
-  Wire w;
-  ASSERT_TRUE(w.ok);
-  std::atomic<bool> done{false};
-  std::thread reader([&] {
-    std::string h;
-    unsigned long long f, s;
-    while (!done) w.stream.GetStatus(h, f, s);
-  });
-  PObject msg;
-  msg["a"]["b"] = "c";
-  for (int i = 0; i < 200; ++i) {
-    w.stream.UpdateStatus(i % 3, 0);
-    ASSERT_EQ(w.stream.Send(w.ch, msg), 0);
-    w.Drain();
-  }
-  done = true;
-  reader.join();
 }
 
 }  // namespace
