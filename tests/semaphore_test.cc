@@ -5,16 +5,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <string>
-#include <vector>
-
 #include "karo_err.h"
 #include "karo_section.h"
-#include "testutil.h"
 
 namespace {
-
-using s2s_test::ReadFile;
 
 // Each test process uses a key of its own and removes the set afterwards, so
 // parallel tests never share a lock.
@@ -26,43 +20,6 @@ class SemaphoreTest : public ::testing::Test {
   }
   const int key_ = 0x53320000 | (getpid() & 0xffff);
 };
-
-TEST_F(SemaphoreTest, ProcessesThatCreateTheSetAtOnceLoseNoUpdate) {
-  const int kProcs = 8, kUpdates = 200;
-  s2s_test::TempDir dir;
-  const std::string file = dir.Sub("counter");
-  int go[2];
-  ASSERT_EQ(pipe(go), 0);
-  std::vector<pid_t> pids;
-  for (int p = 0; p < kProcs; ++p) {
-    pid_t pid = fork();
-    ASSERT_GE(pid, 0);
-    if (pid == 0) {
-      close(go[1]);
-      char c;
-      int sem = read(go[0], &c, 1) == 0 ? KLIBCSemOpen(key_) : -1;
-      for (int i = 0; sem >= 0 && i < kUpdates; ++i) {
-        // Read, increment, write back: only the lock keeps updates whole.
-        if (KLIBCSemLock(sem) != 0) _exit(3);
-        int n = atoi(ReadFile(file).c_str());
-        if (!s2s_test::WriteFile(file, std::to_string(n + 1)) ||
-            KLIBCSemUnlock(sem) != 0) {
-          _exit(4);
-        }
-      }
-      _exit(sem >= 0 && KLIBCSemClose(sem) == 0 ? 0 : 5);
-    }
-    pids.push_back(pid);
-  }
-  close(go[0]);
-  close(go[1]);  // all children race to create the set
-  for (pid_t pid : pids) {
-    int status;
-    ASSERT_EQ(waitpid(pid, &status, 0), pid);
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
-  }
-  EXPECT_EQ(ReadFile(file), std::to_string(kProcs * kUpdates));
-}
 
 // Whether it was taken with or without a deadline.
 TEST_F(SemaphoreTest, HolderKilledGivesTheLockBack) {
