@@ -176,9 +176,6 @@ TEST(SyncTaskMapping, TaskBecomesAMapAndIsRebuiltEqual) {
   EXPECT_EQ(map["schedule_mode"].asInt32(), 2);
   EXPECT_EQ(map["period_hour"].asInt32(), 1);
   EXPECT_EQ(map["period_minute"].asInt32(), 30);
-  EXPECT_EQ(map["compress"].asUInt64(), 1u);
-  EXPECT_EQ(map["ssh"].asUInt64(), 0u);
-  EXPECT_EQ(map["share_list"].asArray().size(), 3u);
   SyncTask back;
   S2S::PObj2SyncTask(map, back);
   EXPECT_EQ(back.GetInfo().GetSchedule().GetPeriodSeconds(), 5400);
