@@ -7,6 +7,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <climits>
 #include <new>
 #include <random>
 #include <string>
@@ -225,7 +226,6 @@ TEST(ChannelTest, StalledPeerTimesOutAndTheFlagStopsAWait) {
   EXPECT_EQ(c, 'q');
 }
 
-// Unix-domain clients are opened by the IPC tests.
 TEST(ChannelTest, OpensTcpClientsAndReopensAfterClose) {
   LogCapture log(4);
   Channel ch(128);
@@ -257,6 +257,19 @@ TEST(ChannelTest, OpensTcpClientsAndReopensAfterClose) {
     close(peer);
   }
   close(lfd);
+}
+
+TEST(ResultMessage, EveryCodeHasItsTextAsWrittenAndOutsidersAreUnknown) {
+  EXPECT_STREQ(S2S::ResultMessage(0), "Successful");
+  EXPECT_STREQ(S2S::ResultMessage(-5), "Protocal error");
+  EXPECT_STREQ(S2S::ResultMessage(-19), "no permission ");
+  EXPECT_STREQ(S2S::ResultMessage(-25), "permission is read-only");
+  for (int r = 0; r > -S2S::kResultCodeCount; --r) {
+    EXPECT_STRNE(S2S::ResultMessage(r), "Unknown error") << r;
+  }
+  for (int r : {-S2S::kResultCodeCount, 1, INT_MIN, INT_MAX}) {
+    EXPECT_STREQ(S2S::ResultMessage(r), "Unknown error") << r;
+  }
 }
 
 }  // namespace
