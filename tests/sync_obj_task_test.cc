@@ -144,18 +144,11 @@ TEST(TaskInfo, ValidateChecksInOrderAndEveryShareMustBeSyncable) {
 }
 
 TEST(SyncTaskDump, ScheduleWithItsLastRunAndTaskWithoutPassword) {
-  S2S::Schedule s;
-  s.SetMode(S2S::SCHD_MONTHLY);
-  s.SetStartHour(8);
-  s.SetStartMinute(5);
-  s.SetPeriod(5430);
-  s.SetRepeatTimesInDay(2);
-  s.SetBeginDay(9);
   // What the dump works out rather than copies.
-  std::string text = Dump(s);
-  EXPECT_TRUE(Has(text, "schedule_begin: ...... 2014-01-09 08:05:00\n"));
+  std::string text = Dump(FullTask().GetInfo().GetSchedule());
+  EXPECT_TRUE(Has(text, "schedule_begin: ...... 2024-02-29 08:05:00\n"));
   EXPECT_TRUE(Has(text, "period: .............. 01:30\n"));
-  EXPECT_TRUE(Has(text, "last sync in day: .... 11:06\n"));
+  EXPECT_TRUE(Has(text, "last sync in day: .... 12:36\n"));
 
   std::string dump = Dump(FullTask());
   EXPECT_TRUE(Has(dump,
