@@ -109,29 +109,4 @@ TEST(IPCTest, RefusedPathsAndIdleListener) {
   EXPECT_EQ(listener.isReady(), 0);
 }
 
-TEST(IPCTest, PeerGoingAwayBeforeTheReply) {
-  LogCapture log(3);
-  TempDir dir;
-  IPCListener listener;
-  ASSERT_EQ(listener.prepare(dir.Sub("s")), 0);
-  std::thread server([&] {
-    ASSERT_EQ(listener.isReady(), 1);
-    IPCSender end;
-    ASSERT_EQ(end.assign(listener.accept()), 0);
-    PObject req;
-    ASSERT_EQ(end.recv(req), 0);  // first request: no reply wanted
-    ASSERT_EQ(end.recv(req), 0);  // second: hang up instead of answering
-  });
-  IPCSender client;
-  client.channel().SetTimeout(2);
-  ASSERT_EQ(client.connect(dir.Sub("s")), 0);
-  PObject req, reply;
-  req["n"] = 1ull;
-  EXPECT_EQ(client.send(req, false, reply), 0);
-  EXPECT_TRUE(reply.isNull());  // nothing was read
-  EXPECT_EQ(client.send(req, true, reply), -1);
-  server.join();
-  EXPECT_TRUE(Has(log.Text(), "Error stack: "));
-}
-
 }  // namespace

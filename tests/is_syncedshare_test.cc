@@ -100,9 +100,7 @@ TEST_F(RegistryTest, RecordsAreReplacedWholeAndNamesFromTheNetworkChecked) {
   syslog_.Clear();
   EXPECT_EQ(S2SUpdateServerInfo("C]", a), -1);
   EXPECT_EQ(S2SUpdateServerInfo(nullptr, a), -1);
-  EXPECT_EQ(S2SServerUpdateShare("", a), -1);
   EXPECT_EQ(S2SServerUpdateShare("x]\n[PairedClientInfo", a), -1);
-  EXPECT_EQ(S2SServerUpdateTask("t\n", a), -1);
   EXPECT_EQ(ReadFile(File()), before);
   EXPECT_EQ(syslog_.Messages()[1],
             "Set section [C] ] value into [" + File() + "] error.");

@@ -8,12 +8,6 @@ namespace {
 
 using S2S::PObject;
 
-PObject Int(int v) {
-  PObject o;
-  o = v;
-  return o;
-}
-
 // Reading a value as any kind never fails; these are the answers.
 TEST(PObject, EveryKindThroughEveryView) {
   PObject empty_array, array_of_null, empty_map;
@@ -27,7 +21,7 @@ TEST(PObject, EveryKindThroughEveryView) {
     const char *as_string, *rendered;
   } cases[] = {
       {PObject(), 0, true, false, "", "null"},
-      {Int(0), 3, false, false, "0", "0"},  // an integer is never empty
+      {PObject(0ull), 3, false, false, "0", "0"},  // an integer is never empty
       // A string of an integer holds its low 32 bits only.
       {PObject(4294967297ull), 3, false, true, "1", "4294967297"},
       {PObject(""), 4, true, false, "", "\"\""},
@@ -50,7 +44,8 @@ TEST(PObject, EveryKindThroughEveryView) {
 }
 
 TEST(PObject, IntegersAreSixtyFourBitsSeenThroughNarrowerViews) {
-  PObject o = Int(-1);  // sign-extended
+  PObject o;
+  o = -1;  // sign-extended
   EXPECT_EQ(o.asUInt64(), 18446744073709551615ull);
   EXPECT_EQ(o.asInt32(), -1);
   EXPECT_EQ(o.asUInt16(), 65535);
@@ -63,7 +58,7 @@ TEST(PObject, IntegersAreSixtyFourBitsSeenThroughNarrowerViews) {
 // Const views of another kind hand out the shared empties and leave the
 // value alone; non-const views replace it.
 TEST(PObject, ConstViewsReadAndNonConstViewsReplace) {
-  PObject o = Int(7);
+  PObject o(7ull);
   const PObject& c = o;
   EXPECT_EQ(&c.asMap(), &PObject::GetEmptyMap());
   EXPECT_EQ(&c.asArray(), &PObject::GetEmptyArray());
