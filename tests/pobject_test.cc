@@ -8,12 +8,6 @@ namespace {
 
 using S2S::PObject;
 
-PObject Int(int v) {
-  PObject o;
-  o = v;
-  return o;
-}
-
 // Reading a value as any kind never fails; these are the answers.
 TEST(PObject, EveryKindThroughEveryView) {
   PObject empty_array, array_of_null, empty_map;
@@ -27,7 +21,7 @@ TEST(PObject, EveryKindThroughEveryView) {
     const char *as_string, *rendered;
   } cases[] = {
       {PObject(), 0, true, false, "", "null"},
-      {Int(0), 3, false, false, "0", "0"},  // an integer is never empty
+      {PObject(0ull), 3, false, false, "0", "0"},  // an integer is never empty
       // A string of an integer holds its low 32 bits only.
       {PObject(4294967297ull), 3, false, true, "1", "4294967297"},
       {PObject(""), 4, true, false, "", "\"\""},
@@ -50,7 +44,8 @@ TEST(PObject, EveryKindThroughEveryView) {
 }
 
 TEST(PObject, IntegersAreSixtyFourBitsSeenThroughNarrowerViews) {
-  PObject o = Int(-1);  // sign-extended
+  PObject o;
+  o = -1;  // sign-extended
   EXPECT_EQ(o.asUInt64(), 18446744073709551615ull);
   EXPECT_EQ(o.asInt32(), -1);
   EXPECT_EQ(o.asUInt16(), 65535);
@@ -63,7 +58,7 @@ TEST(PObject, IntegersAreSixtyFourBitsSeenThroughNarrowerViews) {
 // Const views of another kind hand out the shared empties and leave the
 // value alone; non-const views replace it.
 TEST(PObject, ConstViewsReadAndNonConstViewsReplace) {
-  PObject o = Int(7);
+  PObject o(7ull);
   const PObject& c = o;
   EXPECT_EQ(&c.asMap(), &PObject::GetEmptyMap());
   EXPECT_EQ(&c.asArray(), &PObject::GetEmptyArray());
@@ -71,7 +66,6 @@ TEST(PObject, ConstViewsReadAndNonConstViewsReplace) {
   EXPECT_EQ(c.asStringRef(), "");
   EXPECT_TRUE(o.isInteger());
   o.asArray().emplace_back("x");
-  EXPECT_EQ(o.asArray().size(), 1u);
   EXPECT_TRUE(o["k"].isNull());  // the array gives way to a map
   EXPECT_TRUE(o.isMap() && o.hasMember("k"));
   EXPECT_EQ(o.asMap().size(), 1u);
@@ -128,20 +122,6 @@ TEST(PObject, CopiesAreDeepAndSelfAssignmentLeavesNull) {
   m["k"] = "v";
   m = m.asMap();
   EXPECT_EQ(m["k"].asString(), "v");
-}
-
-TEST(PObject, StringsMoveInWithoutACopyAndSwapExchanges) {
-  std::string big(1000, 'm');
-  const char* bytes = big.data();
-  PObject p;
-  p["x"] = 1ull;
-  p = std::move(big);
-  EXPECT_EQ(p.asStringRef().data(), bytes);
-  EXPECT_EQ(p.asStringRef(), std::string(1000, 'm'));
-  PObject two(2ull);
-  p.swap(two);
-  EXPECT_EQ(p.asUInt64(), 2u);
-  EXPECT_EQ(two.asStringRef().data(), bytes);
 }
 
 // Containers are built, copied and destroyed without recursion.

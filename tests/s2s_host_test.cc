@@ -4,8 +4,6 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <regex>
-
 #include "karo_err.h"
 #include "karo_net.h"
 #include "karo_process.h"
@@ -53,21 +51,16 @@ TEST_F(HostTest, ClientIdIsTheSerialElseAMacAddress) {
   EXPECT_TRUE(Has(log.Text(), "Fail to get ha sn and mac\n"));
 
   // A single appliance without a serial: the first interface's address, in
-  // lower case.
+  // lower case ("" on a machine without one).
   ASSERT_TRUE(Platform("\tserial=\"\"\n"));
   KARO_NETIF nic[1];
-  int n = KLIBNetGetInterfaceInfo(nic, 1, KARO_NETIF_SKIP_LOOPBACK);
-  std::string id = S2S::GetClientID();
-  if (n < 1) {
-    EXPECT_EQ(id, "");
-  } else {
-    EXPECT_TRUE(
-        std::regex_match(id, std::regex("([0-9a-f]{2}:){5}[0-9a-f]{2}")))
-        << id;
-    char first[3];
-    snprintf(first, sizeof first, "%02x", nic[0].mac[0]);
-    EXPECT_EQ(id.substr(0, 2), first);
+  char mac[18] = "";
+  if (KLIBNetGetInterfaceInfo(nic, 1, KARO_NETIF_SKIP_LOOPBACK) == 1) {
+    const unsigned char* m = nic[0].mac;
+    snprintf(mac, sizeof mac, "%02x:%02x:%02x:%02x:%02x:%02x", m[0], m[1], m[2],
+             m[3], m[4], m[5]);
   }
+  EXPECT_EQ(S2S::GetClientID(), mac);
 }
 
 TEST_F(HostTest, TempFilesLiveUnderTheRoot) {

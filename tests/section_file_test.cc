@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/ipc.h>
+#include <sys/sem.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <time.h>
@@ -249,6 +251,93 @@ TEST_F(SectionFileTest, WriterKilledAtRandomLeavesAParsableFile) {
       ASSERT_EQ(Value(s.c_str(), "key19"), std::string(200, first[0])) << s;
     }
   }
+}
+
+TEST(StringHash, KeepsInsertionOrderAndHonoursCapacity) {
+  KSZHASH* h = KLIBCSzHashAlloc(2);
+  ASSERT_NE(h, nullptr);
+  EXPECT_EQ(KLIBCSzHashSetValue(h, "b", "1"), 0);
+  EXPECT_EQ(KLIBCSzHashSetValue(h, "a", "2"), 0);
+  EXPECT_EQ(KLIBCSzHashSetValue(h, "b", "3"), 0);  // replaced in place
+  EXPECT_EQ(KLIBCSzHashSetValue(h, "c", "4"), -1);
+  EXPECT_EQ(KLIBCErrGet(), KERR_NO_MEMORY);
+  EXPECT_STREQ(KLIBCSzHashKeyAt(h, 0), "b");
+  EXPECT_STREQ(KLIBCSzHashValueAt(h, 0), "3");
+  EXPECT_EQ(KLIBCSzHashKeyAt(h, 2), nullptr);
+  EXPECT_EQ(KLIBCSzHashGetValue(h, "c"), nullptr);
+  EXPECT_EQ(KLIBCErrGet(), KERR_NOT_FOUND);
+  EXPECT_EQ(KLIBCSzHashRemove(h, "b"), 0);
+  EXPECT_EQ(KLIBCSzHashRemove(h, "b"), -1);
+  EXPECT_STREQ(KLIBCSzHashGetValue(h, "a"), "2");
+  KLIBCSzHashClear(h);
+  EXPECT_EQ(KLIBCSzHashCount(h), 0);
+  KLIBCSzHashFree(h);
+  EXPECT_EQ(KLIBCSzHashAlloc(0), nullptr);
+  EXPECT_EQ(KLIBCErrGet(), KERR_INVALID_ARG);
+}
+
+TEST(StringListAndString, CopiesInOrderAndFormats) {
+  KSZLIST* l = KLIBCSzListAlloc();
+  char s[] = "one";
+  EXPECT_EQ(KLIBCSzListPush(l, s), 0);
+  s[0] = 'X';
+  EXPECT_EQ(KLIBCSzListPush(l, "two"), 0);
+  EXPECT_EQ(KLIBCSzListPush(l, nullptr), -1);
+  EXPECT_EQ(KLIBCSzListCount(l), 2);
+  EXPECT_STREQ(KLIBCSzListGet(l, 0), "one");
+  EXPECT_EQ(KLIBCSzListGet(l, 2), nullptr);
+  KLIBCSzListFree(l);
+  char* f = KLIBCStrGet("SHARE_%s_%d", "a", 7);
+  EXPECT_STREQ(f, "SHARE_a_7");
+  KLIBCStrPut(f);
+  KLIBCStrPut(nullptr);
+}
+
+// Each test process uses a key of its own and removes the set afterwards, so
+// parallel tests never share a lock.
+class SemaphoreTest : public ::testing::Test {
+ protected:
+  void TearDown() override {
+    int id = semget(key_, 1, 0);
+    if (id >= 0) semctl(id, 0, IPC_RMID);
+  }
+  const int key_ = 0x53320000 | (getpid() & 0xffff);
+};
+
+// Whether it was taken with or without a deadline.
+TEST_F(SemaphoreTest, HolderKilledGivesTheLockBack) {
+  for (bool timed : {false, true}) {
+    int held[2];
+    ASSERT_EQ(pipe(held), 0);
+    pid_t pid = fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+      int sem = KLIBCSemOpen(key_);
+      if (sem < 0 ||
+          (timed ? KLIBCSemLockTimed(sem, 1000) : KLIBCSemLock(sem)) != 0 ||
+          write(held[1], "x", 1) != 1) {
+        _exit(1);
+      }
+      pause();
+      _exit(0);
+    }
+    char c;
+    ASSERT_EQ(read(held[0], &c, 1), 1);
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+    close(held[0]);
+    close(held[1]);
+    int sem = KLIBCSemOpen(key_);
+    ASSERT_GE(sem, 0);
+    EXPECT_EQ(KLIBCSemLockTimed(sem, 1000), 0) << timed;
+    EXPECT_EQ(semctl(sem, 0, GETVAL), 0);
+    EXPECT_EQ(KLIBCSemUnlock(sem), 0);
+    EXPECT_EQ(semctl(sem, 0, GETVAL), 1);
+    EXPECT_EQ(KLIBCSemClose(sem), 0);
+  }
+  EXPECT_EQ(KLIBCSemOpen(IPC_PRIVATE), -1);
+  EXPECT_EQ(KLIBCErrGet(), KERR_LOCK);
+  EXPECT_EQ(KLIBCSemClose(-1), -1);
 }
 
 }  // namespace
