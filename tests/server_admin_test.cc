@@ -83,6 +83,13 @@ TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
        {{"ssh-setup", "--user", "daemon", "--key-file", key},
         1,
         "has no user daemon"},
+       // SSH mode never logs in as root, and only as the daemon user.
+       {{"ssh-setup", "--user", "root", "--key-file", key},
+        1,
+        "may not be root"},
+       {{"ssh-setup", "--user", "s2s-no-such-user", "--key-file", key},
+        1,
+        "no system user s2s-no-such-user"},
        {{"ssh-setup", "--user", "nobody", "--key-file", key,
          "--authorized-keys", keys},
         0,

@@ -461,14 +461,6 @@ TEST_F(ToolsTest, SyncsAShareAndOperatorCommandsOnARunningServer) {
       {{"status"}, 3, "daemon:   not running"},
       {{"status", "--json"}, 3, "\"daemon\": {\"running\": false"},
       {{"pairings", "--json"}, 3, "\"SHARE_extra\": {"},
-      {{"--root", tmp_.Sub("none"), "status"}, 1, "no server root"},
-      // SSH mode never logs in as root, and only as the daemon user.
-      {{"ssh-setup", "--user", "root", "--key-file", pw_file_},
-       1,
-       "may not be root"},
-      {{"ssh-setup", "--user", "s2s-no-such-user", "--key-file", pw_file_},
-       1,
-       "no system user s2s-no-such-user"},
       {{"start"}, 0, "daemon: pid"},
   };
   for (const Case& c : cases) {
