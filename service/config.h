@@ -26,6 +26,8 @@ struct DaemonConfig {
   // that tests reach them (s2sd's options, not the settings file); 0 none.
   size_t watch_queue_limit = 0;
   size_t watch_limit = 0;
+  // Milliseconds between looks at the realtime shares' directories.
+  unsigned int watch_check_ms = 2000;
 };
 
 // Reads the settings file (a missing file means the defaults). True, or

@@ -61,6 +61,7 @@ void Daemon::StartWatching(unsigned long long id) {
   WatchLimits limits;
   limits.queue = config_.watch_queue_limit;
   limits.watches = config_.watch_limit;
+  limits.check_every = config_.watch_check_ms / 1000.0;
   rt.watcher.reset(new Watcher(id, task, limits));
   rt.watcher->Start(clock_.MonotonicSeconds());
   rt.session.reset(new RealtimeSession(

@@ -36,6 +36,10 @@ struct WatchLimits {
   size_t queue = 0;
   // inotify watches of one source.
   size_t watches = 0;
+  // Seconds between looks at the shares' directories: an unmount is not
+  // reported by a file system mark, and a share that is back is watched
+  // again at the next look.
+  double check_every = 2;
 };
 
 struct WatchedShare {

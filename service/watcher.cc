@@ -13,9 +13,6 @@ namespace {
 
 using S2S::PObject;
 
-// Seconds between looks at the shares' directories: an unmount is not
-// reported by a file system mark.
-const double kCheckEvery = 2;
 // Full syncs while some directories are not watched.
 const double kDegradedFull = 300;
 const double kMaxBackoff = 60;
@@ -124,7 +121,7 @@ bool Watcher::Start(double now) {
       std::string("watching ") + std::to_string(shares_.size()) +
           " shares with " + source_->Name() +
           (source_note_.empty() ? "" : " (fanotify: " + source_note_ + ")"));
-  next_check_ = now + kCheckEvery;
+  next_check_ = now + limits_.check_every;
   next_full_ = now + FullInterval();
   return true;
 }
@@ -180,7 +177,7 @@ void Watcher::FullSync(double now) {
 void Watcher::Tick(double now) {
   if (source_ == nullptr) return;
   if (now >= next_check_) {
-    next_check_ = now + kCheckEvery;
+    next_check_ = now + limits_.check_every;
     for (Share& share : shares_) {
       struct stat st;
       if (!share.watching) {

@@ -10,61 +10,18 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <list>
 #include <string>
 #include <vector>
 
 #include "S2S/ipc.h"
+#include "S2S/sync_obj_pobject.h"
 #include "appliances.h"
 #include "gtest/gtest.h"
 #include "service/config.h"
 #include "testutil.h"
 
 namespace s2s_test {
-
-class S2sdProcess {
- public:
-  ~S2sdProcess() { Stop(); }
-
-  // Starts s2sd in the foreground, verbose, logging to `log`, with `bin`
-  // first in PATH and `args` added; true once it answers on its socket.
-  bool Start(const std::string& dir, const std::string& bin,
-             const std::string& log, const std::vector<std::string>& args) {
-    unlink(s2s_service::SocketPath().c_str());
-    std::vector<std::string> argv = {S2SD_PROGRAM, "--foreground", "--log", log,
-                                     "-v"};
-    argv.insert(argv.end(), args.begin(), args.end());
-    child_ = Spawn(dir, argv, {"PATH=" + bin + ":" + getenv("PATH")});
-    S2S::PObject status;
-    status = S2S::PObject::Map();
-    status["action"] = "status";
-    return WaitUntil([&] { return Request(status)["result"].isInteger(); }, 10);
-  }
-
-  // SIGTERM, and its exit code (-1 when it was not running).
-  int Stop() {
-    if (child_.pid <= 0) return -1;
-    kill(child_.pid, SIGTERM);
-    int code = child_.Wait();
-    child_.pid = -1;
-    return code;
-  }
-
-  pid_t pid() const { return child_.pid; }
-
-  // The reply to `request`; a null object when s2sd did not answer.
-  static S2S::PObject Request(const S2S::PObject& request) {
-    S2S::IPCSender sender;
-    S2S::PObject reply;
-    if (sender.connect(s2s_service::SocketPath()) == 0) {
-      sender.send(request, true, reply);
-    }
-    sender.close();
-    return reply;
-  }
-
- private:
-  Child child_;
-};
 
 // A running server appliance with `shares`, and s2sd's client root beside
 // it: s2sd finds an rsync first in PATH that notes each run in rsync_log_
@@ -73,6 +30,7 @@ class S2sdProcess {
 class S2sdTest : public ::testing::Test {
  protected:
   S2sdTest() : app_(S2S_CMD_HANDLER) {}
+  ~S2sdTest() override { StopDaemon(); }
 
   void SetUpServer(const std::vector<std::string>& shares,
                    const std::string& config) {
@@ -92,17 +50,80 @@ class S2sdTest : public ::testing::Test {
                           "[Service]\n\tbeacon_interval=\"3600\"\n" + config));
   }
 
-  // Starts s2sd with `args`; fails the test unless it answers.
+  // Starts s2sd in the foreground, verbose, logging to a file, with `args`
+  // added; fails the test unless it answers on its socket.
   void StartDaemon(const std::vector<std::string>& args = {}) {
-    ASSERT_TRUE(s2sd_.Start(tmp_.path(), bin_, tmp_.Sub("s2sd.log"), args))
+    unlink(s2s_service::SocketPath().c_str());
+    std::vector<std::string> argv = {S2SD_PROGRAM, "--foreground", "--log",
+                                     tmp_.Sub("s2sd.log"), "-v"};
+    argv.insert(argv.end(), args.begin(), args.end());
+    daemon_ = Spawn(tmp_.path(), argv, {"PATH=" + bin_ + ":" + getenv("PATH")});
+    S2S::PObject status;
+    status["action"] = "status";
+    ASSERT_TRUE(
+        WaitUntil([&] { return Request(status)["result"].isInteger(); }, 10))
         << Log();
+  }
+
+  // SIGTERM, and s2sd's exit code (-1 when it was not running).
+  int StopDaemon() {
+    if (daemon_.pid <= 0) return -1;
+    kill(daemon_.pid, SIGTERM);
+    int code = daemon_.Wait();
+    daemon_.pid = -1;
+    return code;
+  }
+
+  // The reply to `request`; a null object when s2sd did not answer.
+  static S2S::PObject Request(const S2S::PObject& request) {
+    S2S::IPCSender sender;
+    S2S::PObject reply;
+    if (sender.connect(s2s_service::SocketPath()) == 0) {
+      sender.send(request, true, reply);
+    }
+    sender.close();
+    return reply;
   }
 
   std::string Log() { return ReadFile(tmp_.Sub("s2sd.log")); }
 
+  // Adds a task over `shares` of the test's server, with the task keys in
+  // `settings` beside; its id.
+  unsigned long long AddTask(const std::string& name,
+                             const std::list<std::string>& shares,
+                             const S2S::Schedule& schedule,
+                             const S2S::PObject& settings = S2S::PObject()) {
+    S2S::SyncTask t;
+    t.GetInfo().SetName(name);
+    t.GetInfo().SetShareList(shares);
+    t.GetInfo().SetSyncInfo(app_.Info());
+    t.GetInfo().SetSchedule(schedule);
+    S2S::PObject req;
+    req["action"] = "add";
+    S2S::SyncTask2PObj(t, req["task"]);
+    req["task"].asMap().erase("id");
+    if (settings.isMap()) {
+      for (const auto& it : settings.asMap()) req["task"][it.first] = it.second;
+    }
+    S2S::PObject reply = Request(req);
+    EXPECT_EQ(0u, reply["result"].asUInt64()) << reply["message"].asString();
+    return reply["id"].asUInt64();
+  }
+
+  // How many times `what` occurs in the recording rsync's log.
+  size_t RsyncLogCount(const std::string& what) {
+    std::string log = ReadFile(rsync_log_);
+    size_t n = 0;
+    for (size_t at = log.find(what); at != std::string::npos;
+         at = log.find(what, at + 1)) {
+      ++n;
+    }
+    return n;
+  }
+
   Appliances app_;
   TempDir tmp_;
-  S2sdProcess s2sd_;
+  Child daemon_;
   std::string bin_, rsync_log_, unreachable_;
 };
 

@@ -22,6 +22,7 @@
 #include "ctl_task.h"
 #include "gtest/gtest.h"
 #include "json_writer.h"
+#include "s2sd_process.h"
 #include "testutil.h"
 
 namespace {
@@ -143,15 +144,20 @@ TEST(CtlOptions, AddTakesTheTaskFileUnderTheOptionsAndAPrivatePassword) {
       << error;
   S2S::PObject map;
   ASSERT_TRUE(BuildTaskMap(o, true, map, note, error)) << error;
-  EXPECT_EQ("nightly", map["name"].asString());
-  EXPECT_EQ("other", map["user"].asString());  // the option wins
-  EXPECT_EQ("pw1", map["pswd"].asString());
-  EXPECT_EQ(2u, map["share_list"].asArray().size());
-  EXPECT_EQ("*.tmp", map["excludes"].asArray()[0].asString());
-  EXPECT_TRUE(map["compress"].asBool());
-  EXPECT_EQ(2, map["schedule_mode"].asInt32());
-  EXPECT_FALSE(map.hasMember("id"));  // the daemon picks one
-  EXPECT_FALSE(map.hasMember("port"));
+  // The option wins over the file; no port (the daemon's own) and no id
+  // (the daemon picks one).
+  EXPECT_EQ(
+      "{\"block\":0,\"compress\":1,\"delete_guard\":1,"
+      "\"delete_guard_files\":10000,\"delete_guard_percent\":50,"
+      "\"excludes\":[\"*.tmp\"],\"max_bandwidth\":0,\"name\":\"nightly\","
+      "\"period_hour\":0,\"period_minute\":0,\"pswd\":\"pw1\","
+      "\"repeat_times_in_day\":0,\"schedule_begin_day\":1,"
+      "\"schedule_begin_hour\":0,\"schedule_begin_min\":0,"
+      "\"schedule_begin_month\":1,\"schedule_begin_year\":2014,"
+      "\"schedule_mode\":2,\"server_ip\":\"127.0.0.1\",\"server_name\":\"\","
+      "\"share_list\":[\"docs\",\"photos\"],\"ssh\":0,\"ssh_port\":0,"
+      "\"user\":\"other\",\"week_schd\":\"1111111\"}",
+      ToJson(map, false));
   EXPECT_TRUE(s2s_test::Has(note, "S2S_RSYNC_PORT"));
 
   // An edit sends what the file describes, never the schedule it cannot
@@ -180,42 +186,19 @@ std::string Str(const std::string& s) {
          static_cast<char>(s.size() & 0xFF) + s;
 }
 
-class ServiceControlTest : public ::testing::Test {
+// A request for `action` on task `id` (none when null).
+S2S::PObject Req(const char* action, S2S::PObject id = S2S::PObject()) {
+  S2S::PObject r;
+  r["action"] = action;
+  if (!id.isNull()) r["id"] = id;
+  return r;
+}
+
+class ServiceControlTest : public s2s_test::S2sdTest {
  protected:
   void SetUp() override {
-    ASSERT_TRUE(apps_.AddShare("docs"));
-    ASSERT_TRUE(apps_.StartServer());
-    ASSERT_TRUE(StartDaemon());
-  }
-
-  void TearDown() override {
-    if (pid_ > 0) {
-      kill(pid_, SIGTERM);
-      waitpid(pid_, nullptr, 0);
-    }
-  }
-
-  // s2sd in the foreground on the client root, logging to a file; ready
-  // once it answers "status".
-  bool StartDaemon() {
-    s2s_test::Child d =
-        s2s_test::Spawn(tmp_.path(), {S2SD_PROGRAM, "--foreground", "--root",
-                                      apps_.client_root(), "--log", "stderr"});
-    pid_ = d.pid;
-    log_ = d.err_path;
-    S2S::PObject status, reply;
-    status["action"] = "status";
-    std::string error;
-    bool exited = false;
-    bool up = s2s_test::WaitUntil(
-        [&] {
-          exited = waitpid(pid_, nullptr, WNOHANG) == pid_;
-          return exited || client_.Call(status, reply, error) ==
-                               s2s_tools::ControlClient::kReplied;
-        },
-        10);
-    if (exited) pid_ = -1;
-    return up && !exited;
+    SetUpServer({"docs"}, "");
+    StartDaemon();
   }
 
   // One request; the reply's result, or 100 when no reply came. Every
@@ -262,9 +245,8 @@ class ServiceControlTest : public ::testing::Test {
 
   // The stored tasks as the daemon lists them.
   std::string Tasks() {
-    S2S::PObject request, reply;
-    request["action"] = "list";
-    EXPECT_EQ(0u, Ask(request, &reply));
+    S2S::PObject reply;
+    EXPECT_EQ(0u, Ask(Req("list"), &reply));
     return ToJson(reply["tasks"], false);
   }
 
@@ -273,19 +255,15 @@ class ServiceControlTest : public ::testing::Test {
     S2S::PObject task;
     task["name"] = name;
     task["share_list"].asArray().push_back(S2S::PObject("docs"));
-    task["user"] = apps_.user();
+    task["user"] = app_.user();
     task["pswd"] = kPassword;
     task["server_ip"] = "127.0.0.1";
     task["schedule_mode"] = 0;
     return task;
   }
 
-  s2s_test::Appliances apps_{S2S_CMD_HANDLER};
-  s2s_test::TempDir tmp_;
   s2s_tools::ControlClient client_;
-  std::string log_;
   std::string replies_;
-  pid_t pid_ = -1;
 };
 
 TEST_F(ServiceControlTest, BadRequestsAreRefusedAndChangeNothing) {
@@ -302,12 +280,6 @@ TEST_F(ServiceControlTest, BadRequestsAreRefusedAndChangeNothing) {
     r["task"][key] = value;
     return r;
   };
-  auto request = [](const char* action, S2S::PObject id) {
-    S2S::PObject r;
-    r["action"] = action;
-    if (!id.isNull()) r["id"] = id;
-    return r;
-  };
   S2S::PObject deep("docs");
   for (int i = 0; i < 6; ++i) {
     S2S::PObject wrap;
@@ -318,19 +290,19 @@ TEST_F(ServiceControlTest, BadRequestsAreRefusedAndChangeNothing) {
   no_action["id"] = 1ULL;
   S2S::PObject action_number;
   action_number["action"] = 7ULL;
-  S2S::PObject update_bad = request("update", S2S::PObject(1ULL));
+  S2S::PObject update_bad = Req("update", S2S::PObject(1ULL));
   update_bad["task"]["share_list"].asArray().push_back(S2S::PObject("nope"));
   const struct {
     const char* what;
     S2S::PObject request;
     unsigned long long result;
   } kCases[] = {
-      {"unknown action", request("frobnicate", S2S::PObject()), 2},
+      {"unknown action", Req("frobnicate"), 2},
       {"no action", no_action, 1},
       {"action not a string", action_number, 1},
-      {"get without id", request("get", S2S::PObject()), 1},
-      {"id not a number", request("get", S2S::PObject("abc")), 1},
-      {"add without task", request("add", S2S::PObject()), 1},
+      {"get without id", Req("get"), 1},
+      {"id not a number", Req("get", S2S::PObject("abc")), 1},
+      {"add without task", Req("add"), 1},
       {"unknown share", with("share_list", update_bad["task"]["share_list"]),
        4},
       {"no server", with("server_ip", S2S::PObject("")), 4},
@@ -347,7 +319,7 @@ TEST_F(ServiceControlTest, BadRequestsAreRefusedAndChangeNothing) {
     EXPECT_EQ(c.result, Ask(c.request)) << c.what;
   }
   for (const char* action : {"get", "delete", "run", "enable", "history"}) {
-    EXPECT_EQ(3u, Ask(request(action, S2S::PObject(999ULL)))) << action;
+    EXPECT_EQ(3u, Ask(Req(action, S2S::PObject(999ULL)))) << action;
   }
 
   // Bytes that are no request: no reply (the connection is dropped) or an
@@ -385,18 +357,16 @@ TEST_F(ServiceControlTest, BadRequestsAreRefusedAndChangeNothing) {
   }
 
   EXPECT_EQ(before, Tasks());
-  S2S::PObject status;
-  status["action"] = "status";
-  EXPECT_EQ(0u, Ask(status)) << "the daemon stopped serving";
-  EXPECT_EQ(0, waitpid(pid_, nullptr, WNOHANG));
+  EXPECT_EQ(0u, Ask(Req("status"))) << "the daemon stopped serving";
+  EXPECT_EQ(0, waitpid(daemon_.pid, nullptr, WNOHANG));
 
   // The password went in and never came back; that one is stored is said.
-  S2S::PObject get = request("get", S2S::PObject(1ULL)), got;
-  ASSERT_EQ(0u, Ask(get, &got));
+  S2S::PObject got;
+  ASSERT_EQ(0u, Ask(Req("get", S2S::PObject(1ULL)), &got));
   EXPECT_FALSE(got["task"].hasMember("pswd"));
   EXPECT_TRUE(got["task"]["has_password"].asBool());
   EXPECT_FALSE(s2s_test::Has(replies_, kPassword));
-  EXPECT_FALSE(s2s_test::Has(s2s_test::ReadFile(log_), kPassword));
+  EXPECT_FALSE(s2s_test::Has(Log(), kPassword));
 }
 
 TEST_F(ServiceControlTest, PeersOtherThanRootAreRefused) {
@@ -410,7 +380,7 @@ TEST_F(ServiceControlTest, PeersOtherThanRootAreRefused) {
   for (mode_t mode : {0600, 0666}) {
     ASSERT_EQ(0, chmod(path.c_str(), mode));
     if (mode == 0666) {  // and the test's directories open to pass
-      const std::string& root = apps_.client_root();
+      const std::string& root = app_.client_root();
       const std::string top = root.substr(0, root.rfind('/'));
       for (std::string dir = path.substr(0, path.rfind('/'));
            dir.size() >= top.size(); dir = dir.substr(0, dir.rfind('/'))) {
@@ -447,10 +417,10 @@ TEST_F(ServiceControlTest, PeersOtherThanRootAreRefused) {
 
 TEST_F(ServiceControlTest, CtlAddListShowRunHistory) {
   const std::string pass = tmp_.Sub("pass");
-  const std::string password = apps_.Info().GetPassword();
+  const std::string password = app_.Info().GetPassword();
   ASSERT_TRUE(s2s_test::WriteFile(pass, password + "\n"));
   chmod(pass.c_str(), 0600);
-  const std::string docs = apps_.ClientShare("docs");
+  const std::string docs = app_.ClientShare("docs");
   for (const char* f : {"/a.txt", "/b.txt", "/c.txt"}) {
     ASSERT_TRUE(s2s_test::WriteFile(docs + f, "a\n"));
   }
@@ -462,11 +432,11 @@ TEST_F(ServiceControlTest, CtlAddListShowRunHistory) {
     return last.code;
   };
   ASSERT_EQ(0, ctl({"task", "add", "--task", "docs-copy", "--share", "docs",
-                    "--server-ip", "127.0.0.1", "--user", apps_.user(),
+                    "--server-ip", "127.0.0.1", "--user", app_.user(),
                     "--password-file", pass, "--schedule", "manual"}))
       << last.out;
   EXPECT_EQ(5, ctl({"task", "add", "--task", "docs-copy", "--share", "docs",
-                    "--server-ip", "127.0.0.1", "--user", apps_.user(),
+                    "--server-ip", "127.0.0.1", "--user", app_.user(),
                     "--password-file", pass}))
       << last.out;  // the name is taken
   ASSERT_EQ(0, ctl({"task", "list"}));
@@ -495,7 +465,7 @@ TEST_F(ServiceControlTest, CtlAddListShowRunHistory) {
   ASSERT_NO_FATAL_FAILURE(run({}));
   EXPECT_TRUE(s2s_test::Has(last.out, "\"outcome\": \"ok\"")) << last.out;
   EXPECT_TRUE(s2s_test::Has(last.out, "\"trigger\": \"manual\""));
-  EXPECT_EQ("a\n", s2s_test::ReadFile(apps_.ServerShare("docs") + "/a.txt"));
+  EXPECT_EQ("a\n", s2s_test::ReadFile(app_.ServerShare("docs") + "/a.txt"));
   ASSERT_EQ(0, ctl({"status"}));
   EXPECT_TRUE(s2s_test::Has(last.out, "docs-copy") ||
               s2s_test::Has(last.out, "(none)"))
@@ -513,10 +483,10 @@ TEST_F(ServiceControlTest, CtlAddListShowRunHistory) {
   ASSERT_NO_FATAL_FAILURE(run({}));
   EXPECT_TRUE(s2s_test::Has(last.out, "\"outcome\": \"held\"")) << last.out;
   EXPECT_TRUE(s2s_test::Has(last.out, "3 of 4 entries")) << last.out;
-  EXPECT_EQ("a\n", s2s_test::ReadFile(apps_.ServerShare("docs") + "/a.txt"));
+  EXPECT_EQ("a\n", s2s_test::ReadFile(app_.ServerShare("docs") + "/a.txt"));
   ASSERT_NO_FATAL_FAILURE(run({"--confirm-deletions"}));
   EXPECT_TRUE(s2s_test::Has(last.out, "\"outcome\": \"ok\"")) << last.out;
-  EXPECT_FALSE(std::filesystem::exists(apps_.ServerShare("docs") + "/a.txt"));
+  EXPECT_FALSE(std::filesystem::exists(app_.ServerShare("docs") + "/a.txt"));
 }
 
 }  // namespace

@@ -35,6 +35,7 @@ std::string Str(const std::vector<S2S::Event>& batch) {
 
 TEST(Batcher, CoalescesIntoTheSmallestSetOfSubPaths) {
   using Add = std::tuple<const char*, std::string, EventKind>;
+  // `n` paths, from "<dir>/f10<leaf>" on.
   auto Files = [](const std::string& dir, int n, const std::string& leaf) {
     std::vector<Add> adds;
     for (int i = 0; i < n; ++i) {
@@ -75,6 +76,9 @@ TEST(Batcher, CoalescesIntoTheSmallestSetOfSubPaths) {
       {"a crowded directory", Files("/d", 9, ""), "docs:/d"},
       {"a crowded top is the whole share", Files("", 9, ""), "docs:/"},
       {"over the pending limit", Files("", 5, "/x"), "docs:/", 4},
+      // More than 16 runs: the files are lifted to their directories, which
+      // crowd their parent.
+      {"many runs", Files("/p", 20, "/f"), "docs:/p"},
   };
   for (const Case& c : cases) {
     BatcherSettings s;
@@ -86,14 +90,6 @@ TEST(Batcher, CoalescesIntoTheSmallestSetOfSubPaths) {
     EXPECT_EQ(c.want, Str(b.Take())) << c.what;
     EXPECT_TRUE(b.Empty()) << c.what;
   }
-
-  // Twenty directories with a file each: more than 16 runs, so the files
-  // are lifted to their directories, which crowd their parent.
-  Batcher b{BatcherSettings()};
-  for (int i = 0; i < 20; ++i) {
-    b.Add(MakeEvent("docs", "/p/d" + std::to_string(i) + "/f"), 100);
-  }
-  EXPECT_EQ("docs:/p", Str(b.Take()));
 }
 
 TEST(Batcher, SettlesAfterTheLastChangeButNeverPastTheMaximumDelay) {
@@ -136,31 +132,19 @@ class RealtimeTest : public s2s_test::S2sdTest,
     PObject req = more;
     if (!req.isMap()) req = PObject::Map();
     req["action"] = action;
-    return s2sd_.Request(req);
+    return S2sdTest::Request(req);
   }
 
   // Adds the realtime task over docs with the test's change source, a
   // settle delay of 0.2 s and `settings` beside; its status map once it
   // watches, or a null object.
-  PObject AddTask(const PObject& settings = PObject()) {
-    S2S::SyncTask t;
-    t.GetInfo().SetName("live");
-    t.GetInfo().SetShareList({"docs"});
-    t.GetInfo().SetSyncInfo(app_.Info());
+  PObject AddLive(PObject settings = PObject()) {
+    if (!settings.isMap()) settings = PObject::Map();
+    settings["realtime_source"] = GetParam();
+    settings["realtime_settle_ms"] = 200u;
     S2S::Schedule realtime;
     realtime.SetMode(S2S::SCHD_REALTIME);
-    t.GetInfo().SetSchedule(realtime);
-    PObject req;
-    req = PObject::Map();
-    S2S::SyncTask2PObj(t, req["task"]);
-    req["task"].asMap().erase("id");
-    req["task"]["realtime_source"] = GetParam();
-    req["task"]["realtime_settle_ms"] = 200u;
-    if (settings.isMap()) {
-      for (const auto& it : settings.asMap()) req["task"][it.first] = it.second;
-    }
-    PObject reply = Request("add", req);
-    EXPECT_EQ(0u, reply["result"].asUInt64()) << reply["message"].asString();
+    AddTask("live", {"docs"}, realtime, settings);
     PObject status;
     WaitUntil(
         [&] {
@@ -215,16 +199,6 @@ class RealtimeTest : public s2s_test::S2sdTest,
     return n;
   }
 
-  size_t RsyncRuns() {
-    std::string log = ReadFile(rsync_log_);
-    size_t n = 0;
-    for (size_t at = log.find(client_); at != std::string::npos;
-         at = log.find(client_, at + 1)) {
-      ++n;
-    }
-    return n;
-  }
-
   // The status of the task's share.
   PObject Share() {
     const PObject status = Status();
@@ -241,8 +215,9 @@ class RealtimeTest : public s2s_test::S2sdTest,
 
 TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   WriteFile(client_ + "/before.txt", "made before the task\n");
-  StartDaemon();
-  const PObject status = AddTask();
+  // A share's directory is looked at every 0.2 s instead of 2 s.
+  StartDaemon({"--watch-check-ms", "200"});
+  const PObject status = AddLive();
   SKIP_UNLESS_SOURCE(status);
   // The start-up full sync.
   ASSERT_LE(0, Arrival("/before.txt", "made before the task\n")) << Log();
@@ -279,7 +254,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
 
   // A burst: 1,000 files in 100 new directories, far more paths than one
   // batch pushes one by one.
-  size_t runs_before = RsyncRuns();
+  size_t runs_before = RsyncLogCount(client_);
   for (int d = 0; d < 100; ++d) {
     std::string dir = client_ + "/burst/d" + std::to_string(d);
     fs::create_directories(dir);
@@ -289,7 +264,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
       WaitSlowly([&] { return Files(server_ + "/burst") == 1000; }, 120))
       << Log();
   EXPECT_TRUE(Same());
-  EXPECT_LE(RsyncRuns() - runs_before, 10u);
+  EXPECT_LE(RsyncLogCount(client_) - runs_before, 10u);
 
   // The share's directory goes: no longer watched, and watched again when
   // it is back.
@@ -325,20 +300,21 @@ TEST_P(RealtimeTest, OverflowWatchLimitAndAnUnreachableServerEndEqual) {
   }
   // At most 16 events per wake-up and 4 inotify watches; the full syncs
   // that cover what is not watched come every 2 s.
-  StartDaemon({"--watch-queue-limit", "16", "--watch-limit", "4"});
+  StartDaemon({"--watch-queue-limit", "16", "--watch-limit", "4",
+               "--watch-check-ms", "200"});
   PObject settings;
   settings = PObject::Map();
   settings["realtime_full_sync"] = 2u;
-  const PObject added = AddTask(settings);
+  const PObject added = AddLive(settings);
   SKIP_UNLESS_SOURCE(added);
   // Into the share's directory, which is watched, and into directories
   // that are not; while s2sd is stopped, so that the events pile up.
-  kill(s2sd_.pid(), SIGSTOP);
+  kill(daemon_.pid, SIGSTOP);
   for (int i = 0; i < 300; ++i) {
     std::string dir = i < 100 ? "" : "/tree/d" + std::to_string(i % 10) + "/e";
     WriteFile(client_ + dir + "/f" + std::to_string(i), std::to_string(i));
   }
-  kill(s2sd_.pid(), SIGCONT);
+  kill(daemon_.pid, SIGCONT);
   EXPECT_TRUE(WaitSlowly([&] { return Same(); }, 30)) << Log();
   const PObject status = Status();
   EXPECT_LE(1u, status["overflows"].asUInt64());

@@ -149,18 +149,13 @@ TEST(ServiceFiles, StoreRefusesBrokenFilesOneByOneAndHistoryIsBounded) {
   ASSERT_EQ(0, stat(store.PathOf(7).c_str(), &st));
   EXPECT_EQ(0600u, st.st_mode & 0777);
 
-  std::string dir = TaskDir();
-  const std::pair<const char*, const char*> broken[] = {
-      {"9.task", "s name=x\ns share_list.5=docs\n"},   // a hole in a list
-      {"10.task", "i id=10\nx what=1\n"},              // unknown kind
-      {"11.task", "i id=11\ns name=x\ns user=u\n"},    // no server, invalid
-      {"12.task", ReadFile(store.PathOf(7)).c_str()},  // id 7 in 12.task
+  const std::pair<const char*, std::string> broken[] = {
+      {"/9.task", "s name=x\ns share_list.5=docs\n"},  // a hole in a list
+      {"/10.task", "i id=10\nx what=1\n"},             // unknown kind
+      {"/11.task", "i id=11\ns name=x\ns user=u\n"},   // no server, invalid
+      {"/12.task", ReadFile(store.PathOf(7))},         // id 7 in 12.task
   };
-  std::string copy = ReadFile(store.PathOf(7));
-  for (const auto& b : broken) {
-    WriteFile(dir + "/" + b.first,
-              std::string(b.first) == "12.task" ? copy : b.second);
-  }
+  for (const auto& b : broken) WriteFile(TaskDir() + b.first, b.second);
   std::map<unsigned long long, StoredTask> tasks;
   std::vector<std::string> errors;
   ASSERT_TRUE(store.Load(tasks, errors));
@@ -218,29 +213,6 @@ class ServiceTest : public s2s_test::S2sdTest {
     req["action"] = action;
     if (id != 0) req["id"] = id;
     return req;
-  }
-
-  PObject Request(const PObject& request) { return s2sd_.Request(request); }
-
-  // `settings` are task keys set beside.
-  unsigned long long Add(const std::string& name,
-                         const std::list<std::string>& shares,
-                         const S2S::Schedule& schedule,
-                         const PObject& settings = PObject()) {
-    S2S::SyncTask t;
-    t.GetInfo().SetName(name);
-    t.GetInfo().SetShareList(shares);
-    t.GetInfo().SetSyncInfo(app_.Info());
-    t.GetInfo().SetSchedule(schedule);
-    PObject req = Action("add");
-    S2S::SyncTask2PObj(t, req["task"]);
-    req["task"].asMap().erase("id");
-    if (settings.isMap()) {
-      for (const auto& it : settings.asMap()) req["task"][it.first] = it.second;
-    }
-    PObject reply = Request(req);
-    EXPECT_EQ(0u, reply["result"].asUInt64()) << reply["message"].asString();
-    return reply["id"].asUInt64();
   }
 
   PObject::Array Runs(unsigned long long id) {
@@ -322,26 +294,14 @@ class ServiceTest : public s2s_test::S2sdTest {
   // let into a module: {commands (the command module, whose hooks run the
   // handler), data transfers (any other module)}.
   std::pair<int, int> Served() {
-    std::string log = app_.DaemonLog();
-    std::pair<int, int> n;
-    const std::string let_in = "access on module ";
-    for (size_t at = log.find(let_in); at != std::string::npos;
-         at = log.find(let_in, at + 1)) {
-      ++(log.compare(at + let_in.size(), 7, "s2scmd ") == 0 ? n.first
-                                                            : n.second);
+    const std::string log = app_.DaemonLog();
+    int all = 0, commands = 0;
+    for (size_t at = log.find("access on module "); at != std::string::npos;
+         at = log.find("access on module ", at + 1)) {
+      ++all;
+      commands += log.compare(at, 24, "access on module s2scmd ") == 0;
     }
-    return n;
-  }
-
-  // How many transfers of share big have started.
-  size_t BigTransfersStarted() {
-    std::string log = ReadFile(rsync_log_);
-    size_t n = 0;
-    for (size_t at = log.find(app_.ClientShare("big")); at != std::string::npos;
-         at = log.find(app_.ClientShare("big"), at + 1)) {
-      ++n;
-    }
-    return n;
+    return {commands, all - commands};
   }
 
   // Seconds to add to the clock so that it reads 12:00 and `second`
@@ -368,8 +328,8 @@ TEST_F(ServiceTest, ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce) {
   WriteBlob(app_.ClientShare("big") + "/blob", 4);
   // The next run, as the service sees the clock, is 3 s away.
   StartDaemon(OffsetTo(57));
-  unsigned long long sched = Add("sched", {"docs"}, EveryMinute());
-  unsigned long long manual = Add("manual", {"big"}, S2S::Schedule());
+  unsigned long long sched = AddTask("sched", {"docs"}, EveryMinute());
+  unsigned long long manual = AddTask("manual", {"big"}, S2S::Schedule());
   ASSERT_TRUE(WaitFor(Ended(sched, "ok"), 30)) << Log();
   EXPECT_EQ("alpha\n", ReadFile(app_.ServerShare("docs") + "/a.txt"));
   EXPECT_EQ("schedule", Runs(sched)[0]["trigger"].asString());
@@ -391,7 +351,7 @@ TEST_F(ServiceTest, ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce) {
   EXPECT_EQ(4u << 20, big["bytes"].asUInt64());
   EXPECT_EQ(0u, big["matched"].asUInt64());
   EXPECT_LT(0u, big["speed"].asUInt64());
-  EXPECT_EQ(0, s2sd_.Stop());
+  EXPECT_EQ(0, StopDaemon());
 
   // At 12:10:30: the missed slots give one catch-up run; tasks and history
   // are still there.
@@ -417,7 +377,7 @@ TEST_F(ServiceTest, ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce) {
 TEST_F(ServiceTest, CancelEndsALongTransferAndTheServerShowsTheTaskIdle) {
   WriteBlob(app_.ClientShare("big") + "/blob", 40);
   StartDaemon(0);
-  unsigned long long id = Add("long", {"big"}, S2S::Schedule());
+  unsigned long long id = AddTask("long", {"big"}, S2S::Schedule());
   // 10 MiB/s: long enough for rsync to report its progress.
   PObject limit = Action("update", id);
   limit["task"] = PObject::Map();
@@ -425,7 +385,8 @@ TEST_F(ServiceTest, CancelEndsALongTransferAndTheServerShowsTheTaskIdle) {
   ASSERT_EQ(0u, Request(limit)["result"].asUInt64());
   ASSERT_EQ(0u, Request(Action("run", id))["result"].asUInt64());
   // Wait for the data transfer itself.
-  ASSERT_TRUE(WaitFor([&] { return BigTransfersStarted() == 1; }, 30));
+  ASSERT_TRUE(
+      WaitFor([&] { return RsyncLogCount(app_.ClientShare("big")) == 1; }, 30));
   // rsync's progress shows in the running entry.
   EXPECT_TRUE(WaitFor(
       [&] {
@@ -446,8 +407,9 @@ TEST_F(ServiceTest, CancelEndsALongTransferAndTheServerShowsTheTaskIdle) {
 
   // SIGTERM during the next transfer: cancelled the same way, and s2sd ends.
   ASSERT_EQ(0u, Request(Action("run", id))["result"].asUInt64());
-  ASSERT_TRUE(WaitFor([&] { return BigTransfersStarted() == 2; }, 30));
-  EXPECT_EQ(0, s2sd_.Stop());
+  ASSERT_TRUE(
+      WaitFor([&] { return RsyncLogCount(app_.ClientShare("big")) == 2; }, 30));
+  EXPECT_EQ(0, StopDaemon());
   PObject::Array runs = History(HistoryDir()).Runs(id, 1);
   ASSERT_EQ(1u, runs.size());
   EXPECT_EQ("cancelled", runs[0]["outcome"].asString());
@@ -465,9 +427,10 @@ TEST_F(ServiceTest, SharedShareNeverAtOnceAndNoMoreThanMaxParallelRuns) {
   PObject slow;
   slow = PObject::Map();
   slow["max_bandwidth"] = 1024u;
-  for (const char* name : {"a", "b"}) Add(name, {"docs"}, EveryMinute(), slow);
-  Add("c", {"big"}, EveryMinute(), slow);
-  Add("d", {"photos"}, EveryMinute(), slow);
+  for (const char* name : {"a", "b"})
+    AddTask(name, {"docs"}, EveryMinute(), slow);
+  AddTask("c", {"big"}, EveryMinute(), slow);
+  AddTask("d", {"photos"}, EveryMinute(), slow);
   ASSERT_TRUE(WaitFor(
       [&] {
         for (unsigned long long id = 1; id <= 4; ++id) {
@@ -498,7 +461,8 @@ TEST_F(ServiceTest, SharedShareNeverAtOnceAndNoMoreThanMaxParallelRuns) {
 // start, transfer and end, then the task's end; no beacon before its time.
 TEST_F(ServiceTest, SteadyRunsSendOnlyTheCommandsTheirSharesNeed) {
   StartDaemon(0);
-  unsigned long long id = Add("steady", {"docs", "photos"}, S2S::Schedule());
+  unsigned long long id =
+      AddTask("steady", {"docs", "photos"}, S2S::Schedule());
   const std::pair<int, int> expected[] = {{3 + 2 * 2 + 1, 2}, {2 * 2 + 1, 2}};
   for (const auto& want : expected) {
     std::pair<int, int> before = Served();
@@ -515,7 +479,7 @@ TEST_F(ServiceTest, SteadyRunsSendOnlyTheCommandsTheirSharesNeed) {
 TEST_F(ServiceTest, AClientItsServerForgotPairsAgainWithinTheRun) {
   ASSERT_TRUE(app_.StartServer(/*old_server=*/true)) << app_.DaemonLog();
   StartDaemon(0);
-  unsigned long long id = Add("forgotten", {"docs"}, S2S::Schedule());
+  unsigned long long id = AddTask("forgotten", {"docs"}, S2S::Schedule());
   ASSERT_EQ("ok", RunOnce(id)) << Log();
   {
     s2s_test::ScopedEnv root("S2S_ROOT", app_.server_root());

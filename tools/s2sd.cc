@@ -37,6 +37,9 @@ const char kUsage[] =
     "                 realtime tasks count more than N events per wake-up\n"
     "                 as an overflow, and place at most N inotify watches\n"
     "                 each (for tests; default 0: the kernel's limits)\n"
+    "  --watch-check-ms N\n"
+    "                 realtime tasks look at their shares' directories\n"
+    "                 every N ms (for tests; default 2000)\n"
     "  --help, --version  this text; the version\n"
     "\n"
     "Settings: <root>/etc/s2s/s2sd.conf, section [Service]: max_parallel,\n"
@@ -58,7 +61,7 @@ void WrapperLog(int priority, const char* message) {
 int main(int argc, char** argv) {
   std::string root, log = "syslog";
   long clock_offset = 0, clock_rate = 1;
-  long queue_limit = 0, watch_limit = 0;
+  long queue_limit = 0, watch_limit = 0, check_ms = 2000;
   for (int i = 1; i < argc; ++i) {
     std::string a = argv[i];
     std::string value;
@@ -68,7 +71,7 @@ int main(int argc, char** argv) {
       a = a.substr(0, eq);
     } else if (a == "--root" || a == "--log" || a == "--clock-offset" ||
                a == "--clock-rate" || a == "--watch-queue-limit" ||
-               a == "--watch-limit") {
+               a == "--watch-limit" || a == "--watch-check-ms") {
       if (i + 1 == argc) {
         fprintf(stderr, "s2sd: %s needs a value\n", a.c_str());
         return 2;
@@ -76,11 +79,13 @@ int main(int argc, char** argv) {
       value = argv[++i];
     }
     if (a == "--clock-offset" || a == "--clock-rate" ||
-        a == "--watch-queue-limit" || a == "--watch-limit") {
+        a == "--watch-queue-limit" || a == "--watch-limit" ||
+        a == "--watch-check-ms") {
       char* end = nullptr;
       long n = strtol(value.c_str(), &end, 10);
       if (value.empty() || *end != '\0' ||
-          (a != "--clock-offset" && n < (a == "--clock-rate" ? 1 : 0))) {
+          (a != "--clock-offset" &&
+           n < (a == "--clock-rate" || a == "--watch-check-ms" ? 1 : 0))) {
         fprintf(stderr, "s2sd: %s needs a number\n", a.c_str());
         return 2;
       }
@@ -88,6 +93,7 @@ int main(int argc, char** argv) {
       if (a == "--clock-rate") clock_rate = n;
       if (a == "--watch-queue-limit") queue_limit = n;
       if (a == "--watch-limit") watch_limit = n;
+      if (a == "--watch-check-ms") check_ms = n;
     } else if (a == "--foreground") {
     } else if (a == "--root") {
       root = value;
@@ -135,6 +141,7 @@ int main(int argc, char** argv) {
   }
   config.watch_queue_limit = static_cast<size_t>(queue_limit);
   config.watch_limit = static_cast<size_t>(watch_limit);
+  config.watch_check_ms = static_cast<unsigned int>(check_ms);
   s2s_service::ShiftedClock clock(clock_offset, clock_rate);
   s2s_service::Daemon daemon(config, clock);
   return daemon.Run();
