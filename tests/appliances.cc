@@ -36,7 +36,7 @@ Appliances::Appliances(const std::string& handler)
       password_("appliance-Pw-5e1d"),
       daemon_(dir_.path()) {
   WriteClient(client_root_, "CLIENT-A", "client-a");
-  clients_.push_back(client_root_);
+  roots_ = {server_root_, client_root_};
   MakeDirs(server_root_ + "/etc/s2s");
   WriteFile(server_root_ + "/etc/s2s/platform.conf",
             "[Platform]\n\tserial=\"SERVER-1\"\n\thostname=\"server\"\n");
@@ -72,15 +72,18 @@ std::string Appliances::ShareConf(const std::string& root) const {
 
 bool Appliances::AddShare(const std::string& name, bool encrypted) {
   shares_.push_back({name, encrypted});
-  std::string dir = ShareDir("", name);
-  bool ok =
-      MakeDirs(server_root_ + dir) &&
-      WriteFile(server_root_ + "/etc/s2s/shares.conf", ShareConf(server_root_));
-  for (const std::string& root : clients_) {
-    ok = ok && MakeDirs(root + dir) && MakeDirs(root + "/data/" + name) &&
+  bool ok = true;
+  for (const std::string& root : roots_) {
+    ok = ok && MakeShareDirs(root, name) &&
          WriteFile(root + "/etc/s2s/shares.conf", ShareConf(root));
   }
   return ok;
+}
+
+// The share's directory, and for an encrypted share its lower one too.
+bool Appliances::MakeShareDirs(const std::string& root,
+                               const std::string& name) const {
+  return MakeDirs(root + "/data/" + name) && MakeDirs(ShareDir(root, name));
 }
 
 bool Appliances::StartServer(bool old_server) {
@@ -114,12 +117,9 @@ void Appliances::StopServer() {
 
 std::string Appliances::AddClient(const std::string& serial) {
   std::string root = dir_.Sub("client-" + serial);
-  clients_.push_back(root);
+  roots_.push_back(root);
   WriteClient(root, serial, "client-" + serial);
-  for (const Share& s : shares_) {
-    MakeDirs(root + "/data/" + s.name);
-    if (s.encrypted) MakeDirs(root + "/data/@" + s.name + "@");
-  }
+  for (const Share& s : shares_) MakeShareDirs(root, s.name);
   return root;
 }
 
@@ -134,22 +134,6 @@ std::string Appliances::ShareDir(const std::string& root,
     if (s.name == name && s.encrypted) return root + "/data/@" + name + "@";
   }
   return root + "/data/" + name;
-}
-
-std::string Appliances::ClientShare(const std::string& name) const {
-  return ShareDir(client_root_, name);
-}
-
-std::string Appliances::ServerShare(const std::string& name) const {
-  return ShareDir(server_root_, name);
-}
-
-std::string Appliances::ClientKeyFile(const std::string& name) const {
-  return client_root_ + "/keys/" + name + ".key";
-}
-
-std::string Appliances::ServerKeyDir() const {
-  return server_root_ + "/usr/karo/etc/.encrypt";
 }
 
 std::string Appliances::ServerRegistry(const std::string& section,
@@ -175,9 +159,9 @@ S2S::SyncInfo Appliances::Info() const {
 
 namespace {
 
-// early: spool the command (or the id of its upload); pre: answer it from status/<name> and
-// answer/<name> (grown with a hole to the size in pad/<name>), keep it in
-// last/<name> and count it in log.
+// early: spool the command (or the id of its upload); pre: answer it from
+// status/<name> and answer/<name> (grown with a hole to the size in
+// pad/<name>), keep it in last/<name> and count it in log.
 const char kScriptedHook[] = R"SH(
 dir=$(dirname "$0")
 case "$1" in
