@@ -26,6 +26,27 @@ std::string LoginName() {
   return pw != nullptr ? pw->pw_name : "root";
 }
 
+// The early hook answers the command of the early input (or the upload its
+// request id names) from status/<name> and answer/<name> (grown with a hole to
+// the size in pad/<name>), keeps it in last/<name> and counts it in log.
+const char kScriptedHook[] = R"SH(
+dir=$(dirname "$0")
+cmd="$dir/spool/$$"
+cat > "$cmd"
+id=$(sed -n 's/^requestID="\([0-9a-f]*\)"$/\1/p' "$cmd")
+[ -n "$id" ] || exit 1
+grep -q '^command=' "$cmd" || cp "$dir/upload/$id" "$cmd"
+name=$(sed -n 's/^command="\([A-Za-z0-9_]*\)"$/\1/p' "$cmd")
+[ -n "$name" ] || exit 1
+mv "$cmd" "$dir/last/$name"
+echo "$name" >> "$dir/log"
+status=$(cat "$dir/status/$name" 2>/dev/null || echo 0)
+{ echo "status=$status"; cat "$dir/answer/$name" 2>/dev/null || :; } \
+  > "$dir/reply/$id"
+[ ! -s "$dir/pad/$name" ] || truncate -s "$(cat "$dir/pad/$name")" \
+  "$dir/reply/$id"
+)SH";
+
 }  // namespace
 
 Appliances::Appliances(const std::string& handler)
@@ -157,34 +178,6 @@ S2S::SyncInfo Appliances::Info() const {
   return info;
 }
 
-namespace {
-
-// early: spool the command (or the id of its upload); pre: answer it from
-// status/<name> and answer/<name> (grown with a hole to the size in
-// pad/<name>), keep it in last/<name> and count it in log.
-const char kScriptedHook[] = R"SH(
-dir=$(dirname "$0")
-case "$1" in
-early) cat > "$dir/spool/$RSYNC_PID" ;;
-pre)
-  id=${RSYNC_REQUEST#s2scmd/}
-  case "$id" in *[!0-9a-f]*|'') exit 1 ;; esac
-  cmd="$dir/spool/$RSYNC_PID"
-  grep -q '^command=' "$cmd" || cmd="$dir/upload/$id"
-  name=$(sed -n 's/^command="\([A-Za-z0-9_]*\)"$/\1/p' "$cmd")
-  [ -n "$name" ] || exit 1
-  cp "$cmd" "$dir/last/$name"
-  echo "$name" >> "$dir/log"
-  status=$(cat "$dir/status/$name" 2>/dev/null || echo 0)
-  { echo "status=$status"; cat "$dir/answer/$name" 2>/dev/null || :; } \
-    > "$dir/reply/$id"
-  [ ! -s "$dir/pad/$name" ] || truncate -s "$(cat "$dir/pad/$name")" \
-    "$dir/reply/$id" ;;
-esac
-)SH";
-
-}  // namespace
-
 ScriptedServer::ScriptedServer(const std::string& dir)
     : dir_(dir), daemon_(dir) {}
 
@@ -202,8 +195,7 @@ bool ScriptedServer::Start(const std::string& user,
                      "\ngid = " + std::to_string(getegid()) +
                      "\n[s2scmd]\n\tpath = " + dir_ + "/reply\n" + auth +
                      "\tread only = yes\n\tearly exec = " + hook +
-                     " early\n\tpre-xfer exec = " + hook +
-                     " pre\n[s2sspool]\n\tpath = " + dir_ + "/upload\n" + auth +
+                     "\n[s2sspool]\n\tpath = " + dir_ + "/upload\n" + auth +
                      "\tread only = no\n\twrite only = yes\n";
   if (!WriteScript(hook, kScriptedHook) ||
       !WriteFile(secrets, user + ":" + password + "\n") ||

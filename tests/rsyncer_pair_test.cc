@@ -167,7 +167,8 @@ TEST_F(RsyncerPairTest, ScriptedAnswersAndRefusalsBeforeAnyRun) {
   EXPECT_EQ(-1, r.TestProtocol(status));
   EXPECT_EQ(-7, status);
   EXPECT_EQ(before, server.Count());
-  for (const char* line : {"MultiPairing: Fail to write command file\n",
+  for (const char* line : {"): Fail to get client id\n",
+                           "MultiPairing: Fail to write command file\n",
                            "SinglePairing: Fail to write command file\n",
                            "Fail to test connection\n"}) {
     EXPECT_TRUE(Has(log.Text(), line)) << line;
