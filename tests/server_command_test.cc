@@ -236,10 +236,7 @@ TEST_F(HookTest, ClientIdStaysWithItsDaemonUserAndALostRegistryStaysLost) {
   // The registry vanishes: refused, and not recreated open.
   ASSERT_EQ(0, unlink((tmp_.path() + "/usr/karo/etc/karoS2S.info").c_str()));
   env_.user = "u2";
-  EXPECT_EQ(kRegistryFailure,
-            Status("command=\"S2S_Pairing\"\nclientID=\"CL9\"\n"
-                   "dryRun=\"no\"\nserverName=\"x\"\n",
-                   "p3"));
+  EXPECT_EQ(kRegistryFailure, Status(pair, "p3"));
   EXPECT_FALSE(
       std::filesystem::exists(tmp_.path() + "/usr/karo/etc/karoS2S.info"));
 }
