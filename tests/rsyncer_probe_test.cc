@@ -36,7 +36,6 @@ TEST_F(RsyncerProbeTest, FirstCandidateThatAnswersWinsAndFailuresSayWhy) {
   ASSERT_EQ(0, r.Initialize(info));
   EXPECT_EQ("127.0.0.1", r.GetSyncInfo().GetServerIP());
   EXPECT_EQ(1, r.GetServerVersionValue());
-  EXPECT_TRUE(r.SupportMultiSource());
   for (const char* line :
        {"[INFO] S2S/rsyncer(", "Test 127.0.0.2 is reachable\n",
         "Fail to test connection [10]\n", "Get server version [1]\n"}) {

@@ -106,6 +106,12 @@ TEST(DataHook, OnlyArgumentsThatMakeTheDaemonRunDryCountAsADryRun) {
   }
 }
 
+// A command file: `command` from `client`, then the lines of `params`.
+std::string Cmd(const std::string& command, const std::string& params = "",
+                const std::string& client = "c") {
+  return "command=\"" + command + "\"\nclientID=\"" + client + "\"\n" + params;
+}
+
 class HookTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -149,7 +155,7 @@ class HookTest : public ::testing::Test {
 TEST_F(HookTest, BadRequestsGetAClearStatusAndWriteNothing) {
   // An id or a daemon user that could leave the reply directory gets no
   // reply at all.
-  std::string cmd = "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\n";
+  std::string cmd = Cmd("S2S_GetProtocolVer");
   for (const char* id : {"../x", "a/b", "", "a b"}) {
     EXPECT_EQ(1, Early(cmd + "requestID=\"" + id + "\"\n")) << id;
   }
@@ -169,27 +175,17 @@ TEST_F(HookTest, BadRequestsGetAClearStatusAndWriteNothing) {
     int status;
   } cases[] = {
       {"garbage\n", kMalformed},
-      {"command=\"S2S_SyncStart\"\nclientID=\"c\"\nvolumeName=\"v\"\n"
-       "shareName=\"../../etc\"\n",
+      {Cmd("S2S_SyncStart", "volumeName=\"v\"\nshareName=\"../../etc\"\n"),
        kBadId},
-      {"command=\"S2S_UpdateTaskStatus\"\nclientID=\"c\"\n"
-       "taskName=\"../t\"\n",
-       kBadId},
-      {"command=\"S2S_Pairing\"\nclientID=\"../c\"\ndryRun=\"no\"\n"
-       "serverName=\"s\"\n",
-       kBadId},
-      {"command=\"S2S_Pairing\"\nclientID=\"c\"\ndryRun=\"maybe\"\n"
-       "serverName=\"s\"\n",
-       kMalformed},
-      {"command=\"S2S_Nonsense\"\nclientID=\"c\"\n", kUnknownCommand},
+      {Cmd("S2S_UpdateTaskStatus", "taskName=\"../t\"\n"), kBadId},
+      {Cmd("S2S_Pairing", "dryRun=\"no\"\nserverName=\"s\"\n", "../c"), kBadId},
+      {Cmd("S2S_Pairing", "dryRun=\"maybe\"\nserverName=\"s\"\n"), kMalformed},
+      {Cmd("S2S_Nonsense"), kUnknownCommand},
       // Refused, not truncated at the NUL or trimmed.
-      {"command=\"S2S_SyncStart\"\nclientID=\"c\"\nvolumeName=\"v\"\n"
-       "shareName=\"a" +
-           std::string(1, '\0') + "b\"\n",
+      {Cmd("S2S_SyncStart",
+           "volumeName=\"v\"\nshareName=\"a" + std::string(1, '\0') + "b\"\n"),
        kBadId},
-      {"command=\"S2S_UpdateTaskStatus\"\nclientID=\"c\"\n"
-       "taskName=\"t \"\n",
-       kBadId},
+      {Cmd("S2S_UpdateTaskStatus", "taskName=\"t \"\n"), kBadId},
   };
   int n = 0;
   for (const Case& c : cases) {
@@ -199,8 +195,7 @@ TEST_F(HookTest, BadRequestsGetAClearStatusAndWriteNothing) {
 }
 
 TEST_F(HookTest, AnUploadedCommandRunsAndTheCleanupRemovesUploadAndReply) {
-  std::string cmd =
-      "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\nrequestID=\"r1\"\n";
+  std::string cmd = Cmd("S2S_GetProtocolVer", "requestID=\"r1\"\n");
   WriteFile(UploadDir() + "/r1", cmd);
   ASSERT_EQ(0, Early("requestID=\"r1\"\n"));
   EXPECT_EQ("status=0\n1\n", ReadFile(ReplyPath("u", "r1")));
@@ -220,11 +215,9 @@ TEST_F(HookTest, AnUploadedCommandRunsAndTheCleanupRemovesUploadAndReply) {
 TEST_F(HookTest, ClientIdStaysWithItsDaemonUserAndALostRegistryStaysLost) {
   DeclareShares({"s"});
   const std::string pair =
-      "command=\"S2S_Pairing\"\nclientID=\"CL1\"\ndryRun=\"no\"\n"
-      "serverName=\"srv\"\n";
+      Cmd("S2S_Pairing", "dryRun=\"no\"\nserverName=\"srv\"\n", "CL1");
   const std::string start =
-      "command=\"S2S_SyncStart\"\nclientID=\"CL1\"\nvolumeName=\"v\"\n"
-      "shareName=\"s\"\n";
+      Cmd("S2S_SyncStart", "volumeName=\"v\"\nshareName=\"s\"\n", "CL1");
   env_.user = "u1";
   EXPECT_EQ(kOk, Status(pair, "p1"));
   // Another daemon user naming CL1 gets nothing, whatever the command.
@@ -321,9 +314,8 @@ TEST_F(HookTest, HeldLockTimesOutAndLateCommandsAreNotApplied) {
     }
     // The same through the hook: the command was uploaded long ago.
     std::string upload = UploadDir() + "/late";
-    WriteFile(upload,
-              "command=\"S2S_UpdateTaskStatus\"\nclientID=\"c1\"\n"
-              "taskName=\"t1\"\nrequestID=\"late\"\n");
+    WriteFile(upload, Cmd("S2S_UpdateTaskStatus",
+                          "taskName=\"t1\"\nrequestID=\"late\"\n", "c1"));
     struct timeval old[2] = {{time(nullptr) - kCommandBudgetSeconds - 5, 0},
                              {time(nullptr) - kCommandBudgetSeconds - 5, 0}};
     if (utimes(upload.c_str(), old) != 0 ||
