@@ -26,6 +26,27 @@ std::string LoginName() {
   return pw != nullptr ? pw->pw_name : "root";
 }
 
+// The early hook answers the command of the early input (or the upload its
+// request id names) from status/<name> and answer/<name> (grown with a hole to
+// the size in pad/<name>), keeps it in last/<name> and counts it in log.
+const char kScriptedHook[] = R"SH(
+dir=$(dirname "$0")
+cmd="$dir/spool/$$"
+cat > "$cmd"
+id=$(sed -n 's/^requestID="\([0-9a-f]*\)"$/\1/p' "$cmd")
+[ -n "$id" ] || exit 1
+grep -q '^command=' "$cmd" || cp "$dir/upload/$id" "$cmd"
+name=$(sed -n 's/^command="\([A-Za-z0-9_]*\)"$/\1/p' "$cmd")
+[ -n "$name" ] || exit 1
+mv "$cmd" "$dir/last/$name"
+echo "$name" >> "$dir/log"
+status=$(cat "$dir/status/$name" 2>/dev/null || echo 0)
+{ echo "status=$status"; cat "$dir/answer/$name" 2>/dev/null || :; } \
+  > "$dir/reply/$id"
+[ ! -s "$dir/pad/$name" ] || truncate -s "$(cat "$dir/pad/$name")" \
+  "$dir/reply/$id"
+)SH";
+
 }  // namespace
 
 Appliances::Appliances(const std::string& handler)
@@ -36,7 +57,7 @@ Appliances::Appliances(const std::string& handler)
       password_("appliance-Pw-5e1d"),
       daemon_(dir_.path()) {
   WriteClient(client_root_, "CLIENT-A", "client-a");
-  clients_.push_back(client_root_);
+  roots_ = {server_root_, client_root_};
   MakeDirs(server_root_ + "/etc/s2s");
   WriteFile(server_root_ + "/etc/s2s/platform.conf",
             "[Platform]\n\tserial=\"SERVER-1\"\n\thostname=\"server\"\n");
@@ -72,15 +93,18 @@ std::string Appliances::ShareConf(const std::string& root) const {
 
 bool Appliances::AddShare(const std::string& name, bool encrypted) {
   shares_.push_back({name, encrypted});
-  std::string dir = ShareDir("", name);
-  bool ok =
-      MakeDirs(server_root_ + dir) &&
-      WriteFile(server_root_ + "/etc/s2s/shares.conf", ShareConf(server_root_));
-  for (const std::string& root : clients_) {
-    ok = ok && MakeDirs(root + dir) && MakeDirs(root + "/data/" + name) &&
+  bool ok = true;
+  for (const std::string& root : roots_) {
+    ok = ok && MakeShareDirs(root, name) &&
          WriteFile(root + "/etc/s2s/shares.conf", ShareConf(root));
   }
   return ok;
+}
+
+// The share's directory, and for an encrypted share its lower one too.
+bool Appliances::MakeShareDirs(const std::string& root,
+                               const std::string& name) const {
+  return MakeDirs(root + "/data/" + name) && MakeDirs(ShareDir(root, name));
 }
 
 bool Appliances::StartServer(bool old_server) {
@@ -114,12 +138,9 @@ void Appliances::StopServer() {
 
 std::string Appliances::AddClient(const std::string& serial) {
   std::string root = dir_.Sub("client-" + serial);
-  clients_.push_back(root);
+  roots_.push_back(root);
   WriteClient(root, serial, "client-" + serial);
-  for (const Share& s : shares_) {
-    MakeDirs(root + "/data/" + s.name);
-    if (s.encrypted) MakeDirs(root + "/data/@" + s.name + "@");
-  }
+  for (const Share& s : shares_) MakeShareDirs(root, s.name);
   return root;
 }
 
@@ -134,22 +155,6 @@ std::string Appliances::ShareDir(const std::string& root,
     if (s.name == name && s.encrypted) return root + "/data/@" + name + "@";
   }
   return root + "/data/" + name;
-}
-
-std::string Appliances::ClientShare(const std::string& name) const {
-  return ShareDir(client_root_, name);
-}
-
-std::string Appliances::ServerShare(const std::string& name) const {
-  return ShareDir(server_root_, name);
-}
-
-std::string Appliances::ClientKeyFile(const std::string& name) const {
-  return client_root_ + "/keys/" + name + ".key";
-}
-
-std::string Appliances::ServerKeyDir() const {
-  return server_root_ + "/usr/karo/etc/.encrypt";
 }
 
 std::string Appliances::ServerRegistry(const std::string& section,
@@ -173,34 +178,6 @@ S2S::SyncInfo Appliances::Info() const {
   return info;
 }
 
-namespace {
-
-// early: spool the command (or the id of its upload); pre: answer it from status/<name> and
-// answer/<name> (grown with a hole to the size in pad/<name>), keep it in
-// last/<name> and count it in log.
-const char kScriptedHook[] = R"SH(
-dir=$(dirname "$0")
-case "$1" in
-early) cat > "$dir/spool/$RSYNC_PID" ;;
-pre)
-  id=${RSYNC_REQUEST#s2scmd/}
-  case "$id" in *[!0-9a-f]*|'') exit 1 ;; esac
-  cmd="$dir/spool/$RSYNC_PID"
-  grep -q '^command=' "$cmd" || cmd="$dir/upload/$id"
-  name=$(sed -n 's/^command="\([A-Za-z0-9_]*\)"$/\1/p' "$cmd")
-  [ -n "$name" ] || exit 1
-  cp "$cmd" "$dir/last/$name"
-  echo "$name" >> "$dir/log"
-  status=$(cat "$dir/status/$name" 2>/dev/null || echo 0)
-  { echo "status=$status"; cat "$dir/answer/$name" 2>/dev/null || :; } \
-    > "$dir/reply/$id"
-  [ ! -s "$dir/pad/$name" ] || truncate -s "$(cat "$dir/pad/$name")" \
-    "$dir/reply/$id" ;;
-esac
-)SH";
-
-}  // namespace
-
 ScriptedServer::ScriptedServer(const std::string& dir)
     : dir_(dir), daemon_(dir) {}
 
@@ -218,8 +195,7 @@ bool ScriptedServer::Start(const std::string& user,
                      "\ngid = " + std::to_string(getegid()) +
                      "\n[s2scmd]\n\tpath = " + dir_ + "/reply\n" + auth +
                      "\tread only = yes\n\tearly exec = " + hook +
-                     " early\n\tpre-xfer exec = " + hook +
-                     " pre\n[s2sspool]\n\tpath = " + dir_ + "/upload\n" + auth +
+                     "\n[s2sspool]\n\tpath = " + dir_ + "/upload\n" + auth +
                      "\tread only = no\n\twrite only = yes\n";
   if (!WriteScript(hook, kScriptedHook) ||
       !WriteFile(secrets, user + ":" + password + "\n") ||

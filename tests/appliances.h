@@ -44,12 +44,12 @@ class Appliances : NoCopy {
   const std::string& server_root() const { return server_root_; }
   // A share's directory on the client / the server (the lower directory
   // for an encrypted share).
-  std::string ClientShare(const std::string& name) const;
-  std::string ServerShare(const std::string& name) const;
-  // The client's key file of an encrypted share.
-  std::string ClientKeyFile(const std::string& name) const;
-  // The key-file directory of the server.
-  std::string ServerKeyDir() const;
+  std::string ClientShare(const std::string& name) const {
+    return ShareDir(client_root_, name);
+  }
+  std::string ServerShare(const std::string& name) const {
+    return ShareDir(server_root_, name);
+  }
   // A value of the server's registry: `key` of section `section`, read with
   // S2S_ROOT at the server root; "" when absent.
   std::string ServerRegistry(const std::string& section,
@@ -71,6 +71,7 @@ class Appliances : NoCopy {
                    const std::string& hostname);
   std::string ShareConf(const std::string& root) const;
   std::string ShareDir(const std::string& root, const std::string& name) const;
+  bool MakeShareDirs(const std::string& root, const std::string& name) const;
 
   TempDir dir_;
   std::string client_root_;
@@ -79,7 +80,7 @@ class Appliances : NoCopy {
   std::string user_;
   std::string password_;
   std::vector<Share> shares_;
-  std::vector<std::string> clients_;  // client_root_ included
+  std::vector<std::string> roots_;  // the server's and every client's
   std::unique_ptr<ScopedEnv> root_env_;
   std::unique_ptr<ScopedEnv> port_env_;
   RsyncDaemon daemon_;

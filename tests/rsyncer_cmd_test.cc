@@ -19,7 +19,9 @@ using Lines = std::list<std::string>;
 class RsyncerCmdTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    Identity("\tserial=\"SN-9\"\n\thostname=\"" + kHost + "\"\n");
+    ASSERT_TRUE(root_.Write(
+        "/etc/s2s/platform.conf",
+        "[Platform]\n\tserial=\"SN-9\"\n\thostname=\"" + kHost + "\"\n"));
     ASSERT_TRUE(root_.MakeDir("/data/plain"));
     ASSERT_TRUE(root_.MakeDir("/data/@locked@"));
     // "plain" reports a key length although it is not encrypted.
@@ -34,9 +36,6 @@ class RsyncerCmdTest : public ::testing::Test {
             "[nomount]\n\tpath=\"/no/mount/holds/this\"\n"));
     // A mount table that holds none of the shares without a volume key.
     ASSERT_TRUE(root_.Write("/etc/mtab", "/dev/sdz1 /elsewhere ext4 rw 0 0\n"));
-  }
-  void Identity(const std::string& lines) {
-    ASSERT_TRUE(root_.Write("/etc/s2s/platform.conf", "[Platform]\n" + lines));
   }
   // What a generator appended to out_, joined by '|', or "refused" when it
   // failed; out_ then holds its first line again. Lines are appended to what
@@ -107,24 +106,6 @@ TEST_F(RsyncerCmdTest, EveryRequestsLinesAndTheRefusalsThatWriteNothing) {
   }
 }
 
-TEST_F(RsyncerCmdTest, MissingClientIdentityStopsEveryRequest) {
-  Identity("\tha=\"yes\"\n\tserial=\"\"\n");
-  s2s_test::LogCapture log;
-  Lines out;
-  EXPECT_EQ(-1, r_.GenSinglePairCmd(true, out));
-  EXPECT_EQ(-1, r_.GenServerVersionCmd("/o", out));
-  EXPECT_EQ(-1, r_.GenSendBeaconCmd("t", out));
-  EXPECT_EQ(-1, r_.GenFinishSyncCmd("task", "t", out));
-  EXPECT_EQ(-1, r_.GenStartSyncShareCmd("plain", true, out));
-  EXPECT_EQ(-1, r_.GenPairMultiSrcCmd(true, false, {"plain"}, "/o", out));
-  EXPECT_TRUE(out.empty());
-  int count = 0;
-  for (const std::string& m : log.Messages()) {
-    count += Has(m, "): Fail to get client id\n");
-  }
-  EXPECT_EQ(6, count);
-}
-
 TEST(RsyncerSplitTest, SplitsAtEachSeparatorKeepingEmptyPieces) {
   struct Case {
     std::string text, separators;
@@ -158,23 +139,14 @@ TEST(RsyncerTaskTest, SwitchesAndConnection) {
   EXPECT_FALSE(task.getCompress());
 
   S2S::SyncInfo info;
-  info.SetServerIP("127.0.0.9");
-  info.SetUser("backup");
   info.SetSSHPort(2222);
   info.SetCompression(true);
-  // Initialize probes the server; without a client identity no request is
-  // even written, so nothing runs.
-  s2s_test::TempRoot root;
-  ASSERT_TRUE(root.Write("/etc/s2s/platform.conf",
-                         "[Platform]\n\tha=\"yes\"\n\tserial=\"\"\n"));
   Rsyncer r;
   for (bool ssh : {false, true}) {
     info.SetSSH(ssh);
-    r.Initialize(info);
+    r.Resume(info, 1);
     Rsyncer::RsyncTask t;
     r.InitRsyncTask(t, !ssh);
-    EXPECT_EQ("127.0.0.9", t.GetServerIP());
-    EXPECT_EQ("backup", t.GetUser());
     EXPECT_EQ(ssh, t.getSsh());
     EXPECT_EQ(ssh ? 2222u : 0u, t.getPort());  // the port only for SSH
     EXPECT_EQ(ssh, t.getDebugLog());           // a test task runs quietly

@@ -40,7 +40,8 @@ class RsyncerKeyTest : public ::testing::Test {
                        "\tauto_key_file=\"" +
                        app_.client_root() + "/keys/auto.stored\"\n";
     ASSERT_TRUE(WriteFile(app_.client_root() + "/etc/s2s/shares.conf", conf));
-    ASSERT_TRUE(WriteFile(app_.ClientKeyFile("vault"), "vault key material"));
+    ASSERT_TRUE(WriteFile(app_.client_root() + "/keys/vault.key",
+                          "vault key material"));
     ASSERT_TRUE(WriteFile(app_.client_root() + "/keys/auto.stored", "auto"));
     // The probe and the pairing use the daemon; SSH is off for the sync.
     S2S::SyncInfo info = app_.Info();
@@ -49,6 +50,7 @@ class RsyncerKeyTest : public ::testing::Test {
   }
 
   s2s_test::Appliances app_{S2S_CMD_HANDLER};
+  const std::string keys_ = app_.server_root() + "/usr/karo/etc/.encrypt";
   s2s_test::TempDir ssh_dir_;
   s2s_test::SshServer sshd_{ssh_dir_.path()};
   Rsyncer r_;
@@ -56,27 +58,32 @@ class RsyncerKeyTest : public ::testing::Test {
 
 TEST_F(RsyncerKeyTest, KeyFilesTravelOverSshEvenWithSshOff) {
   ASSERT_FALSE(r_.GetSyncInfo().UseSSH());
+  LogCapture log;
   // The key module takes a share's key only from the client syncing it.
   EXPECT_NE(0, r_.SyncEncryptKey("vault"));
-  EXPECT_FALSE(fs::exists(app_.ServerKeyDir() + "/vault"));
+  EXPECT_FALSE(fs::exists(keys_ + "/vault"));
+  // Shares the platform does not know are 300.
+  EXPECT_EQ(300, r_.SyncEncryptKey("nope"));
+  EXPECT_TRUE(Has(log.Text(), "Fail to get share 'nope', errno=[8704]\n"));
+  EXPECT_EQ(300, r_.SyncEncryptKey("bad/name"));
+  EXPECT_TRUE(Has(log.Text(), "Fail to get share 'bad/name', errno=[3328]\n"));
   for (const char* share : {"vault", "auto"}) {
     int status = -1;
     ASSERT_EQ(0, r_.StartSyncShare(share, status));
     ASSERT_EQ(0, status) << share;
   }
-  LogCapture log;
   EXPECT_EQ(0, r_.SyncEncryptKey("vault"));
   // Key contents never reach the log.
   EXPECT_FALSE(Has(log.Text(), "key material"));
-  EXPECT_EQ("vault key material", ReadFile(app_.ServerKeyDir() + "/vault"));
+  EXPECT_EQ("vault key material", ReadFile(keys_ + "/vault"));
   EXPECT_EQ(0, r_.SyncEncryptKey("auto"));
-  EXPECT_EQ("auto", ReadFile(app_.ServerKeyDir() + "/auto"));
+  EXPECT_EQ("auto", ReadFile(keys_ + "/auto"));
 
   // Nothing to send: an unencrypted share, an encrypted one without a key.
-  EXPECT_EQ(0, r_.SyncEncryptKey("docs"));
-  EXPECT_EQ(0, r_.SyncEncryptKey("nokey"));
-  EXPECT_FALSE(fs::exists(app_.ServerKeyDir() + "/docs"));
-  EXPECT_FALSE(fs::exists(app_.ServerKeyDir() + "/nokey"));
+  for (const std::string share : {"docs", "nokey"}) {
+    EXPECT_EQ(0, r_.SyncEncryptKey(share));
+    EXPECT_FALSE(fs::exists(keys_ + "/" + share)) << share;
+  }
   // An unknown server key fails the copy at once instead of prompting.
   std::string known = app_.client_root() + "/etc/s2s/ssh/known_hosts";
   std::string hosts = ReadFile(known);
@@ -88,15 +95,6 @@ TEST_F(RsyncerKeyTest, KeyFilesTravelOverSshEvenWithSshOff) {
   // The daemon's own port would not do: without sshd the copy fails.
   sshd_.Stop();
   EXPECT_NE(0, r_.SyncEncryptKey("vault"));
-}
-
-TEST_F(RsyncerKeyTest, PlatformFailuresAre300) {
-  LogCapture log;
-  EXPECT_EQ(300, r_.SyncEncryptKey("nope"));
-  EXPECT_TRUE(Has(log.Text(), "Fail to get share 'nope', errno=[8704]\n"));
-  EXPECT_EQ(300, r_.SyncEncryptKey("bad/name"));
-  EXPECT_TRUE(Has(log.Text(), "Fail to get share 'bad/name', errno=[3328]\n"));
-  EXPECT_FALSE(fs::exists(app_.ServerKeyDir() + "/nope"));
 }
 
 }  // namespace

@@ -98,96 +98,86 @@ TEST_F(RsyncerPairTest, OldServerGetsTheSingleRequestAndThePlainSyncStart) {
   EXPECT_EQ(245, status);
 }
 
-class RsyncerScriptedPairTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    ASSERT_TRUE(app_.AddShare("docs"));
-    ASSERT_TRUE(app_.AddShare("vault", /*encrypted=*/true));
-    ASSERT_TRUE(server_.Start(app_.user(), "scripted-Pw-2"));
-    server_.Answer("S2S_GetProtocolVer", 0, "2\n");
-    info_ = app_.Info();
-    info_.SetPassword("scripted-Pw-2");
-    ASSERT_EQ(0, r_.Initialize(info_));
-    ASSERT_TRUE(r_.SupportMultiSource());
-  }
-  std::string Request() { return server_.LastRequest("S2S_PairingMultiSrc"); }
-
-  s2s_test::Appliances app_{S2S_CMD_HANDLER};
-  s2s_test::TempDir dir_;
-  s2s_test::ScriptedServer server_{dir_.path()};
-  S2S::SyncInfo info_;
-  Rsyncer r_;
-};
-
-TEST_F(RsyncerScriptedPairTest, AnswersAndTheEncryptionFlag) {
+// Answers the real handler never gives, and the lines that cross the wire.
+TEST_F(RsyncerPairTest, ScriptedAnswersAndRefusalsBeforeAnyRun) {
+  ASSERT_TRUE(app_.AddShare("docs"));
+  ASSERT_TRUE(app_.AddShare("vault", /*encrypted=*/true));
+  s2s_test::TempDir dir;
+  s2s_test::ScriptedServer server(dir.path());
+  ASSERT_TRUE(server.Start(app_.user(), "scripted-Pw-2"));
+  server.Answer("S2S_GetProtocolVer", 0, "2\n");
+  S2S::SyncInfo info = app_.Info();
+  info.SetPassword("scripted-Pw-2");
+  Rsyncer r;
+  ASSERT_EQ(0, r.Initialize(info));
+  ASSERT_TRUE(r.SupportMultiSource());
+  auto request = [&server] {
+    return server.LastRequest("S2S_PairingMultiSrc");
+  };
   int status = -1;
   Names conflicts;
-  server_.Answer("S2S_PairingMultiSrc", 214, "a:b\nignored:line\n");
-  ASSERT_EQ(0, r_.DoPairing(true, {"docs"}, conflicts, status));
+  server.Answer("S2S_PairingMultiSrc", 214, "a:b\nignored:line\n");
+  ASSERT_EQ(0, r.DoPairing(true, {"docs"}, conflicts, status));
   EXPECT_EQ(214, status);
   EXPECT_EQ((Names{"a", "b"}), conflicts);
   EXPECT_TRUE(
-      Has(Request(), "syncShares=\"docs\"\ndryRun=\"yes\"\noutfile=\""));
-  EXPECT_TRUE(Has(Request(), "requireEncryptionShareSupport=\"no\"\n"));
+      Has(request(), "syncShares=\"docs\"\ndryRun=\"yes\"\noutfile=\""));
+  EXPECT_TRUE(Has(request(), "requireEncryptionShareSupport=\"no\"\n"));
 
   // The first encrypted share ends the look-ups: "nope" is never asked for.
   conflicts.clear();
-  server_.Answer("S2S_PairingMultiSrc", 0, "");
+  server.Answer("S2S_PairingMultiSrc", 0, "");
   ASSERT_EQ(0,
-            r_.DoPairing(false, {"docs", "vault", "nope"}, conflicts, status));
+            r.DoPairing(false, {"docs", "vault", "nope"}, conflicts, status));
   EXPECT_EQ(0, status);
   EXPECT_TRUE(conflicts.empty());
-  EXPECT_TRUE(Has(Request(), "syncShares=\"docs:vault:nope\"\n"));
-  EXPECT_TRUE(Has(Request(), "dryRun=\"no\"\n"));
-  EXPECT_TRUE(Has(Request(), "requireEncryptionShareSupport=\"yes\"\n"));
+  EXPECT_TRUE(Has(request(), "syncShares=\"docs:vault:nope\"\n"));
+  EXPECT_TRUE(Has(request(), "dryRun=\"no\"\n"));
+  EXPECT_TRUE(Has(request(), "requireEncryptionShareSupport=\"yes\"\n"));
 
   LogCapture log;
-  server_.Answer("S2S_PairingMultiSrc", 5);
-  EXPECT_EQ(-1, r_.DoPairing(true, {"docs"}, conflicts, status));
+  server.Answer("S2S_PairingMultiSrc", 5);
+  EXPECT_EQ(-1, r.DoPairing(true, {"docs"}, conflicts, status));
   EXPECT_EQ(5, status);
   EXPECT_TRUE(Has(log.Text(), "Fail to check share pairing [5]\n"));
   EXPECT_TRUE(std::filesystem::is_empty(app_.client_root() + "/tmp/S2S"));
-}
 
-// The fallback after 202 runs against the real old server above.
-TEST_F(RsyncerScriptedPairTest, SyncStartDoesNotFallBackOnOtherRefusals) {
-  server_.Answer("S2S_SyncStart", 5);
-  int before = server_.Count();
-  int status = -1;
-  ASSERT_EQ(0, r_.StartSyncShare("docs", status));
+  // A sync start falls back to the plain form after 202 only (see the old
+  // server above), not after any other refusal.
+  server.Answer("S2S_SyncStart", 5);
+  int before = server.Count();
+  ASSERT_EQ(0, r.StartSyncShare("docs", status));
   EXPECT_EQ(5, status);
-  EXPECT_EQ(before + 1, server_.Count());
-  EXPECT_TRUE(Has(server_.LastRequest("S2S_SyncStart"), "lenEncKey=\"0\"\n"));
-}
+  EXPECT_EQ(before + 1, server.Count());
+  EXPECT_TRUE(Has(server.LastRequest("S2S_SyncStart"), "lenEncKey=\"0\"\n"));
 
-TEST_F(RsyncerScriptedPairTest, RefusalsBeforeAnyRun) {
-  int before = server_.Count();
-  LogCapture log;
-  int status = -7;
-  Names conflicts;
+  // Refusals before any request is sent.
+  before = server.Count();
+  status = -7;
   EXPECT_EQ(-1,
-            r_.DoPairing(true, {"docs", "nope", "vault"}, conflicts, status));
+            r.DoPairing(true, {"docs", "nope", "vault"}, conflicts, status));
   EXPECT_TRUE(Has(log.Text(), "Fail to get share info of 'nope'\n"));
-  EXPECT_EQ(-1, r_.DoPairing(true, {}, conflicts, status));
+  EXPECT_EQ(-1, r.DoPairing(true, {}, conflicts, status));
   EXPECT_TRUE(Has(log.Text(), "MultiPairing: Share list is empty\n"));
-
   // Without a client identity no request can be written.
   ASSERT_TRUE(WriteFile(app_.client_root() + "/etc/s2s/platform.conf",
                         "[Platform]\n\tha=\"yes\"\n\tserial=\"\"\n"));
-  EXPECT_EQ(-1, r_.DoPairing(true, {"docs"}, conflicts, status));
-  EXPECT_TRUE(Has(log.Text(), "MultiPairing: Fail to write command file\n"));
-  EXPECT_EQ(-1, r_.DoSinglePairing(true, status));
-  EXPECT_TRUE(Has(log.Text(), "SinglePairing: Fail to write command file\n"));
-  EXPECT_EQ(-1, r_.TestProtocol(status));
-  EXPECT_TRUE(Has(log.Text(), "Fail to test connection\n"));
+  EXPECT_EQ(-1, r.DoPairing(true, {"docs"}, conflicts, status));
+  EXPECT_EQ(-1, r.DoSinglePairing(true, status));
+  EXPECT_EQ(-1, r.TestProtocol(status));
   EXPECT_EQ(-7, status);
-  EXPECT_EQ(before, server_.Count());
-
+  EXPECT_EQ(before, server.Count());
+  for (const char* line : {"): Fail to get client id\n",
+                           "MultiPairing: Fail to write command file\n",
+                           "SinglePairing: Fail to write command file\n",
+                           "Fail to test connection\n"}) {
+    EXPECT_TRUE(Has(log.Text(), line)) << line;
+  }
   // No temporary directory: no place for the answer.
   std::filesystem::remove_all(app_.client_root() + "/tmp/S2S");
-  EXPECT_EQ(-1, r_.DoMultiPairing(true, false, {"docs"}, conflicts, status));
+  EXPECT_EQ(-1, r.DoMultiPairing(true, false, {"docs"}, conflicts, status));
   EXPECT_TRUE(Has(log.Text(), "MultiPairing: Fail to get output file\n"));
-  EXPECT_EQ(2, r_.GetServerVersion());
+  EXPECT_EQ(2, r.GetServerVersion());
   EXPECT_TRUE(Has(log.Text(), "GetServerVersion: Fail to get output file\n"));
 }
 

@@ -106,6 +106,12 @@ TEST(DataHook, OnlyArgumentsThatMakeTheDaemonRunDryCountAsADryRun) {
   }
 }
 
+// A command file: `command` from `client`, then the lines of `params`.
+std::string Cmd(const std::string& command, const std::string& params = "",
+                const std::string& client = "c") {
+  return "command=\"" + command + "\"\nclientID=\"" + client + "\"\n" + params;
+}
+
 class HookTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -149,7 +155,7 @@ class HookTest : public ::testing::Test {
 TEST_F(HookTest, BadRequestsGetAClearStatusAndWriteNothing) {
   // An id or a daemon user that could leave the reply directory gets no
   // reply at all.
-  std::string cmd = "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\n";
+  std::string cmd = Cmd("S2S_GetProtocolVer");
   for (const char* id : {"../x", "a/b", "", "a b"}) {
     EXPECT_EQ(1, Early(cmd + "requestID=\"" + id + "\"\n")) << id;
   }
@@ -169,27 +175,17 @@ TEST_F(HookTest, BadRequestsGetAClearStatusAndWriteNothing) {
     int status;
   } cases[] = {
       {"garbage\n", kMalformed},
-      {"command=\"S2S_SyncStart\"\nclientID=\"c\"\nvolumeName=\"v\"\n"
-       "shareName=\"../../etc\"\n",
+      {Cmd("S2S_SyncStart", "volumeName=\"v\"\nshareName=\"../../etc\"\n"),
        kBadId},
-      {"command=\"S2S_UpdateTaskStatus\"\nclientID=\"c\"\n"
-       "taskName=\"../t\"\n",
-       kBadId},
-      {"command=\"S2S_Pairing\"\nclientID=\"../c\"\ndryRun=\"no\"\n"
-       "serverName=\"s\"\n",
-       kBadId},
-      {"command=\"S2S_Pairing\"\nclientID=\"c\"\ndryRun=\"maybe\"\n"
-       "serverName=\"s\"\n",
-       kMalformed},
-      {"command=\"S2S_Nonsense\"\nclientID=\"c\"\n", kUnknownCommand},
+      {Cmd("S2S_UpdateTaskStatus", "taskName=\"../t\"\n"), kBadId},
+      {Cmd("S2S_Pairing", "dryRun=\"no\"\nserverName=\"s\"\n", "../c"), kBadId},
+      {Cmd("S2S_Pairing", "dryRun=\"maybe\"\nserverName=\"s\"\n"), kMalformed},
+      {Cmd("S2S_Nonsense"), kUnknownCommand},
       // Refused, not truncated at the NUL or trimmed.
-      {"command=\"S2S_SyncStart\"\nclientID=\"c\"\nvolumeName=\"v\"\n"
-       "shareName=\"a" +
-           std::string(1, '\0') + "b\"\n",
+      {Cmd("S2S_SyncStart",
+           "volumeName=\"v\"\nshareName=\"a" + std::string(1, '\0') + "b\"\n"),
        kBadId},
-      {"command=\"S2S_UpdateTaskStatus\"\nclientID=\"c\"\n"
-       "taskName=\"t \"\n",
-       kBadId},
+      {Cmd("S2S_UpdateTaskStatus", "taskName=\"t \"\n"), kBadId},
   };
   int n = 0;
   for (const Case& c : cases) {
@@ -199,8 +195,7 @@ TEST_F(HookTest, BadRequestsGetAClearStatusAndWriteNothing) {
 }
 
 TEST_F(HookTest, AnUploadedCommandRunsAndTheCleanupRemovesUploadAndReply) {
-  std::string cmd =
-      "command=\"S2S_GetProtocolVer\"\nclientID=\"c\"\nrequestID=\"r1\"\n";
+  std::string cmd = Cmd("S2S_GetProtocolVer", "requestID=\"r1\"\n");
   WriteFile(UploadDir() + "/r1", cmd);
   ASSERT_EQ(0, Early("requestID=\"r1\"\n"));
   EXPECT_EQ("status=0\n1\n", ReadFile(ReplyPath("u", "r1")));
@@ -220,11 +215,9 @@ TEST_F(HookTest, AnUploadedCommandRunsAndTheCleanupRemovesUploadAndReply) {
 TEST_F(HookTest, ClientIdStaysWithItsDaemonUserAndALostRegistryStaysLost) {
   DeclareShares({"s"});
   const std::string pair =
-      "command=\"S2S_Pairing\"\nclientID=\"CL1\"\ndryRun=\"no\"\n"
-      "serverName=\"srv\"\n";
+      Cmd("S2S_Pairing", "dryRun=\"no\"\nserverName=\"srv\"\n", "CL1");
   const std::string start =
-      "command=\"S2S_SyncStart\"\nclientID=\"CL1\"\nvolumeName=\"v\"\n"
-      "shareName=\"s\"\n";
+      Cmd("S2S_SyncStart", "volumeName=\"v\"\nshareName=\"s\"\n", "CL1");
   env_.user = "u1";
   EXPECT_EQ(kOk, Status(pair, "p1"));
   // Another daemon user naming CL1 gets nothing, whatever the command.
@@ -236,10 +229,7 @@ TEST_F(HookTest, ClientIdStaysWithItsDaemonUserAndALostRegistryStaysLost) {
   // The registry vanishes: refused, and not recreated open.
   ASSERT_EQ(0, unlink((tmp_.path() + "/usr/karo/etc/karoS2S.info").c_str()));
   env_.user = "u2";
-  EXPECT_EQ(kRegistryFailure,
-            Status("command=\"S2S_Pairing\"\nclientID=\"CL9\"\n"
-                   "dryRun=\"no\"\nserverName=\"x\"\n",
-                   "p3"));
+  EXPECT_EQ(kRegistryFailure, Status(pair, "p3"));
   EXPECT_FALSE(
       std::filesystem::exists(tmp_.path() + "/usr/karo/etc/karoS2S.info"));
 }
@@ -300,33 +290,32 @@ TEST_F(HookTest, HeldLockTimesOutAndLateCommandsAreNotApplied) {
     cmd.params = {{"taskName", "t1"}};
     HandlerContext ctx;
     std::string answer;
+    // The command's status when its client waits `seconds` more.
+    auto run = [&](int seconds) {
+      ctx.deadline = time(nullptr) + seconds;
+      return HandleCommand(cmd, ctx, &answer);
+    };
     int held[2], release[2];
     if (pipe(held) != 0 || pipe(release) != 0) _exit(10);
     std::thread holder([&] {
       char c = S2SRegistryLock(-1) == 0 ? 'y' : 'n';
-      if (write(held[1], &c, 1) != 1) return;
-      read(release[0], &c, 1);
+      if (write(held[1], &c, 1) == 1) read(release[0], &c, 1);
       S2SRegistryUnlock();
     });
     char c = 0;
     if (read(held[0], &c, 1) != 1 || c != 'y') _exit(11);
-    ctx.deadline = time(nullptr) + 1;
-    int busy = HandleCommand(cmd, ctx, &answer);
-    bool written = Has(Registry(), "TASK_t1");
+    int busy = run(1);
     if (write(release[1], "x", 1) != 1) _exit(12);
     holder.join();
-    if (busy != kRegistryFailure || written) _exit(13);
-    // The lock is free, but the client stopped waiting long ago.
-    ctx.deadline = time(nullptr) - 1;
-    if (HandleCommand(cmd, ctx, &answer) != kRegistryFailure ||
+    // Then the lock is free, but the client stopped waiting long ago.
+    if (busy != kRegistryFailure || run(-1) != kRegistryFailure ||
         Has(Registry(), "TASK_t1")) {
-      _exit(14);
+      _exit(13);
     }
     // The same through the hook: the command was uploaded long ago.
     std::string upload = UploadDir() + "/late";
-    WriteFile(upload,
-              "command=\"S2S_UpdateTaskStatus\"\nclientID=\"c1\"\n"
-              "taskName=\"t1\"\nrequestID=\"late\"\n");
+    WriteFile(upload, Cmd("S2S_UpdateTaskStatus",
+                          "taskName=\"t1\"\nrequestID=\"late\"\n", "c1"));
     struct timeval old[2] = {{time(nullptr) - kCommandBudgetSeconds - 5, 0},
                              {time(nullptr) - kCommandBudgetSeconds - 5, 0}};
     if (utimes(upload.c_str(), old) != 0 ||
@@ -335,12 +324,7 @@ TEST_F(HookTest, HeldLockTimesOutAndLateCommandsAreNotApplied) {
         Has(Registry(), "TASK_t1")) {
       _exit(15);
     }
-    ctx.deadline = time(nullptr) + 30;
-    if (HandleCommand(cmd, ctx, &answer) != kOk ||
-        !Has(Registry(), "TASK_t1")) {
-      _exit(16);
-    }
-    _exit(0);
+    _exit(run(30) == kOk && Has(Registry(), "TASK_t1") ? 0 : 16);
   }
   int st = 0;
   ASSERT_EQ(pid, waitpid(pid, &st, 0));
