@@ -280,31 +280,47 @@ TEST_F(ChannelSSLTest, HandshakeGivesUpOnSilentOrFailingPeers) {
     EXPECT_LT(SecondsSince(start), 5.0);
     peer.join();
   }
+  {  // our end serving a client that speaks something else
+    Pair r(256, 10, true);
+    ASSERT_TRUE(r.ok);
+    const char request[] = "GET / HTTP/1.0\r\n\r\n";
+    ASSERT_EQ(write(r.peer, request, sizeof request - 1),
+              static_cast<ssize_t>(sizeof request - 1));
+    EXPECT_EQ(r.client.ConvertToSSLChannel(true), S2S::kIOError);
+    EXPECT_TRUE(Has(log.Text(), "SSLHandshake: SSL fatel error code: 1"));
+  }
 }
 
 // Our client end against a real TLS 1.2 server, whose suites the client's
-// failed request for its single old suite once removed.
+// failed request for its single old suite once removed; TLS 1.1 it refuses.
 TEST_F(ChannelSSLTest, ClientTalksToOpenSSLServer) {
-  // Port 0: the server takes a free one and names it, in one write.
-  s2s_test::PipedProcess server;
-  ASSERT_TRUE(server.Start(
-      Shell("openssl s_server -accept 127.0.0.1:0 -naccept 1 -tls1_2 -cert " +
-            File("cn.pem") + " -key " + File("cn.key"))));
-  ASSERT_TRUE(server.WaitFor("ACCEPT 127.0.0.1:")) << server.output();
-  int port = atoi(server.output().c_str() +
-                  server.output().find("ACCEPT 127.0.0.1:") + 17);
-  Channel ch(4096);
-  ch.SetTimeout(5);
-  ASSERT_EQ(ch.Open("127.0.0.1", port), 0);
-  Verify(ch, "ca.pem", "server.example.test");
-  ASSERT_EQ(ch.ConvertToSSLChannel(false), 0);
-  ASSERT_EQ(ch.Write("ping from s2s\n", 14), 0);
-  ASSERT_EQ(ch.FlushWrite(0), 0);
-  EXPECT_TRUE(server.WaitFor("ping from s2s\n")) << server.output();
-  ASSERT_TRUE(server.Send("pong\n"));
-  char buf[6] = {};
-  EXPECT_EQ(ch.Read(buf, 5), 0);
-  EXPECT_STREQ(buf, "pong\n");
+  for (const char* opts : {"-tls1_2", "-tls1_1 -cipher DEFAULT@SECLEVEL=0"}) {
+    SCOPED_TRACE(opts);
+    // Port 0: the server takes a free one and names it, in one write.
+    s2s_test::PipedProcess server;
+    ASSERT_TRUE(server.Start(
+        Shell("openssl s_server -accept 127.0.0.1:0 -naccept 1 -cert " +
+              File("cn.pem") + " -key " + File("cn.key") + " " + opts)));
+    ASSERT_TRUE(server.WaitFor("ACCEPT 127.0.0.1:")) << server.output();
+    int port = atoi(server.output().c_str() +
+                    server.output().find("ACCEPT 127.0.0.1:") + 17);
+    Channel ch(4096);
+    ch.SetTimeout(5);
+    ASSERT_EQ(ch.Open("127.0.0.1", port), 0);
+    Verify(ch, "ca.pem", "server.example.test");
+    if (Has(opts, "tls1_1")) {
+      EXPECT_EQ(ch.ConvertToSSLChannel(false), S2S::kIOError);
+      continue;
+    }
+    ASSERT_EQ(ch.ConvertToSSLChannel(false), 0);
+    ASSERT_EQ(ch.Write("ping from s2s\n", 14), 0);
+    ASSERT_EQ(ch.FlushWrite(0), 0);
+    EXPECT_TRUE(server.WaitFor("ping from s2s\n")) << server.output();
+    ASSERT_TRUE(server.Send("pong\n"));
+    char buf[6] = {};
+    EXPECT_EQ(ch.Read(buf, 5), 0);
+    EXPECT_STREQ(buf, "pong\n");
+  }
 }
 
 }  // namespace
