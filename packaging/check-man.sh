@@ -6,9 +6,12 @@ set -u
 dir=$1
 shift
 status=0
+rendered=$(mktemp)
+trap 'rm -f "$rendered"' EXIT
 for page in "$@"; do
-  out=$(LC_ALL=C.UTF-8 MANWIDTH=80 man --warnings -l "$dir/$page" 2>&1 >/dev/null)
-  text=$(LC_ALL=C.UTF-8 MANWIDTH=80 man -l "$dir/$page" 2>/dev/null)
+  # One rendering: the page to a file, the formatter's warnings to $out.
+  out=$(LC_ALL=C.UTF-8 MANWIDTH=80 man --warnings -l "$dir/$page" 2>&1 >"$rendered")
+  text=$(cat "$rendered")
   if [ -n "$out" ]; then
     echo "$page: $out" >&2
     status=1

@@ -140,7 +140,7 @@ step "the client service: s2sd --foreground --root $client"
 offset=0 spare=10
 if [ -n "${S2S_DEMO_QUICK:-}" ]; then
   now=$(date +%s)
-  offset=$(((now / 60 + 1) * 60 - 4 - now)) spare=2
+  offset=$(((now / 60 + 1) * 60 - 3 - now)) spare=2
 fi
 S2S_RSYNC_PORT=$port "$s2sd_bin" --foreground --root "$client" \
   --log "$work/s2sd.log" --clock-offset "$offset" &
