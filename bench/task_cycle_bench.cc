@@ -293,17 +293,22 @@ void BM_BareTinyPush(benchmark::State& state) {
   }
 }
 
-// A floor pull, a beacon and a tiny push in turn, so that all three see the
-// same load: the time is the beacon's, "floor_ms" the pull's, "push_ms" the
-// push's, "ratio" and "push_ratio" the beacon's over each. With one
-// iteration per repetition, the median of "ratio" is the median pair's.
+// A floor pull, a beacon, a version query and a tiny push in turn, so that
+// all four see the same load: the time is the beacon's, "floor_ms" the
+// pull's, "push_ms" the push's, "ratio" and "push_ratio" the beacon's over
+// each, "version_ratio" the query's over the pull (a command that writes no
+// registry, so no fsync). With one iteration per repetition, the median of
+// "ratio" is the median pair's.
 void BM_CommandVsFloor(benchmark::State& state) {
   using Clock = std::chrono::steady_clock;
   Bench& b = TheBench();
   if (!b.ok) return state.SkipWithError("no server");
   S2S::Rsyncer r;
   if (r.Initialize(b.app.Info()) != 0) return state.SkipWithError("probe");
-  double command = 0, floor = 0, push = 0;
+  double command = 0, floor = 0, push = 0, version = 0;
+  auto seconds = [](Clock::time_point from, Clock::time_point to) {
+    return std::chrono::duration<double>(to - from).count();
+  };
   for (auto _ : state) {
     auto t0 = Clock::now();
     if (!b.FloorPull()) return state.SkipWithError("pull failed");
@@ -313,17 +318,24 @@ void BM_CommandVsFloor(benchmark::State& state) {
       return state.SkipWithError("beacon failed");
     }
     auto t2 = Clock::now();
-    if (!b.TinyPush()) return state.SkipWithError("push failed");
+    if (r.GetServerVersion() <= 0) {
+      return state.SkipWithError("version query failed");
+    }
     auto t3 = Clock::now();
-    floor += std::chrono::duration<double>(t1 - t0).count();
-    command += std::chrono::duration<double>(t2 - t1).count();
-    push += std::chrono::duration<double>(t3 - t2).count();
-    state.SetIterationTime(std::chrono::duration<double>(t2 - t1).count());
+    if (!b.TinyPush()) return state.SkipWithError("push failed");
+    auto t4 = Clock::now();
+    floor += seconds(t0, t1);
+    command += seconds(t1, t2);
+    version += seconds(t2, t3);
+    push += seconds(t3, t4);
+    state.SetIterationTime(seconds(t1, t2));
   }
   state.counters["floor_ms"] = floor * 1e3 / state.iterations();
   state.counters["push_ms"] = push * 1e3 / state.iterations();
+  state.counters["version_ms"] = version * 1e3 / state.iterations();
   state.counters["ratio"] = command / floor;
   state.counters["push_ratio"] = command / push;
+  state.counters["version_ratio"] = version / floor;
 }
 
 // The CPU time behind a floor pull and behind a beacon, 20 of each per
