@@ -1,6 +1,7 @@
 // s2s-server's administration without a running daemon: the shares of a
 // root, SSH mode's files, and the words of a refused command line.
 #include <pwd.h>
+#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -99,6 +100,7 @@ TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
        {{"share", "remove", "nosuch"}, 1, "no share nosuch"},
        {{"share", "remove", "extra"}, 0, "share: extra removed"},
        {{"share", "move", "docs"}, 2, "share add NAME[=PATH]"},
+       {{"stop"}, 0, "was not running"},
        {{"status", "extra"}, 2, "unexpected arguments to status"},
        {{"reset-pairing"}, 0, "not bound to one client"},
        {{"frobnicate"}, 2, "unknown command frobnicate"},
@@ -116,17 +118,16 @@ TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
       "--daemon --config=" +
           conf + " .\" ssh-ed25519 " + blob + "\n",
       ReadFile(keys));
-  struct stat st;
-  ASSERT_EQ(0, stat(keys.c_str(), &st));
-  EXPECT_EQ(nobody->pw_uid, st.st_uid);
-  EXPECT_EQ(0600u, st.st_mode & 07777);
-  const std::string secrets = root + "/etc/s2s/rsyncd-ssh.secrets";
-  ASSERT_EQ(0, stat(secrets.c_str(), &st));
-  EXPECT_EQ(nobody->pw_uid, st.st_uid);
-  EXPECT_EQ(0600u, st.st_mode & 07777);
-  EXPECT_EQ("nobody:pw-ssh-admin\n", ReadFile(secrets));
-  ASSERT_EQ(0, stat((root + "/volume1/extra").c_str(), &st));
-  EXPECT_EQ(nobody->pw_uid, st.st_uid) << "the added share stays root's";
+  // Files only the user reads, and the added share handed to the user.
+  for (const std::string& path :
+       {keys, root + "/etc/s2s/rsyncd-ssh.secrets", root + "/volume1/extra"}) {
+    struct stat st;
+    ASSERT_EQ(0, stat(path.c_str(), &st)) << path;
+    EXPECT_EQ(nobody->pw_uid, st.st_uid) << path;
+    EXPECT_EQ(S_ISDIR(st.st_mode) ? 0755u : 0600u, st.st_mode & 07777) << path;
+  }
+  EXPECT_EQ("nobody:pw-ssh-admin\n",
+            ReadFile(root + "/etc/s2s/rsyncd-ssh.secrets"));
 
   // What the key's forced command runs, as the user, with rsync's remote
   // shell standing in for the SSH login: a command and its reply.
@@ -145,6 +146,24 @@ TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
                    command, "nobody@localhost::s2scmd/r1", tmp.path() + "/"});
   EXPECT_EQ(0, pull.code) << pull.out << pull.err;
   EXPECT_EQ("status=0\n1", ReadFile(tmp.Sub("r1")).substr(0, 10));
+
+  // A live process that is not this root's daemon, behind its pid file:
+  // stop refuses to signal it and forgets nothing.
+  Child sleeper = s2s_test::Spawn(tmp.path(), {"/bin/sleep", "30"});
+  const std::string pid = root + "/var/run/s2s-rsyncd.pid";
+  const std::string port = root + "/var/run/s2s-rsyncd.port";
+  s2s_test::WriteFile(pid, std::to_string(sleeper.pid) + "\n");
+  s2s_test::WriteFile(port, "873\n");
+  RunCases(tmp, root, {{{"stop"}, 1, "not signalled"}});
+  EXPECT_EQ(0, kill(sleeper.pid, 0)) << "the foreign process was signalled";
+  EXPECT_EQ(std::to_string(sleeper.pid) + "\n873\n",
+            ReadFile(pid) + ReadFile(port));
+  kill(sleeper.pid, SIGKILL);
+  sleeper.Wait();
+  EXPECT_EQ(2, s2s_test::RunProgram(tmp.path(), {S2S_SERVER_PROGRAM, "status"},
+                                    {"S2S_ROOT"})
+                   .code)
+      << "no root given";
 }
 
 }  // namespace

@@ -61,9 +61,9 @@ TEST(ClientOptions, TaskFileKeysThenOptionsOnTop) {
   EXPECT_EQ(7u, t.GetID());
   EXPECT_TRUE(t.GetInfo().GetSyncInfo().UseCompression());
   EXPECT_TRUE(t.GetInfo().GetSyncInfo().UseBlockLevelSync());
-  EXPECT_FALSE(t.GetInfo().GetSyncInfo().UseSSH());
 }
 
+// Names the server would refuse fail here too, before anything is sent.
 TEST(ClientOptions, RefusesBadInputsWithoutEchoingSecrets) {
   s2s_test::TempDir tmp;
   struct Case {
@@ -81,6 +81,10 @@ TEST(ClientOptions, RefusesBadInputsWithoutEchoingSecrets) {
       {"[Task]\n\tcolour=\"red\"\n", {}, "unknown key 'colour'"},
       {"[Task]\n\tcompress=\"maybe\"\n", {}, "'compress'"},
       {"[Other]\n\tname=\"x\"\n", {}, "no [Task] section"},
+      {"", {"--task", "t1 "}, "task name 't1 ' would be refused by the server"},
+      {"",
+       {"--task=t1", "--share=a=b", "--server-ip=127.0.0.1", "--user=s2s"},
+       "share name 'a=b' would be refused by the server"},
   };
   for (const Case& c : cases) {
     std::vector<std::string> args = c.args;
@@ -90,39 +94,13 @@ TEST(ClientOptions, RefusesBadInputsWithoutEchoingSecrets) {
     }
     ClientOptions o;
     std::string error;
-    EXPECT_FALSE(Parse(args, o, error)) << c.error_part;
+    EXPECT_FALSE(Parse(args, o, error) && CheckTaskSpec(o.spec, error))
+        << c.error_part;
     EXPECT_NE(std::string::npos, error.find(c.error_part)) << error;
     EXPECT_EQ(std::string::npos, error.find("hunter2")) << error;
   }
 }
 
-// Names the server would refuse fail here, before anything is sent.
-TEST(ClientOptions, TaskSpecAppliesTheServersNameRules) {
-  struct Case {
-    std::string task;
-    std::string share;
-    const char* says;
-  };
-  const Case cases[] = {
-      {"t1 ", "docs", "task name 't1 '"},
-      {"t1", std::string("do\0cs", 5), "share name"},
-      {"t1", "a=b", "share name 'a=b'"},
-  };
-  for (const Case& c : cases) {
-    TaskSpec spec;
-    spec.name = c.task;
-    spec.shares = {c.share};
-    spec.server_ip = "127.0.0.1";
-    spec.user = "s2s";
-    std::string error;
-    EXPECT_FALSE(CheckTaskSpec(spec, error)) << c.says;
-    EXPECT_TRUE(s2s_test::Has(error, c.says)) << error;
-    EXPECT_TRUE(s2s_test::Has(error, "would be refused by the server"))
-        << error;
-  }
-}
-
-// A readable password file is refused end to end in tools_test.
 TEST(Secret, FirstLineOfTheFileWinsAndTheEnvironmentIsConsumed) {
   s2s_test::TempDir tmp;
   std::string path = tmp.Sub("pw");
@@ -137,8 +115,7 @@ TEST(Secret, FirstLineOfTheFileWinsAndTheEnvironmentIsConsumed) {
   EXPECT_FALSE(ReadPassword(tmp.Sub("empty"), pw, error));
 
   // A file given wins over the variable, which is removed all the same so
-  // that rsync and every other child does not inherit it (read from the
-  // variable alone in tools_test).
+  // that rsync and every other child does not inherit it.
   setenv(kPasswordEnv, "from-env", 1);
   ASSERT_TRUE(ReadPassword(path, pw, error));
   EXPECT_EQ("s3cret-line", pw);

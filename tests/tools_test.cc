@@ -3,9 +3,7 @@
 // checked is what a person sees: exit codes, the copied files, the
 // registry, and that the password shows nowhere.
 #include <dirent.h>
-#include <errno.h>
 #include <fcntl.h>
-#include <poll.h>
 #include <pwd.h>
 #include <signal.h>
 #include <stdio.h>
@@ -13,7 +11,6 @@
 #include <sys/file.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -26,20 +23,19 @@
 #include <vector>
 
 #include "S2S/is_syncedshare.h"
-#include "S2S/s2s_host.h"
 #include "gtest/gtest.h"
 #include "service/exit_codes.h"
 #include "testutil.h"
 
 namespace {
 
+using s2s_test::Child;
+using s2s_test::Has;
 using s2s_test::ReadFile;
 using s2s_test::WriteFile;
 using namespace s2s_service;
 
 const char kPassword[] = "pw-Tq83-never-shown";
-
-using s2s_test::Child;
 
 // The programs run without the test's own root, password and port.
 Child Spawn(const std::string& dir, const std::vector<std::string>& argv,
@@ -53,6 +49,13 @@ Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
   Child c = Spawn(dir, argv, env);
   c.Wait();
   return c;
+}
+
+// The port a started server's last word names.
+std::string PortOf(const Child& start) {
+  std::string port = start.out.substr(start.out.rfind(' ') + 1);
+  port.pop_back();  // the line break
+  return port;
 }
 
 // The /proc/<pid>/`file` of every process now, by pid.
@@ -88,16 +91,6 @@ std::vector<std::pair<pid_t, pid_t>> RsyncChildren(pid_t parent) {
   return out;
 }
 
-// Whether process `pid` (not necessarily ours) ends within `seconds`.
-bool EndsWithin(pid_t pid, int seconds) {
-  int fd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
-  if (fd < 0) return errno == ESRCH;
-  pollfd ended = {fd, POLLIN, 0};
-  bool ok = poll(&ended, 1, seconds * 1000) == 1;
-  close(fd);
-  return ok;
-}
-
 // A file of `mb` megabytes that neither compresses nor repeats itself, so
 // that a delta transfer finds no block of it anywhere but in its own copy.
 void WriteBlob(const std::string& path, int mb) {
@@ -123,18 +116,6 @@ double SentBytes(const std::string& out) {
   return v * (unit[0] == 'K' ? 1 << 10 : unit[0] == 'M' ? 1 << 20 : 1);
 }
 
-// Whether the lock file `path` can be taken within `seconds`, that is,
-// every process holding it (inherited descriptors too) is gone. It is
-// released again before returning.
-bool LockFreedWithin(const std::string& path, int seconds) {
-  int fd = open(path.c_str(), O_RDWR | O_CLOEXEC);
-  bool free = fd >= 0 &&
-              s2s_test::WaitUntil(
-                  [&] { return flock(fd, LOCK_EX | LOCK_NB) == 0; }, seconds);
-  if (fd >= 0) close(fd);
-  return free;
-}
-
 class ToolsTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -142,23 +123,43 @@ class ToolsTest : public ::testing::Test {
     pw_file_ = tmp_.Sub("password");
     ASSERT_TRUE(WriteFile(pw_file_, std::string(kPassword) + "\n"));
     chmod(pw_file_.c_str(), 0600);
-    Child init =
-        RunProgram(tmp_.path(), {S2S_SERVER_PROGRAM, "--root", server_, "init",
-                                 "--share", "docs", "--share", "big", "--user",
-                                 "s2s", "--password-file", pw_file_});
+    Child init = Server({"init", "--share", "docs", "--share", "big", "--user",
+                         "s2s", "--password-file", pw_file_});
     ASSERT_EQ(0, init.code) << init.err;
-    Child start = RunProgram(tmp_.path(),
-                             {S2S_SERVER_PROGRAM, "--root", server_, "start"});
+    Child start = Server({"start"});
     ASSERT_EQ(0, start.code) << start.err;
-    port_ = start.out.substr(start.out.rfind(' ') + 1);
-    port_.pop_back();  // the line break
+    port_ = PortOf(start);
   }
 
   void TearDown() override {
-    Child stop = RunProgram(tmp_.path(),
-                            {S2S_SERVER_PROGRAM, "--root", server_, "stop"});
+    Child stop = Server({"stop"});
     EXPECT_EQ(0, stop.code) << stop.err;
-    EXPECT_NE(std::string::npos, stop.out.find("stopped")) << stop.out;
+    EXPECT_TRUE(Has(stop.out, "stopped")) << stop.out;
+  }
+
+  std::vector<std::string> ServerArgv(std::vector<std::string> words) {
+    words.insert(words.begin(), {S2S_SERVER_PROGRAM, "--root", server_});
+    return words;
+  }
+
+  Child Server(const std::vector<std::string>& words) {
+    return RunProgram(tmp_.path(), ServerArgv(words));
+  }
+
+  // A row: a command line, its exit code, and what its output says.
+  struct Run {
+    std::vector<std::string> argv;
+    int code;
+    std::string says;
+  };
+
+  void ExpectRuns(const std::vector<Run>& runs) {
+    for (const Run& run : runs) {
+      Child r = RunProgram(tmp_.path(), run.argv);
+      SCOPED_TRACE(run.argv.back() + "\n" + r.out + r.err);
+      EXPECT_EQ(run.code, r.code);
+      EXPECT_TRUE(Has(r.out + r.err, run.says));
+    }
   }
 
   // A client root with serial `serial`, made by `s2s-client init` alone,
@@ -191,11 +192,22 @@ class ToolsTest : public ::testing::Test {
     return argv;
   }
 
+  Child Sync(const std::string& root, const std::string& share,
+             const std::vector<std::string>& more = {}) {
+    return RunProgram(tmp_.path(), Client(root, share, more));
+  }
+
   std::string ShareKey(const std::string& share, const char* key) {
     s2s_test::ScopedEnv root("S2S_ROOT", server_);
     char buf[256] = "";
     S2SServerGetShare(share.c_str(), key, buf, sizeof buf);
     return buf;
+  }
+
+  // Every one of `says` is in `out`.
+  static void ExpectSays(const std::string& out,
+                         std::initializer_list<const char*> says) {
+    for (const char* s : says) EXPECT_TRUE(Has(out, s)) << s << "\n" << out;
   }
 
   s2s_test::TempDir tmp_;
@@ -240,15 +252,11 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   ASSERT_EQ(0, init.code) << init.out << init.err;
   Child start = as_user({"start"});
   ASSERT_EQ(0, start.code) << start.out << start.err;
-  std::string port = start.out.substr(start.out.rfind(' ') + 1);
-  port.pop_back();
 
   std::string client = MakeClient("client", "CLIENT-A");
   ASSERT_EQ(
       0, symlink("sub/deeper/b.txt", (client + "/volume1/docs/link").c_str()));
-  std::vector<std::string> argv = Client(client, "docs");
-  argv[3] = "--port=" + port;
-  Child c = RunProgram(tmp_.path(), argv);
+  Child c = Sync(client, "docs", {"--port", PortOf(start)});
   EXPECT_EQ(kExitOk, c.code) << c.out << c.err;
   struct stat st;
   ASSERT_EQ(0, lstat((root + "/volume1/docs/link").c_str(), &st));
@@ -258,81 +266,78 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   EXPECT_EQ(0, stop.code) << stop.out << stop.err;
 }
 
-// A task file run with a beacon due at every poll: the beacons' own rsync
-// runs nest inside the transfer's wait without disturbing it.
-TEST_F(ToolsTest, TaskFileRunWithBeaconsDuringTheTransfer) {
+// One client's round on a running server. Its first sync takes the password
+// from the environment with every log line on, and no process's command
+// line, no output and no log shows it. Then the failures' exit codes, a dry
+// run that changes nothing, and what an operator does: a share added is
+// synced at once (a sparse disk image stays sparse), a stuck sync and a
+// pairing bound to one client are cleared, and the exit code of status says
+// whether the daemon runs.
+TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
   std::string client = MakeClient("client", "CLIENT-A");
-  WriteBlob(client + "/volume1/big/blob", 8);
-  std::string task = tmp_.Sub("t.task");
-  WriteFile(task,
-            "[Task]\n\tname=\"filetask\"\n\tserver_ip=\"127.0.0.1\"\n"
-            "\tuser=\"s2s\"\n\tshares=\"docs:big\"\n\tport=\"" +
-                port_ + "\"\n\tpassword_file=\"" + pw_file_ + "\"\n");
-  // Two seconds of transfer: time for beacons while it runs.
-  Child c = RunProgram(
-      tmp_.path(), {S2S_CLIENT_PROGRAM, "--root", client, "--task-file", task,
-                    "--beacon-interval", "0", "--max-bandwidth", "4096"});
-  ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
-  EXPECT_NE(std::string::npos, c.out.find("beacon: transfer running")) << c.out;
-  EXPECT_NE(std::string::npos, c.out.find("2/2 shares synced")) << c.out;
-  EXPECT_EQ(8u << 20,
-            std::filesystem::file_size(server_ + "/volume1/big/blob"));
-  Child status = RunProgram(tmp_.path(),
-                            {S2S_SERVER_PROGRAM, "--root", server_, "status"});
-  EXPECT_NE(std::string::npos, status.out.find("task  filetask         idle"))
-      << status.out;
-}
+  std::vector<std::string> argv = Client(client, "docs", {"-v", "-v"});
+  argv.erase(argv.end() - 3);  // --password-file=FILE
+  Child c =
+      Spawn(tmp_.path(), argv, {std::string("S2S_PASSWORD=") + kPassword});
+  int rsync_seen = 0;
+  bool environ_clean = true;
+  siginfo_t ended = {};
+  std::string environ_path = "/proc/" + std::to_string(c.pid) + "/environ";
+  // Until it has ended, leaving it to be reaped by Wait.
+  while (waitid(P_PID, c.pid, &ended, WEXITED | WNOHANG | WNOWAIT) == 0 &&
+         ended.si_pid == 0) {
+    for (auto& [pid, cmd] : AllProcs("cmdline")) {
+      std::replace(cmd.begin(), cmd.end(), '\0', ' ');
+      EXPECT_EQ(std::string::npos, cmd.find(kPassword)) << cmd;
+      if (cmd.find("rsync") == 0 &&
+          cmd.find(":" + port_) != std::string::npos) {
+        ++rsync_seen;
+        // Past reading the password, the client's own environment block
+        // no longer holds it.
+        environ_clean =
+            environ_clean && !Has(ReadFile(environ_path), kPassword);
+      }
+    }
+  }
+  EXPECT_TRUE(environ_clean) << "the password stayed in " << environ_path;
+  ASSERT_EQ(kExitOk, c.Wait()) << c.out << c.err;
+  EXPECT_GT(rsync_seen, 0) << "the scan saw none of the client's rsync runs";
+  ExpectSays(c.err, {"[INFO]", "karorsync"});
+  for (const std::string& text :
+       {c.out, c.err, ReadFile(server_ + "/var/log/s2s/rsyncd.log"),
+        ReadFile(server_ + "/etc/s2s/rsyncd.conf")}) {
+    EXPECT_FALSE(Has(text, kPassword)) << text;
+  }
+  // rsync's progress and its --stats: both files, 6 + 20 bytes of data.
+  ExpectSays(c.out, {"share docs: finished", "1/1 shares synced",
+                     "files checked", "2 files and 26 B sent, 0 deleted"});
+  EXPECT_EQ("", ShareKey("docs", "RunningID"));
 
-TEST_F(ToolsTest, ExitCodesNameTheFailedStage) {
-  std::string client = MakeClient("client", "CLIENT-A");
   std::string other = MakeClient("other", "CLIENT-B");
-  int free_port = s2s_test::FreeLoopbackPort();
-  std::string wrong_pw = tmp_.Sub("wrong");
+  const std::string wrong_pw = tmp_.Sub("wrong"), open_pw = tmp_.Sub("open");
+  const std::string fifo_pw = tmp_.Sub("fifo");
   WriteFile(wrong_pw, "not-the-password\n");
+  WriteFile(open_pw, kPassword);
   chmod(wrong_pw.c_str(), 0600);
-  std::string open_pw = tmp_.Sub("open");
-  WriteFile(open_pw, std::string(kPassword) + "\n");
   chmod(open_pw.c_str(), 0644);
-  std::string fifo_pw = tmp_.Sub("fifo");
   ASSERT_EQ(0, mkfifo(fifo_pw.c_str(), 0600));
-
-  ASSERT_EQ(kExitOk, RunProgram(tmp_.path(), Client(client, "docs")).code);
-  struct Case {
-    std::string what;
-    std::vector<std::string> argv;
-    int code;
-    std::string says;
-  };
-  const Case cases[] = {
-      {"nothing listens",
-       Client(client, "docs", {"--port", std::to_string(free_port)}),
+  ExpectRuns({
+      {Client(client, "docs",
+              {"--port", std::to_string(s2s_test::FreeLoopbackPort())}),
        kExitUnreachable, "unreachable"},
       // rsync's own words, not only its exit code.
-      {"wrong password", Client(client, "docs", {"--password-file", wrong_pw}),
-       kExitUnreachable, "auth failed"},
+      {Client(client, "docs", {"--password-file", wrong_pw}), kExitUnreachable,
+       "auth failed"},
       // A second client with another serial may not feed the same share.
-      {"pairing conflict", Client(other, "docs"), kExitPairing,
+      {Client(other, "docs"), kExitPairing,
        "shares fed by another client: docs"},
-      {"unknown share", Client(client, "nosuch"), kExitUsage, "no local share"},
-      // Refused before any data moves, in the server's own words.
-      {"task name the server refuses",
-       Client(client, "docs", {"--task", "t1 "}), kExitUsage,
-       "would be refused by the server"},
-      {"readable password file",
-       Client(client, "docs", {"--password-file", open_pw}), kExitUsage,
+      {Client(client, "nosuch"), kExitUsage, "no local share"},
+      {Client(client, "docs", {"--password-file", open_pw}), kExitUsage,
        "0600"},
       // Refused at once: no writer ever opens it.
-      {"password file is a FIFO",
-       Client(client, "docs", {"--password-file", fifo_pw}), kExitUsage,
+      {Client(client, "docs", {"--password-file", fifo_pw}), kExitUsage,
        "not a regular file"},
-  };
-  for (const Case& c : cases) {
-    Child r = RunProgram(tmp_.path(), c.argv);
-    EXPECT_EQ(c.code, r.code) << c.what << "\n" << r.out << r.err;
-    EXPECT_NE(std::string::npos, (r.out + r.err).find(c.says))
-        << c.what << "\n"
-        << r.out << r.err;
-  }
+  });
   // The conflict left the first client's copy and record alone.
   EXPECT_EQ("bravo from CLIENT-A\n",
             ReadFile(server_ + "/volume1/docs/sub/deeper/b.txt"));
@@ -344,95 +349,36 @@ TEST_F(ToolsTest, ExitCodesNameTheFailedStage) {
   std::filesystem::remove(client + "/volume1/docs/a.txt");
   const std::string registry = server_ + "/usr/karo/etc/karoS2S.info";
   const std::string before = ReadFile(registry);
-  Child dry = RunProgram(tmp_.path(), Client(client, "docs", {"--dry-run"}));
+  Child dry = Sync(client, "docs", {"--dry-run"});
   ASSERT_EQ(kExitOk, dry.code) << dry.out << dry.err;
-  for (const char* says :
-       {"share docs: would send 1, delete 1", "    + new.txt\n",
-        "    - a.txt\n", "1/1 shares checked (dry run)"}) {
-    EXPECT_TRUE(s2s_test::Has(dry.out, says)) << says << "\n" << dry.out;
-  }
+  ExpectSays(dry.out, {"share docs: would send 1, delete 1", "    + new.txt\n",
+                       "    - a.txt\n", "1/1 shares checked (dry run)"});
   EXPECT_EQ(before, ReadFile(registry));
   EXPECT_EQ("alpha\n", ReadFile(server_ + "/volume1/docs/a.txt"));
   EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/docs/new.txt"));
-}
 
-TEST_F(ToolsTest, PasswordNeverOnACommandLineOrInTheLogs) {
-  std::string client = MakeClient("client", "CLIENT-A");
-  // From the environment this time, with every log line switched on.
-  std::vector<std::string> argv = Client(client, "docs", {"-v", "-v"});
-  argv.erase(argv.end() - 3);  // --password-file=FILE
-  Child c =
-      Spawn(tmp_.path(), argv, {std::string("S2S_PASSWORD=") + kPassword});
-  int rsync_seen = 0;
-  bool environ_clean = true;
-  int st = 0;
-  std::string environ_path = "/proc/" + std::to_string(c.pid) + "/environ";
-  while (waitpid(c.pid, &st, WNOHANG) == 0) {
-    for (auto& [pid, cmd] : AllProcs("cmdline")) {
-      std::replace(cmd.begin(), cmd.end(), '\0', ' ');
-      EXPECT_EQ(std::string::npos, cmd.find(kPassword)) << cmd;
-      if (cmd.find("rsync") == 0 &&
-          cmd.find(":" + port_) != std::string::npos) {
-        ++rsync_seen;
-        // Past reading the password, the client's own environment block
-        // no longer holds it.
-        environ_clean =
-            environ_clean && !s2s_test::Has(ReadFile(environ_path), kPassword);
-      }
-    }
-  }
-  EXPECT_TRUE(environ_clean) << "the password stayed in " << environ_path;
-  c.out = ReadFile(c.out_path);
-  c.err = ReadFile(c.err_path);
-  ASSERT_TRUE(WIFEXITED(st) && WEXITSTATUS(st) == kExitOk) << c.out << c.err;
-  EXPECT_GT(rsync_seen, 0) << "the scan saw none of the client's rsync runs";
-  EXPECT_NE(std::string::npos, c.err.find("[INFO]")) << "not verbose?";
-  EXPECT_NE(std::string::npos, c.err.find("karorsync")) << "no rsync output";
-  EXPECT_EQ(std::string::npos, c.out.find(kPassword));
-  EXPECT_EQ(std::string::npos, c.err.find(kPassword));
-  EXPECT_EQ(std::string::npos,
-            ReadFile(server_ + "/var/log/s2s/rsyncd.log").find(kPassword));
-  EXPECT_EQ(std::string::npos,
-            ReadFile(server_ + "/etc/s2s/rsyncd.conf").find(kPassword));
-}
-
-// A sync and what the server records of it; then what an operator does to
-// a server that runs: a share added is synced at once, a stuck sync and a
-// pairing bound to one client are cleared, and the exit code of status says
-// whether the daemon runs.
-TEST_F(ToolsTest, SyncsAShareAndOperatorCommandsOnARunningServer) {
-  std::string client = MakeClient("client", "CLIENT-A");
-  Child c = RunProgram(tmp_.path(), Client(client, "docs"));
-  ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
-  EXPECT_EQ("bravo from CLIENT-A\n",
-            ReadFile(server_ + "/volume1/docs/sub/deeper/b.txt"));
-  // rsync's progress and its --stats: both files, 6 + 20 bytes of data.
-  for (const char* says :
-       {"share docs: finished", "1/1 shares synced", "files checked",
-        "2 files and 26 B sent, 0 deleted"}) {
-    EXPECT_TRUE(s2s_test::Has(c.out, says)) << says << "\n" << c.out;
-  }
-  EXPECT_EQ("CLIENT-A", ShareKey("docs", "CompleteID"));
-  EXPECT_EQ("", ShareKey("docs", "RunningID"));
-
-  auto server = [&](std::vector<std::string> words) {
-    words.insert(words.begin(), {S2S_SERVER_PROGRAM, "--root", server_});
-    return RunProgram(tmp_.path(), words);
-  };
   std::string extra = tmp_.Sub("extra");
-  Child add = server({"share", "add", "extra=" + extra});
-  ASSERT_EQ(0, add.code) << add.err;
-  EXPECT_NE(std::string::npos, add.out.find("configuration rewritten"));
-  std::string other = tmp_.Sub("other");
+  ExpectRuns({{ServerArgv({"share", "add", "extra=" + extra}), 0,
+               "configuration rewritten"}});
+  std::string on_root = tmp_.Sub("on-root-fs/extra");
   ASSERT_EQ(
-      0, RunProgram(tmp_.path(), {S2S_CLIENT_PROGRAM, "--root", other, "init",
-                                  "--serial", "CLIENT-A", "--share",
-                                  "extra=" + tmp_.Sub("on-root-fs/extra")})
+      0, RunProgram(tmp_.path(), {S2S_CLIENT_PROGRAM, "--root",
+                                  tmp_.Sub("extraclient"), "init", "--serial",
+                                  "CLIENT-A", "--share", "extra=" + on_root})
              .code);
-  WriteFile(tmp_.Sub("on-root-fs/extra/new.txt"), "new share\n");
-  Child sync = RunProgram(tmp_.path(), Client(other, "extra"));
+  WriteFile(on_root + "/new.txt", "new share\n");
+  // A disk image of 64 MiB holding 1 MiB of data takes about 1 MiB on the
+  // server too, not 64 MiB of zeros.
+  WriteFile(on_root + "/disk.img", std::string(1 << 20, 'd'));
+  std::filesystem::resize_file(on_root + "/disk.img", 64 << 20);
+  Child sync = Sync(tmp_.Sub("extraclient"), "extra");
   ASSERT_EQ(kExitOk, sync.code) << sync.out << sync.err;
   EXPECT_EQ("new share\n", ReadFile(extra + "/new.txt"));
+  struct stat image;
+  ASSERT_EQ(0, stat((extra + "/disk.img").c_str(), &image));
+  EXPECT_EQ(64 << 20, image.st_size);
+  // Data plus the file system's own rounding.
+  EXPECT_LE(image.st_blocks * 512, 2ll << 20) << image.st_blocks;
 
   {
     s2s_test::ScopedEnv root("S2S_ROOT", server_);
@@ -442,108 +388,32 @@ TEST_F(ToolsTest, SyncsAShareAndOperatorCommandsOnARunningServer) {
     KLIBCSzHashFree(stuck);
     ASSERT_EQ(0, KAROUISetS2S(1, "OLD-1", "oldname"));
   }
-  struct Case {
-    std::vector<std::string> words;
-    int code;
-    std::string says;
-  };
-  const Case cases[] = {
-      {{"status"}, 0, "service:  running"},
-      {{"status"}, 0, "last completed by CLIENT-A"},
-      {{"status"}, 0, "task  t1"},
-      {{"release", "docs"}, 0, "released from the sync of client GONE-1"},
-      {{"release", "nosuch"}, 1, "no share nosuch"},
-      {{"status"}, 0, "paired:   client OLD-1"},
-      {{"reset-pairing"}, 0, "client OLD-1 forgotten"},
-      {{"status"}, 0, "paired:   open to several clients"},
-      {{"pairings"}, 0, "clientID=\"(open to several clients)\""},
-      {{"stop"}, 0, "stopped"},
-      {{"status"}, 3, "daemon:   not running"},
-      {{"status", "--json"}, 3, "\"daemon\": {\"running\": false"},
-      {{"pairings", "--json"}, 3, "\"SHARE_extra\": {"},
-      {{"start"}, 0, "daemon: pid"},
-  };
-  for (const Case& c : cases) {
-    Child r = server(c.words);
-    EXPECT_EQ(c.code, r.code) << c.words[0] << "\n" << r.out << r.err;
-    EXPECT_NE(std::string::npos, (r.out + r.err).find(c.says))
-        << c.words[0] << "\n"
-        << r.out << r.err;
-  }
+  ExpectRuns({
+      {ServerArgv({"status"}), 0, "service:  running"},
+      {ServerArgv({"status"}), 0, "last completed by CLIENT-A"},
+      {ServerArgv({"status"}), 0, "task  t1"},
+      {ServerArgv({"release", "docs"}), 0,
+       "released from the sync of client GONE-1"},
+      {ServerArgv({"release", "nosuch"}), 1, "no share nosuch"},
+      {ServerArgv({"status"}), 0, "paired:   client OLD-1"},
+      {ServerArgv({"reset-pairing"}), 0, "client OLD-1 forgotten"},
+      {ServerArgv({"status"}), 0, "paired:   open to several clients"},
+      {ServerArgv({"pairings"}), 0, "clientID=\"(open to several clients)\""},
+      {ServerArgv({"stop"}), 0, "stopped"},
+      {ServerArgv({"status"}), 3, "daemon:   not running"},
+      {ServerArgv({"status", "--json"}), 3, "\"daemon\": {\"running\": false"},
+      {ServerArgv({"pairings", "--json"}), 3, "\"SHARE_extra\": {"},
+      {ServerArgv({"start"}), 0, "daemon: pid"},
+  });
   EXPECT_EQ("", ShareKey("docs", "RunningID"));
 }
 
-TEST_F(ToolsTest, SigtermCancelsARunningTransfer) {
-  std::string client = MakeClient("client", "CLIENT-A");
-  // At 1 MiB/s the transfer is still running when the signal comes.
-  WriteBlob(client + "/volume1/big/blob", 8);
-  Child c =
-      Spawn(tmp_.path(), Client(client, "big", {"--max-bandwidth", "1024"}));
-  // This client's own transfer, not a command before it: tests running
-  // beside it push shares of the same name.
-  ASSERT_TRUE(s2s_test::WaitUntil(
-      [&] {
-        for (const auto& r : RsyncChildren(c.pid)) {
-          if (s2s_test::Has(
-                  ReadFile("/proc/" + std::to_string(r.first) + "/cmdline"),
-                  "/volume1/big")) {
-            return true;
-          }
-        }
-        return false;
-      },
-      20))
-      << "the transfer was never seen";
-  kill(c.pid, SIGTERM);
-  EXPECT_EQ(kExitCancelled, c.Wait()) << c.out << c.err;
-  EXPECT_NE(std::string::npos, c.out.find("cancelled")) << c.out;
-  // The task is recorded as idle again; the share's sync stays unfinished.
-  EXPECT_NE(std::string::npos, c.out.find("task t1: finished")) << c.out;
-  EXPECT_EQ("CLIENT-A", ShareKey("big", "RunningID"));
-}
-
-// A disk image of 64 MiB holding 1 MiB of data takes about 1 MiB on the
-// server too, not 64 MiB of zeros. Then the server's copy of "big" on a
-// 2 MiB filesystem of its own: the client says what rsync said on the far
-// side.
-TEST_F(ToolsTest, SparseFilesStaySparseAndAFullServerDiskIsNamed) {
-  std::string client = MakeClient("client", "CLIENT-A");
-  std::string image = client + "/volume1/docs/disk.img";
-  {
-    std::ofstream out(image, std::ios::binary);
-    out.seekp(32 << 20);
-    out << std::string(1 << 20, 'd');
-  }
-  std::filesystem::resize_file(image, 64 << 20);
-  Child c = RunProgram(tmp_.path(), Client(client, "docs"));
-  ASSERT_EQ(kExitOk, c.code) << c.out << c.err;
-  struct stat st;
-  ASSERT_EQ(0, stat((server_ + "/volume1/docs/disk.img").c_str(), &st));
-  EXPECT_EQ(64 << 20, st.st_size);
-  // Data plus the file system's own rounding.
-  EXPECT_LE(st.st_blocks * 512, 2ll << 20) << st.st_blocks;
-
-  WriteBlob(client + "/volume1/big/blob", 8);
-  std::string share = server_ + "/volume1/big";
-  ASSERT_EQ(0, stat(share.c_str(), &st));
-  char options[128];
-  snprintf(options, sizeof options, "size=2m,mode=%o,uid=%u,gid=%u",
-           st.st_mode & 07777, st.st_uid, st.st_gid);
-  if (mount("s2s-full", share.c_str(), "tmpfs", 0, options) != 0) {
-    GTEST_SKIP() << "cannot mount a small filesystem on the server share: "
-                 << strerror(errno);
-  }
-  Child full = RunProgram(tmp_.path(), Client(client, "big"));
-  umount2(share.c_str(), MNT_DETACH);
-  EXPECT_EQ(kExitShare, full.code) << full.out << full.err;
-  EXPECT_TRUE(s2s_test::Has(full.out, "share big: transfer failed: "))
-      << full.out;
-  EXPECT_TRUE(s2s_test::Has(full.out, "No space left on device")) << full.out;
-}
-
-// A large file's transfer cut past half way: the next run sends only what
-// had not arrived, from the part the server kept.
-TEST_F(ToolsTest, ACutTransferResumesFromWhatArrived) {
+// A large file's transfer cut by SIGTERM past half way: the client says so,
+// records the task idle again and leaves the share's sync unfinished; the
+// next run sends only what had not arrived, from the part the server kept.
+// Then the delete guard, and the server's copy on a 2 MiB filesystem of its
+// own: the client says what rsync said on the far side.
+TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
   std::string client = MakeClient("client", "CLIENT-A");
   const double kSize = 24 << 20;
   WriteBlob(client + "/volume1/big/blob", 24);
@@ -567,50 +437,63 @@ TEST_F(ToolsTest, ACutTransferResumesFromWhatArrived) {
   kill(c.pid, SIGTERM);
   ASSERT_TRUE(past_half) << "the transfer was never seen half done";
   ASSERT_EQ(kExitCancelled, c.Wait()) << c.out << c.err;
+  ExpectSays(c.out, {"cancelled", "task t1: finished"});
+  EXPECT_EQ("CLIENT-A", ShareKey("big", "RunningID"));
   // The daemon's side keeps the part once its connection has ended.
   const std::string part = share + "/.s2s-partial/blob";
   ASSERT_TRUE(
       s2s_test::WaitUntil([&] { return std::filesystem::exists(part); }, 30));
-  Child next = RunProgram(tmp_.path(), Client(client, "big"));
+  Child next = Sync(client, "big");
   ASSERT_EQ(kExitOk, next.code) << next.out << next.err;
   EXPECT_GT(SentBytes(next.out), 0) << next.out;
   EXPECT_LT(SentBytes(next.out), kSize / 2) << next.out;
   EXPECT_EQ(kSize, std::filesystem::file_size(share + "/blob"));
   EXPECT_FALSE(std::filesystem::exists(share + "/.s2s-partial"));
-}
 
-// A client share emptied (its disk not mounted) but for one new file: the
-// new file arrives, nothing is deleted, the refusal names the share and the
-// counts; a confirmed run then deletes.
-TEST_F(ToolsTest, TheDeleteGuardHoldsBackAMassDeletionUntilConfirmed) {
-  std::string client = MakeClient("client", "CLIENT-A");
-  const std::string big = client + "/volume1/big";
-  for (const char* f : {"f1", "f2", "f3", "f4"}) WriteFile(big + "/" + f, f);
-  ASSERT_EQ(kExitOk, RunProgram(tmp_.path(), Client(client, "big")).code);
-  std::filesystem::remove_all(big);
-  std::filesystem::create_directories(big);
-  WriteFile(big + "/new", "new\n");
-  Child held = RunProgram(tmp_.path(), Client(client, "big"));
+  // The client's share emptied (its disk not mounted) but for one changed
+  // file: that file arrives, nothing is deleted, the refusal names the share
+  // and the counts; a confirmed run then deletes.
+  const std::string mine = client + "/volume1/big";
+  for (const char* f : {"f1", "f2", "f3", "f4"}) WriteFile(mine + "/" + f, f);
+  ASSERT_EQ(kExitOk, Sync(client, "big").code);
+  std::filesystem::remove_all(mine);
+  std::filesystem::create_directories(mine);
+  WriteBlob(mine + "/blob", 3);
+  Child held = Sync(client, "big");
   EXPECT_EQ(kExitDeletions, held.code) << held.out << held.err;
-  EXPECT_TRUE(s2s_test::Has(held.out,
-                            "share big: deletions held back: 4 of 5 entries "
-                            "on the server would be deleted, more than the "
-                            "guard allows (2)"))
+  EXPECT_TRUE(Has(held.out,
+                  "share big: deletions held back: 4 of 6 entries on the "
+                  "server would be deleted, more than the guard allows (3)"))
       << held.out;
-  EXPECT_EQ("new\n", ReadFile(server_ + "/volume1/big/new"));
-  EXPECT_EQ("f1", ReadFile(server_ + "/volume1/big/f1"));
+  EXPECT_EQ(3u << 20, std::filesystem::file_size(share + "/blob"));
+  EXPECT_EQ("f1", ReadFile(share + "/f1"));
 
-  Child confirmed =
-      RunProgram(tmp_.path(), Client(client, "big", {"--confirm-deletions"}));
+  Child confirmed = Sync(client, "big", {"--confirm-deletions"});
   EXPECT_EQ(kExitOk, confirmed.code) << confirmed.out << confirmed.err;
-  EXPECT_TRUE(s2s_test::Has(confirmed.out, "4 deleted")) << confirmed.out;
-  EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/big/f1"));
+  EXPECT_TRUE(Has(confirmed.out, "4 deleted")) << confirmed.out;
+  EXPECT_FALSE(std::filesystem::exists(share + "/f1"));
+
+  struct stat st;
+  ASSERT_EQ(0, stat(share.c_str(), &st));
+  char options[128];
+  snprintf(options, sizeof options, "size=2m,mode=%o,uid=%u,gid=%u",
+           st.st_mode & 07777, st.st_uid, st.st_gid);
+  if (mount("s2s-full", share.c_str(), "tmpfs", 0, options) != 0) {
+    GTEST_SKIP() << "cannot mount a small filesystem on the server share: "
+                 << strerror(errno);
+  }
+  Child full = Sync(client, "big");
+  umount2(share.c_str(), MNT_DETACH);
+  EXPECT_EQ(kExitShare, full.code) << full.out << full.err;
+  ExpectSays(full.out,
+             {"share big: transfer failed: ", "No space left on device"});
 }
 
 // kill -9 of the client while it transfers and a beacon's command is in
 // flight: a second run of the task is refused while the first holds the
-// task's lock, the killed client's rsync runs end with it (the server gets
-// no file), and the next run clears what the killed one left behind.
+// task's lock; the killed client's rsync runs (they hold the lock too) end
+// with it and the server gets no file; the next run clears what the killed
+// one left behind.
 TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
   std::string client = MakeClient("client", "CLIENT-A");
   WriteBlob(client + "/volume1/big/blob", 16);
@@ -631,72 +514,39 @@ TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
     EXPECT_EQ(r.first, r.second) << "rsync is not in a session of its own";
   }
 
-  Child again = RunProgram(tmp_.path(), Client(client, "docs"));
+  Child again = Sync(client, "docs");
   EXPECT_EQ(kExitBusy, again.code) << again.out << again.err;
-  EXPECT_TRUE(s2s_test::Has(again.err, "is running already")) << again.err;
+  EXPECT_TRUE(Has(again.err, "is running already")) << again.err;
 
   kill(c.pid, SIGKILL);
   EXPECT_EQ(128 + SIGKILL, c.Wait());
-  for (const auto& r : rsyncs) EXPECT_TRUE(EndsWithin(r.first, 30));
-  // Whatever else the killed run started (the next beacon, rsync's own
-  // helpers) inherited the task's lock and dies with it too.
-  EXPECT_TRUE(LockFreedWithin(client + "/run/lock/s2s-task-1.lock", 30));
+  int lock = open((client + "/run/lock/s2s-task-1.lock").c_str(), O_RDONLY);
+  EXPECT_TRUE(s2s_test::WaitUntil(
+      [&] { return flock(lock, LOCK_EX | LOCK_NB) == 0; }, 30));
+  close(lock);
   EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/big/blob"));
   std::string tmp = client + "/tmp/S2S";
   ASSERT_FALSE(std::filesystem::is_empty(tmp)) << "no command was running";
 
-  Child next = RunProgram(tmp_.path(), Client(client, "docs"));
-  EXPECT_EQ(kExitOk, next.code) << next.out << next.err;
+  // The next run, from a task file with a beacon due at every poll: the
+  // beacons' own rsync runs nest inside the transfer's wait without
+  // disturbing it.
+  std::string task = tmp_.Sub("t.task");
+  WriteFile(task,
+            "[Task]\n\tname=\"filetask\"\n\tserver_ip=\"127.0.0.1\"\n"
+            "\tuser=\"s2s\"\n\tshares=\"docs:big\"\n\tport=\"" +
+                port_ + "\"\n\tpassword_file=\"" + pw_file_ + "\"\n");
+  Child next = RunProgram(
+      tmp_.path(), {S2S_CLIENT_PROGRAM, "--root", client, "--task-file", task,
+                    "--beacon-interval", "0", "--max-bandwidth", "8192"});
+  ASSERT_EQ(kExitOk, next.code) << next.out << next.err;
+  ExpectSays(next.out, {"beacon: transfer running", "2/2 shares synced"});
+  EXPECT_EQ(16u << 20,
+            std::filesystem::file_size(server_ + "/volume1/big/blob"));
+  EXPECT_TRUE(Has(Server({"status"}).out, "task  filetask         idle"));
   for (const auto& e : std::filesystem::directory_iterator(tmp)) {
     ADD_FAILURE() << "left behind: " << e.path();
   }
-}
-
-// The platform's service "s2s_daemon" runs the client service s2sd, which
-// stays up until the service is paused and then ends well.
-TEST(ToolsPrograms, TheClientServiceRunsAsThePlatformService) {
-  s2s_test::TempRoot root;
-  ASSERT_TRUE(root.Write(
-      "/etc/s2s/platform.conf",
-      std::string("[Platform]\n\tdaemon_program=\"") + S2SD_PROGRAM + "\"\n"));
-  ASSERT_EQ(0, S2S::StartDaemon());
-  std::string pid_file = root.Path("/run/s2s/s2sd.pid");
-  EXPECT_TRUE(
-      s2s_test::WaitUntil([&] { return !ReadFile(pid_file).empty(); }, 5))
-      << "s2sd did not start";
-  EXPECT_TRUE(S2S::IsDaemonRunning());
-  EXPECT_EQ(0, S2S::StopDaemon());
-  EXPECT_FALSE(S2S::IsDaemonRunning());
-  EXPECT_TRUE(ReadFile(pid_file).empty()) << "s2sd left its pid file";
-}
-
-TEST(ToolsPrograms, ServerStopSignalsOnlyItsOwnDaemon) {
-  s2s_test::TempDir tmp;
-  std::string root = tmp.Sub("root");
-  std::filesystem::create_directories(root + "/var/run");
-  // A live process that is not this root's daemon, behind its pid file.
-  Child sleeper = Spawn(tmp.path(), {"/bin/sleep", "30"});
-  WriteFile(root + "/var/run/s2s-rsyncd.pid",
-            std::to_string(sleeper.pid) + "\n");
-  WriteFile(root + "/var/run/s2s-rsyncd.port", "873\n");
-  Child stop =
-      RunProgram(tmp.path(), {S2S_SERVER_PROGRAM, "--root", root, "stop"});
-  EXPECT_EQ(1, stop.code);
-  EXPECT_NE(std::string::npos, stop.err.find("not signalled")) << stop.err;
-  EXPECT_EQ(0, kill(sleeper.pid, 0)) << "the foreign process was signalled";
-  // Refused, and nothing forgotten: the files still name what runs.
-  EXPECT_EQ(std::to_string(sleeper.pid) + "\n",
-            ReadFile(root + "/var/run/s2s-rsyncd.pid"));
-  EXPECT_EQ("873\n", ReadFile(root + "/var/run/s2s-rsyncd.port"));
-  kill(sleeper.pid, SIGKILL);
-  sleeper.Wait();
-
-  Child none =
-      RunProgram(tmp.path(), {S2S_SERVER_PROGRAM, "--root", root, "stop"});
-  EXPECT_EQ(0, none.code);
-  EXPECT_NE(std::string::npos, none.out.find("was not running"));
-  Child usage = RunProgram(tmp.path(), {S2S_SERVER_PROGRAM, "status"});
-  EXPECT_EQ(2, usage.code) << "no root given";
 }
 
 }  // namespace
