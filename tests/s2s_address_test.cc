@@ -24,7 +24,7 @@ class UsableIpTest : public ::testing::Test {
                             "127.0.0.7  backup  backup.example  # first\n"
                             "127.0.0.8  Backup\n"
                             "::1        backup\n"
-                            "127.0.0.5  storage01\n"));
+                            "127.0.0.6  storage01\n"));
     ASSERT_TRUE(root_.Write("/etc/s2s/platform.conf",
                             "[Platform]\n\tlookup=\"hosts\"\n"));
     ASSERT_TRUE(root_.MakeDir("/bin"));
