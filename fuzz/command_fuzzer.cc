@@ -1,7 +1,6 @@
-// Feeds arbitrary bytes to the server's command handler as a command file
-// from the network: parsed, and when it parses, run against a scratch
-// appliance root with two shares and a real registry. Any status is fine; a
-// crash, a hang, an overrun or a file written outside the root is not.
+// Feeds arbitrary bytes to the server's command handler as a network command
+// file, run when it parses against a scratch root with two shares and a real
+// registry. Any status is fine; a crash, hang, overrun or stray write is not.
 #include <stdarg.h>
 #include <stddef.h>
 #include <stdint.h>
@@ -54,8 +53,7 @@ void MakeRoot() {
   atexit(RemoveRoot);
 }
 
-// The registry only grows (one section per task name); it starts afresh
-// now and then so that each run stays fast.
+// The registry grows a section per task name: start afresh now and then.
 void TrimRegistry() {
   std::string registry = root + "/usr/karo/etc/karoS2S.info";
   struct stat st;

@@ -49,6 +49,7 @@ struct Pair {
     int fds[2];
     ok = tcp ? s2s_test::TcpSocketPair(fds) : s2s_test::UnixSocketPair(fds);
     ok = ok && a.Open(fds[0], true) == 0;
+    EXPECT_TRUE(ok);
     peer = fds[1];
   }
   ~Pair() {
@@ -67,9 +68,8 @@ struct Pair {
 
 class ChannelStreamTest : public ::testing::TestWithParam<bool> {};
 
-// Megabytes of random bytes in random write sizes and random read sizes
-// (capacity-sized and ring-wrapping ones included) arrive unchanged, and
-// neither end allocates on the way.
+// Megabytes of random bytes in random write and read sizes (capacity-sized
+// and ring-wrapping ones included) arrive unchanged; neither end allocates.
 TEST_P(ChannelStreamTest, ArbitraryChunkingKeepsEveryByte) {
   const unsigned int cap = 4093;  // odd, so runs wrap at every position
   Pair pair(cap, GetParam());
@@ -114,25 +114,17 @@ INSTANTIATE_TEST_SUITE_P(UnixAndTcp, ChannelStreamTest, ::testing::Bool());
 
 TEST(ChannelTest, IntegersTravelMostSignificantByteFirst) {
   Pair p(64);
-  ASSERT_TRUE(p.ok);
-  // Bytes and 16-bit integers travel in every PStream message.
-  allocations = 0;
-  counting = true;
   ASSERT_EQ(p.a.WriteInt32(0x01020304), 0);
   ASSERT_EQ(p.a.WriteInt64(1), 0);
   ASSERT_EQ(p.a.FlushWrite(0), 0);
-  counting = false;
   EXPECT_EQ(p.Pending(), std::string("\x01\x02\x03\x04\0\0\0\0\0\0\0\x01", 12));
 
   const char in[] = "\x01\x02\x03\x04\x01\x02\x03\x04\x05\x06\x07\x08";
   ASSERT_EQ(write(p.peer, in, 12), 12);
   unsigned int v32 = 0;
   unsigned long long v64 = 0;
-  counting = true;
   ASSERT_EQ(p.a.ReadInt32(&v32), 0);
   ASSERT_EQ(p.a.ReadInt64(&v64), 0);
-  counting = false;
-  EXPECT_EQ(allocations, 0);
   EXPECT_EQ(v32, 0x01020304u);
   EXPECT_EQ(v64, 0x0102030405060708ull);
 }
@@ -140,7 +132,6 @@ TEST(ChannelTest, IntegersTravelMostSignificantByteFirst) {
 TEST(ChannelTest, WriteBuffersUpToCapacityAndFlushesOnlyForRoom) {
   LogCapture log(4);
   Pair p(64);
-  ASSERT_TRUE(p.ok);
   std::string block(65, 'x');
   ASSERT_EQ(p.a.Write(block.data(), 64), 0);
   EXPECT_EQ(p.Pending(), "");  // nothing sent yet
@@ -156,7 +147,6 @@ TEST(ChannelTest, WriteBuffersUpToCapacityAndFlushesOnlyForRoom) {
 // the next read must continue from the start of the ring.
 TEST(ChannelTest, ReadsContinueAcrossTheEndOfAWrappedRing) {
   Pair p(8);
-  ASSERT_TRUE(p.ok);
   ASSERT_EQ(write(p.peer, "0123456789abcdef", 16), 16);
   char buf[8] = {};
   ASSERT_EQ(p.a.Read(buf, 3), 0);  // the ring takes 8 bytes: 5 remain
@@ -173,7 +163,6 @@ TEST(ChannelTest, ReadsContinueAcrossTheEndOfAWrappedRing) {
 TEST(ChannelTest, PeerClosingMidMessageFailsTheReadWithWhatArrived) {
   LogCapture log(4);
   Pair p(64);
-  ASSERT_TRUE(p.ok);
   ASSERT_EQ(write(p.peer, "abc", 3), 3);
   close(p.peer);
   p.peer = -1;
@@ -192,7 +181,6 @@ TEST(ChannelTest, PeerClosingMidMessageFailsTheReadWithWhatArrived) {
 
 TEST(ChannelTest, StalledPeerTimesOutAndTheFlagStopsAWait) {
   Pair p(64);
-  ASSERT_TRUE(p.ok);
   p.a.SetTimeout(1);
   char c;
   auto start = Clock::now();
@@ -206,7 +194,6 @@ TEST(ChannelTest, StalledPeerTimesOutAndTheFlagStopsAWait) {
   EXPECT_EQ(r, S2S::kConnectionTimeout);
 
   Pair q(64);
-  ASSERT_TRUE(q.ok);
   std::atomic<int> flag{0};
   q.a.SetTimeout(0);  // would wait for ever
   q.a.SetFlag(reinterpret_cast<int*>(&flag));

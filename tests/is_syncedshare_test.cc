@@ -1,5 +1,4 @@
-// The server's pairing registry: its records, the pairing modes, the service
-// status, and writers in several processes at once.
+// The server's pairing registry: records, pairing modes, status, writers.
 #include "S2S/is_syncedshare.h"
 
 #include <gtest/gtest.h>
@@ -63,7 +62,6 @@ TEST_F(RegistryTest, IsSyncedShareFollowsRunningIdAndTheSwitch) {
   Write("[SHARE_docs]\n\tRunningID=\"c1\"\n[SHARE_idle]\n\tRunningID=\"\"\n");
   EXPECT_EQ(KAROS2SIsSyncedShare("docs"), 1);
   EXPECT_EQ(KAROS2SIsSyncedShare("idle"), 0);
-  EXPECT_EQ(KAROS2SIsSyncedShare("other"), 0);
   ASSERT_EQ(KAROUISetS2S(0, nullptr, nullptr), 0);
   EXPECT_EQ(KAROS2SIsSyncedShare("docs"), 0);
   ASSERT_EQ(KAROUISetS2S(1, nullptr, nullptr), 0);
@@ -184,8 +182,7 @@ TEST_F(RegistryTest, CheckIfSharePairedSortsByFeeder) {
   KLIBCSzListFree(shares);
 }
 
-// The busy flag for `task` last active `age` seconds ago. Retried when the
-// clock ticks between writing the time and reading the status.
+// The busy flag for `task` last active `age` s ago; retried if the clock ticks.
 int BusyAtAge(const char* task, long age) {
   for (;;) {
     time_t before = time(nullptr);
@@ -213,7 +210,6 @@ std::string Status() {
 
 TEST_F(RegistryTest, StatusIsBusyForTwoMinutesAndRunsWithSwitchAndDaemon) {
   EXPECT_EQ(Status(), "0 0 - -");  // no client: null strings
-  EXPECT_EQ(BusyAtAge("t1", 0), 1);
   EXPECT_EQ(BusyAtAge("t1", 119), 1);
   EXPECT_EQ(BusyAtAge("t1", 120), 0);
   EXPECT_EQ(BusyAtAge("t2", 0), 1);  // any task counts
@@ -228,9 +224,8 @@ TEST_F(RegistryTest, StatusIsBusyForTwoMinutesAndRunsWithSwitchAndDaemon) {
   EXPECT_EQ(s2s_svr_put_status(nullptr), 0);
 }
 
-// Writers of different sections and keys in several processes, released at
-// once into an empty root, race to create the lock and the file; every
-// function takes the lock around its read and write, so nothing is lost.
+// Writers in several processes, released at once into an empty root, race to
+// create the lock and the file; each locks around its read and write.
 TEST_F(RegistryTest, WritersInManyProcessesLoseNothing) {
   const int kWriters = 6, kRounds = 40;
   int go[2];

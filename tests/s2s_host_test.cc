@@ -50,8 +50,7 @@ TEST_F(HostTest, ClientIdIsTheSerialElseAMacAddress) {
   }
   EXPECT_TRUE(Has(log.Text(), "Fail to get ha sn and mac\n"));
 
-  // A single appliance without a serial: the first interface's address, in
-  // lower case ("" on a machine without one).
+  // A single appliance without a serial: the first NIC's MAC, lower case.
   ASSERT_TRUE(Platform("\tserial=\"\"\n"));
   KARO_NETIF nic[1];
   char mac[18] = "";

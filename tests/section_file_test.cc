@@ -31,21 +31,35 @@ Hash MakeHash(std::initializer_list<std::pair<const char*, const char*>> kv) {
   return h;
 }
 
+// The error a call that returned -1 left behind; 0 for any other result.
+int ErrorOf(int rc) { return rc == -1 ? KLIBCErrGet() : 0; }
+
+std::string Error(int code) { return "<error " + std::to_string(code) + ">"; }
+
 class SectionFileTest : public ::testing::Test {
  protected:
-  std::string Value(const char* section, const char* key) {
+  std::string Value(const char* section, const char* key, size_t size = 256) {
     char buf[256];
-    if (KLIBCFileGetSectionValue(file_.c_str(), section, key, buf, sizeof buf) <
-        0) {
-      return "<error " + std::to_string(KLIBCErrGet()) + ">";
+    if (KLIBCFileGetSectionValue(file_.c_str(), section, key, buf, size) < 0) {
+      return Error(KLIBCErrGet());
     }
     return buf;
   }
-  // The section names, joined by ':', or the enumeration's result.
+  int Add(const char* section, const Hash& h, const char* format = nullptr) {
+    return KLIBCFileAddSection(file_.c_str(), section, h.get(), format);
+  }
+  int Modify(const char* section, const Hash& h, int create = 0) {
+    return KLIBCIFileModifySection(file_.c_str(), section, 0, h.get(), create,
+                                   0);
+  }
+  int Set(const char* section, const Hash& h) {
+    return KLIBCFileSetSection(file_.c_str(), section, 0, h.get(), nullptr);
+  }
+  // The section names, joined by ':', or the enumeration's error.
   std::string Names() {
     KSZLIST* names = KLIBCSzListAlloc();
     int n = KLIBCFileEnumSection(file_.c_str(), names);
-    std::string out = n < 0 ? std::to_string(n) : "";
+    std::string out = n < 0 ? Error(KLIBCErrGet()) : "";
     for (int i = 0; i < n; ++i) {
       out += (i ? ":" : "") + std::string(KLIBCSzListGet(names, i));
     }
@@ -58,12 +72,12 @@ class SectionFileTest : public ::testing::Test {
 };
 
 TEST_F(SectionFileTest, WritesTheDocumentedFormatAndReadsItBack) {
-  auto a = MakeHash({{"RunningID", "c1"}, {"quote", "say \"hi\" \""}});
-  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "SHARE_a", a.get(), nullptr), 1);
-  auto b = MakeHash({{"status", "idle"}});
-  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "TASK_1", b.get(),
-                                KLIBC_SECTION_PAIR_FORMAT),
+  ASSERT_EQ(Add("SHARE_a",
+                MakeHash({{"RunningID", "c1"}, {"quote", "say \"hi\" \""}})),
             1);
+  ASSERT_EQ(
+      Add("TASK_1", MakeHash({{"status", "idle"}}), KLIBC_SECTION_PAIR_FORMAT),
+      1);
   EXPECT_EQ(ReadFile(file_),
             "[SHARE_a]\n\tRunningID=\"c1\"\n\tquote=\"say \"hi\" \"\"\n"
             "[TASK_1]\n\tstatus=\"idle\"\n");
@@ -80,20 +94,19 @@ TEST_F(SectionFileTest, WritesTheDocumentedFormatAndReadsItBack) {
 
 TEST_F(SectionFileTest, ModifySetAndAddKeepOtherSectionsAndKeys) {
   auto a = MakeHash({{"k1", "1"}, {"k2", "2"}});
-  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "A", a.get(), nullptr), 1);
-  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "B", a.get(), nullptr), 1);
+  ASSERT_EQ(Add("A", a), 1);
+  ASSERT_EQ(Add("B", a), 1);
   auto mod = MakeHash({{"k2", "two"}, {"k3", ""}});
-  EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "A", 0, mod.get(), 0, 0), 1);
+  EXPECT_EQ(Modify("A", mod), 1);
   EXPECT_EQ(Value("A", "k1"), "1");
   EXPECT_EQ(Value("A", "k2"), "two");
   EXPECT_EQ(Value("A", "k3"), "");
-  EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "C", 0, mod.get(), 0, 0), 0);
-  EXPECT_EQ(KLIBCFileSetSection(file_.c_str(), "B", 0, mod.get(), nullptr), 2);
-  EXPECT_EQ(Value("B", "k1"), "<error " + std::to_string(KERR_NOT_FOUND) + ">");
-  EXPECT_EQ(KLIBCFileSetSection(file_.c_str(), "C", 0, mod.get(), nullptr), -1);
-  EXPECT_EQ(KLIBCErrGet(), KERR_NOT_FOUND);
+  EXPECT_EQ(Modify("C", mod), 0);
+  EXPECT_EQ(Set("B", mod), 2);
+  EXPECT_EQ(Value("B", "k1"), Error(KERR_NOT_FOUND));
+  EXPECT_EQ(ErrorOf(Set("C", mod)), KERR_NOT_FOUND);
   // Adding an existing section replaces it instead of duplicating it.
-  EXPECT_EQ(KLIBCFileAddSection(file_.c_str(), "A", a.get(), nullptr), 1);
+  EXPECT_EQ(Add("A", a), 1);
   EXPECT_EQ(Value("A", "k2"), "2");
   EXPECT_EQ(Names(), "A:B");
 }
@@ -101,17 +114,13 @@ TEST_F(SectionFileTest, ModifySetAndAddKeepOtherSectionsAndKeys) {
 TEST_F(SectionFileTest, MissingFileAndSmallBuffer) {
   char buf[5];
   EXPECT_EQ(KLIBCFileExist(file_.c_str()), 0);
-  EXPECT_EQ(KLIBCFileGetSectionValue(file_.c_str(), "A", "k", buf, 4), -1);
-  EXPECT_EQ(KLIBCErrGet(), KERR_FILE_NOT_FOUND);
+  EXPECT_EQ(Value("A", "k"), Error(KERR_FILE_NOT_FOUND));
   auto mod = MakeHash({{"k", "long"}});
-  EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "A", 0, mod.get(), 0, 0),
-            -1);
-  EXPECT_EQ(KLIBCErrGet(), KERR_FILE_NOT_FOUND);
-  EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "A", 0, mod.get(), 1, 0), 0);
+  EXPECT_EQ(ErrorOf(Modify("A", mod)), KERR_FILE_NOT_FOUND);
+  EXPECT_EQ(Modify("A", mod, 1), 0);
   EXPECT_EQ(KLIBCFileExist(file_.c_str()), 1);
-  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "A", mod.get(), nullptr), 1);
-  EXPECT_EQ(KLIBCFileGetSectionValue(file_.c_str(), "A", "k", buf, 4), -1);
-  EXPECT_EQ(KLIBCErrGet(), KERR_BUFFER_TOO_SMALL);
+  ASSERT_EQ(Add("A", mod), 1);
+  EXPECT_EQ(Value("A", "k", 4), Error(KERR_BUFFER_TOO_SMALL));
   EXPECT_EQ(KLIBCFileGetSectionValue(file_.c_str(), "A", "k", buf, 5), 4);
 }
 
@@ -124,9 +133,8 @@ TEST_F(SectionFileTest, ReadsWhatAPersonTypes) {
   EXPECT_EQ(Value("A", "k3"), "");
   EXPECT_EQ(Names(), "A:B");
 
-  // A section of many keys, given again after another section: a repeated
-  // key keeps its first place and takes the last value, before and after
-  // the section holds enough keys to be indexed.
+  // A section given again after another: a repeated key keeps its first
+  // place and takes the last value, below and above the indexing size.
   std::string many = "[M]\nk0=\"a\"\n";
   for (int i = 1; i < 30; ++i) many += "k" + std::to_string(i) + "=\"x\"\n";
   many += "[N]\nk0=\"n\"\n[M]\nk0=\"b\"\nk29=\"c\"\nk30=\"d\"\n";
@@ -143,14 +151,12 @@ TEST_F(SectionFileTest, ReadsWhatAPersonTypes) {
   for (const char* bad : {"k=\"v\"\n", "[A]\nno equals\n", "[A]\n=v\n", "[A\n",
                           "[]\n", "[A]\nk=\"open\n"}) {
     ASSERT_TRUE(WriteFile(file_, bad));
-    EXPECT_EQ(Names(), "-1") << bad;
-    EXPECT_EQ(KLIBCErrGet(), KERR_FILE_FORMAT) << bad;
+    EXPECT_EQ(Names(), Error(KERR_FILE_FORMAT)) << bad;
   }
 }
 
-// A file in the writers' own form is written back as it was but for the
-// section changed; anything that reads otherwise than it looks is rewritten
-// whole in that form.
+// A file in the writers' own form keeps all but the changed section as it
+// was; one that reads otherwise than it looks is rewritten whole.
 TEST_F(SectionFileTest, RewriteKeepsTheWritersFormAndNormalisesTheRest) {
   const struct {
     const char* in;
@@ -168,9 +174,7 @@ TEST_F(SectionFileTest, RewriteKeepsTheWritersFormAndNormalisesTheRest) {
   auto mod = MakeHash({{"k", "3"}});
   for (const auto& c : cases) {
     ASSERT_TRUE(WriteFile(file_, c.in));
-    EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "B", 0, mod.get(), 0, 0),
-              1)
-        << c.in;
+    EXPECT_EQ(Modify("B", mod), 1) << c.in;
     EXPECT_EQ(ReadFile(file_), c.out) << c.in;
   }
   EXPECT_EQ(Value("A", "k"), "1");
@@ -180,32 +184,25 @@ TEST_F(SectionFileTest, RewriteKeepsTheWritersFormAndNormalisesTheRest) {
 
 TEST_F(SectionFileTest, RefusesWhatTheFormatCannotHold) {
   auto good = MakeHash({{"k", "v"}});
-  ASSERT_EQ(KLIBCFileAddSection(file_.c_str(), "A", good.get(), nullptr), 1);
+  ASSERT_EQ(Add("A", good), 1);
   const std::string before = ReadFile(file_);
   for (const char* section : {"", "a]b", "[x", "line\nbreak", " lead", "#c"}) {
-    EXPECT_EQ(KLIBCFileAddSection(file_.c_str(), section, good.get(), nullptr),
-              -1)
-        << section;
-    EXPECT_EQ(KLIBCErrGet(), KERR_VALUE_UNHOLDABLE);
+    EXPECT_EQ(ErrorOf(Add(section, good)), KERR_VALUE_UNHOLDABLE) << section;
   }
   for (const char* key : {"a=b", "q\"", "[k", "trail ", "cr\r", ""}) {
-    Hash h = MakeHash({{key, "v"}});
-    EXPECT_EQ(KLIBCIFileModifySection(file_.c_str(), "A", 0, h.get(), 0, 0), -1)
+    EXPECT_EQ(ErrorOf(Modify("A", MakeHash({{key, "v"}}))),
+              KERR_VALUE_UNHOLDABLE)
         << key;
-    EXPECT_EQ(KLIBCErrGet(), KERR_VALUE_UNHOLDABLE);
   }
   for (const char* value : {"two\nlines", "cr\r"}) {
-    Hash h = MakeHash({{"k", value}});
-    EXPECT_EQ(KLIBCFileSetSection(file_.c_str(), "A", 0, h.get(), nullptr), -1);
-    EXPECT_EQ(KLIBCErrGet(), KERR_VALUE_UNHOLDABLE);
+    EXPECT_EQ(ErrorOf(Set("A", MakeHash({{"k", value}}))),
+              KERR_VALUE_UNHOLDABLE);
   }
-  EXPECT_EQ(KLIBCFileAddSection(file_.c_str(), "A", good.get(), "%s=%s\n"), -1);
-  EXPECT_EQ(KLIBCErrGet(), KERR_INVALID_ARG);
+  EXPECT_EQ(ErrorOf(Add("A", good, "%s=%s\n")), KERR_INVALID_ARG);
   EXPECT_EQ(ReadFile(file_), before);
 }
 
-// The writer rewrites a large file over and over; wherever SIGKILL lands, the
-// file on disk is a whole old or new version.
+// Wherever SIGKILL lands in a writer's rewrites, the file is a whole version.
 TEST_F(SectionFileTest, WriterKilledAtRandomLeavesAParsableFile) {
   std::mt19937 rng(12345);
   for (int round = 0; round < 20; ++round) {
@@ -222,11 +219,7 @@ TEST_F(SectionFileTest, WriterKilledAtRandomLeavesAParsableFile) {
                               v.c_str());
         }
         std::string s = "S" + std::to_string(i % 40);
-        if (KLIBCFileAddSection(file_.c_str(), s.c_str(), h.get(), nullptr) !=
-                1 ||
-            write(ready[1], "x", 1) != 1) {
-          _exit(1);
-        }
+        if (Add(s.c_str(), h) != 1 || write(ready[1], "x", 1) != 1) _exit(1);
       }
     }
     close(ready[1]);
@@ -253,14 +246,12 @@ TEST_F(SectionFileTest, WriterKilledAtRandomLeavesAParsableFile) {
   }
 }
 
-TEST(StringHash, KeepsInsertionOrderAndHonoursCapacity) {
+TEST(StringHelpers, HashKeepsOrderAndCapacityListCopiesStrGetFormats) {
   KSZHASH* h = KLIBCSzHashAlloc(2);
-  ASSERT_NE(h, nullptr);
   EXPECT_EQ(KLIBCSzHashSetValue(h, "b", "1"), 0);
   EXPECT_EQ(KLIBCSzHashSetValue(h, "a", "2"), 0);
   EXPECT_EQ(KLIBCSzHashSetValue(h, "b", "3"), 0);  // replaced in place
-  EXPECT_EQ(KLIBCSzHashSetValue(h, "c", "4"), -1);
-  EXPECT_EQ(KLIBCErrGet(), KERR_NO_MEMORY);
+  EXPECT_EQ(ErrorOf(KLIBCSzHashSetValue(h, "c", "4")), KERR_NO_MEMORY);
   EXPECT_STREQ(KLIBCSzHashKeyAt(h, 0), "b");
   EXPECT_STREQ(KLIBCSzHashValueAt(h, 0), "3");
   EXPECT_EQ(KLIBCSzHashKeyAt(h, 2), nullptr);
@@ -274,9 +265,7 @@ TEST(StringHash, KeepsInsertionOrderAndHonoursCapacity) {
   KLIBCSzHashFree(h);
   EXPECT_EQ(KLIBCSzHashAlloc(0), nullptr);
   EXPECT_EQ(KLIBCErrGet(), KERR_INVALID_ARG);
-}
 
-TEST(StringListAndString, CopiesInOrderAndFormats) {
   KSZLIST* l = KLIBCSzListAlloc();
   char s[] = "one";
   EXPECT_EQ(KLIBCSzListPush(l, s), 0);
@@ -293,8 +282,7 @@ TEST(StringListAndString, CopiesInOrderAndFormats) {
   KLIBCStrPut(nullptr);
 }
 
-// Each test process uses a key of its own and removes the set afterwards, so
-// parallel tests never share a lock.
+// A key per test process, removed afterwards: parallel tests share no lock.
 class SemaphoreTest : public ::testing::Test {
  protected:
   void TearDown() override {
@@ -304,7 +292,6 @@ class SemaphoreTest : public ::testing::Test {
   const int key_ = 0x53320000 | (getpid() & 0xffff);
 };
 
-// Whether it was taken with or without a deadline.
 TEST_F(SemaphoreTest, HolderKilledGivesTheLockBack) {
   for (bool timed : {false, true}) {
     int held[2];
@@ -335,8 +322,7 @@ TEST_F(SemaphoreTest, HolderKilledGivesTheLockBack) {
     EXPECT_EQ(semctl(sem, 0, GETVAL), 1);
     EXPECT_EQ(KLIBCSemClose(sem), 0);
   }
-  EXPECT_EQ(KLIBCSemOpen(IPC_PRIVATE), -1);
-  EXPECT_EQ(KLIBCErrGet(), KERR_LOCK);
+  EXPECT_EQ(ErrorOf(KLIBCSemOpen(IPC_PRIVATE)), KERR_LOCK);
   EXPECT_EQ(KLIBCSemClose(-1), -1);
 }
 

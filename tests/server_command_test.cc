@@ -1,6 +1,5 @@
 // The server's command handler on untrusted input: command files, ids and
-// hook requests that must be refused before they touch a path or the
-// registry.
+// hook requests refused before they touch a path or the registry.
 #include <sched.h>
 #include <sys/stat.h>
 #include <sys/time.h>
@@ -129,8 +128,7 @@ class HookTest : public ::testing::Test {
     for (const std::string& n : names) {
       conf += "[" + n + "]\n\tpath=\"" + tmp_.Sub(n) + "\"\n";
     }
-    std::filesystem::create_directories(tmp_.Sub("etc/s2s"));
-    WriteFile(tmp_.Sub("etc/s2s/shares.conf"), conf);
+    tmp_.Write("/etc/s2s/shares.conf", conf);
   }
   // Runs `text` as request `id` through the early hook; the reply's status.
   int Status(const std::string& text, const std::string& id) {
@@ -147,14 +145,12 @@ class HookTest : public ::testing::Test {
     return rc;
   }
 
-  s2s_test::TempDir tmp_;
-  s2s_test::ScopedEnv root_{"S2S_ROOT", tmp_.path()};
+  s2s_test::TempRoot tmp_;
   HookEnv env_;
 };
 
 TEST_F(HookTest, BadRequestsGetAClearStatusAndWriteNothing) {
-  // An id or a daemon user that could leave the reply directory gets no
-  // reply at all.
+  // An id or a daemon user that could leave the reply directory: no reply.
   std::string cmd = Cmd("S2S_GetProtocolVer");
   for (const char* id : {"../x", "a/b", "", "a b"}) {
     EXPECT_EQ(1, Early(cmd + "requestID=\"" + id + "\"\n")) << id;

@@ -1,10 +1,6 @@
-// The server side end to end: a daemon configuration generated from the
-// share configuration, the real rsync daemon on loopback running the real
-// command handler, and the client's rsync wrapper.
-#include <fcntl.h>
+// The server end to end: a generated daemon configuration, the real rsync
+// daemon on loopback running the real handler, and the client's wrapper.
 #include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <filesystem>
 
@@ -30,18 +26,15 @@ const char kOtherPassword[] = "other-Secret-17";
 class ServerDaemonTest : public ::testing::Test {
  protected:
   void StartServer() {
-    std::filesystem::create_directories(tmp_.Sub("etc/s2s"));
-    std::filesystem::create_directories(tmp_.Sub("share1"));
-    std::filesystem::create_directories(tmp_.Sub("src"));
-    WriteFile(tmp_.Sub("etc/s2s/shares.conf"),
-              "[share1]\n\tpath=\"" + tmp_.Sub("share1") + "\"\n");
-    WriteFile(tmp_.Sub("src/file"), "payload");
+    ASSERT_TRUE(tmp_.MakeDir("/share1"));
+    ASSERT_TRUE(
+        tmp_.Write("/etc/s2s/shares.conf",
+                   "[share1]\n\tpath=\"" + tmp_.Sub("share1") + "\"\n"));
+    ASSERT_TRUE(tmp_.Write("/src/file", "payload"));
     DaemonConfig config;
     config.handler = S2S_CMD_HANDLER;
     config.user = kOtherUser;
     config.password = kOtherPassword;
-    config.uid = geteuid();
-    config.gid = getegid();
     ASSERT_EQ(0, WriteDaemonConfig(config));
     // A second user joins the first.
     config.user = kUser;
@@ -79,32 +72,19 @@ class ServerDaemonTest : public ::testing::Test {
     return "--early-input=" + tmp_.Sub("cmd");
   }
 
-  // Plain rsync against the daemon as `user`, as a hostile client would run
-  // it; rsync's exit code.
-  int Rsync(std::vector<std::string> args, const char* user = kUser,
+  // Plain rsync as `user`, as a hostile client would run it; its exit code.
+  int Rsync(const std::vector<std::string>& args, const char* user = kUser,
             const char* password = kPassword) {
-    pid_t pid = fork();
-    if (pid == 0) {
-      setenv("RSYNC_PASSWORD", password, 1);
-      int null = open("/dev/null", O_RDWR);
-      dup2(null, 1);
-      dup2(null, 2);
-      std::string url = "rsync://" + std::string(user) +
-                        "@127.0.0.1:" + std::to_string(daemon_.port());
-      std::vector<char*> argv = {const_cast<char*>("rsync")};
-      for (std::string& a : args) {
-        if (a.compare(0, 1, "/") != 0 && a.compare(0, 1, "-") != 0) {
-          a = url + "/" + a;  // a module path
-        }
-        argv.push_back(const_cast<char*>(a.c_str()));
-      }
-      argv.push_back(nullptr);
-      execvp("rsync", argv.data());
-      _exit(127);
+    const std::string url = "rsync://" + std::string(user) +
+                            "@127.0.0.1:" + std::to_string(daemon_.port()) +
+                            "/";
+    std::vector<std::string> argv = {"rsync"};
+    for (const std::string& a : args) {
+      argv.push_back(a[0] == '/' || a[0] == '-' ? a : url + a);  // module path
     }
-    int st = 0;
-    waitpid(pid, &st, 0);
-    return WIFEXITED(st) ? WEXITSTATUS(st) : -1;
+    return s2s_test::RunProgram(tmp_.path(), argv,
+                                {"RSYNC_PASSWORD=" + std::string(password)})
+        .code;
   }
 
   int Push() {
@@ -116,15 +96,13 @@ class ServerDaemonTest : public ::testing::Test {
     return w.execute(boost::function<bool()>());
   }
 
-  s2s_test::TempDir tmp_;
-  s2s_test::ScopedEnv root_{"S2S_ROOT", tmp_.path()};
+  s2s_test::TempRoot tmp_;
   s2s_test::RsyncDaemon daemon_{tmp_.path()};
   std::unique_ptr<s2s_test::ScopedEnv> port_;
 };
 
-// A sync run against the real daemon, and what a client that knows a daemon
-// password tries against the share while another client syncs it. Each
-// row's attempt must fail and leave the victim's files as they were.
+// What a client that knows a daemon password tries while another syncs the
+// share: each row must fail and leave the victim's files as they were.
 TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   StartServer();
   // A command too large to parse arrives through the spool and is refused.
@@ -146,11 +124,9 @@ TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   ASSERT_EQ(0, Command("CL1", "S2S_SyncStart", start));
   EXPECT_EQ(0, Push());
   EXPECT_EQ("payload", ReadFile(tmp_.Sub("share1/file")));
-  std::string keys = tmp_.Sub("usr/karo/etc/.encrypt");
   std::string upload = tmp_.Sub("var/spool/s2s/upload");
-  std::filesystem::create_directories(tmp_.Sub("empty"));
-  std::filesystem::create_directories(tmp_.Sub("tree/sub"));
-  WriteFile(tmp_.Sub("tree/sub/f"), "x");
+  ASSERT_TRUE(tmp_.MakeDir("/empty"));
+  ASSERT_TRUE(tmp_.Write("/tree/sub/f", "x"));
   WriteFile(tmp_.Sub("key"), "victim key");
   WriteFile(tmp_.Sub("evil"), "evil key");
   WriteFile(tmp_.Sub("big"), std::string(kMaxCommandFile + 1, 'b'));
@@ -177,14 +153,12 @@ TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   for (const Row& row : rows) {
     EXPECT_NE(0, Rsync(row.args, kOtherUser, kOtherPassword)) << row.what;
   }
-  EXPECT_EQ("victim key", ReadFile(keys + "/share1"));
+  EXPECT_EQ("victim key", ReadFile(tmp_.Sub("usr/karo/etc/.encrypt/share1")));
   EXPECT_EQ("victim key", ReadFile(upload + "/pending"));
   EXPECT_FALSE(std::filesystem::exists(upload + "/t1"));
-  // The other user may not start its own sync of share1 (acting as CL1 is
-  // the handler's test).
+  // Nor may it start a sync of share1 of its own, or finish CL1's.
   EXPECT_EQ(kPairedElsewhere,
             Command("CLM", "S2S_SyncStart", start, kOtherUser, kOtherPassword));
-  // Only the client that holds the sync may finish it.
   EXPECT_EQ(kNotSyncing, Command("CLM", "S2S_SyncFinish", finish, kOtherUser,
                                  kOtherPassword));
   // An oversized upload does not stay: the next upload clears it.
@@ -193,31 +167,22 @@ TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   EXPECT_EQ(0, Rsync({tmp_.Sub("evil"), "s2sspool/next"}, kOtherUser,
                      kOtherPassword));
   EXPECT_FALSE(std::filesystem::exists(upload + "/big"));
-  // A malformed request id: the early hook refuses the command, which the
-  // daemon reports as a refusal at the start of the connection.
+  // The early hook refuses a malformed request id at the connection's start.
   EXPECT_EQ(5, Rsync({EarlyInput("a..b"), "s2scmd/a..b", src}));
-  // One daemon user's pulls reach none of another's replies.
+  // A user's pulls reach no other user's replies; its own command runs.
   const std::string replies = tmp_.Sub("var/spool/s2s/reply");
-  std::filesystem::create_directories(replies + "/" + kUser);
-  WriteFile(replies + "/" + kUser + "/pending", "status=0\n");
-  const std::string paths[] = {"s2scmd/*/pending",
-                               "s2scmd/../" + std::string(kUser) + "/pending"};
-  for (const std::string& path : paths) {
-    // Its own command goes through, under a request id of its own.
-    std::string id = "r" + std::to_string(path.size());
-    EXPECT_NE(5, Rsync({EarlyInput(id), path, src}, kOtherUser, kOtherPassword))
-        << path;
-  }
+  const std::string victim = "/var/spool/s2s/reply/" + std::string(kUser);
+  ASSERT_TRUE(tmp_.Write(victim + "/pending", "status=0\n"));
+  EXPECT_NE(5, Rsync({EarlyInput("r1"), "s2scmd/*/pending", src}, kOtherUser,
+                     kOtherPassword));
   EXPECT_TRUE(std::filesystem::is_empty(tmp_.Sub("empty")));
-  std::filesystem::remove(replies + "/" + kUser + "/pending");
+  std::filesystem::remove(tmp_.Path(victim + "/pending"));
   EXPECT_EQ(0, Command("CL1", "S2S_SyncFinish", finish));
   EXPECT_NE(0, Push());
-  // A dry run needs no running sync from the client that feeds the share,
-  // and the daemon changes nothing.
+  // The feeding client's dry run needs no running sync and changes nothing.
   EXPECT_EQ(0, Rsync({"-n", "-r", "--delete", src, "share1/"}));
   EXPECT_EQ("payload", ReadFile(tmp_.Sub("share1/file")));
-  // Nothing is left in the spool once the connections are over: each
-  // command's cleaner removes its files when its connection has ended.
+  // Each command's cleaner empties the spool once its connection has ended.
   EXPECT_TRUE(s2s_test::WaitUntil(
       [&] {
         for (const auto& e :

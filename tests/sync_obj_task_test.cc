@@ -1,5 +1,4 @@
-// Shares, events, server settings and tasks: their validation, their text
-// dumps, and their mapping to the flat maps in which they cross an IPC link.
+// Shares, events, server settings and tasks: validation, dumps, IPC maps.
 #include "S2S/sync_obj_task.h"
 
 #include <gtest/gtest.h>
@@ -21,8 +20,7 @@ using S2S::SyncTask;
 using S2S::TaskInfo;
 using s2s_test::Has;
 
-// Validate()'s answer and what it logged after the "[NOTE] S2S/sync_obj(
-// <line>): " prefix of its last message ("" when nothing was logged).
+// Validate()'s answer, and its last message after the "[NOTE] ...): " prefix.
 template <typename T>
 std::string Validated(const T& obj, bool* ok) {
   s2s_test::LogCapture log;
