@@ -1,7 +1,3 @@
-// s2sd as a process of the service tests: started on the test's client
-// root with a directory of the test's own ahead in PATH (where a test puts
-// an rsync that records its runs), asked through its control socket, and
-// stopped by its own pid.
 #ifndef S2S_TESTS_S2SD_PROCESS_H_
 #define S2S_TESTS_S2SD_PROCESS_H_
 
@@ -23,10 +19,10 @@
 
 namespace s2s_test {
 
-// A running server appliance with `shares`, and s2sd's client root beside
-// it: s2sd finds an rsync first in PATH that notes each run in rsync_log_
-// ("start <ns> <pid> <arguments>", "end <ns> <pid>") and reaches no server
-// while the file unreachable_ exists.
+// s2sd as a process on the client root beside a running server appliance
+// with `shares`, stopped by its own pid: it finds an rsync first in PATH
+// that notes each run in rsync_log_ ("start <ns> <pid> <arguments>", "end
+// <ns> <pid>") and reaches no server while the file unreachable_ exists.
 class S2sdTest : public ::testing::Test {
  protected:
   S2sdTest() : app_(S2S_CMD_HANDLER) {}
@@ -58,10 +54,8 @@ class S2sdTest : public ::testing::Test {
                                      tmp_.Sub("s2sd.log"), "-v"};
     argv.insert(argv.end(), args.begin(), args.end());
     daemon_ = Spawn(tmp_.path(), argv, {"PATH=" + bin_ + ":" + getenv("PATH")});
-    S2S::PObject status;
-    status["action"] = "status";
-    ASSERT_TRUE(
-        WaitUntil([&] { return Request(status)["result"].isInteger(); }, 10))
+    ASSERT_TRUE(WaitUntil(
+        [&] { return Request(Action("status"))["result"].isInteger(); }, 10))
         << Log();
   }
 
@@ -78,11 +72,18 @@ class S2sdTest : public ::testing::Test {
   static S2S::PObject Request(const S2S::PObject& request) {
     S2S::IPCSender sender;
     S2S::PObject reply;
-    if (sender.connect(s2s_service::SocketPath()) == 0) {
+    if (sender.connect(s2s_service::SocketPath()) == 0)
       sender.send(request, true, reply);
-    }
-    sender.close();
     return reply;
+  }
+
+  // A request for `action` on task `id` (none when null).
+  static S2S::PObject Action(const std::string& action,
+                             const S2S::PObject& id = S2S::PObject()) {
+    S2S::PObject r;
+    r["action"] = action;
+    if (!id.isNull()) r["id"] = id;
+    return r;
   }
 
   std::string Log() { return ReadFile(tmp_.Sub("s2sd.log")); }
@@ -110,15 +111,19 @@ class S2sdTest : public ::testing::Test {
     return reply["id"].asUInt64();
   }
 
-  // How many times `what` occurs in the recording rsync's log.
-  size_t RsyncLogCount(const std::string& what) {
-    std::string log = ReadFile(rsync_log_);
+  // How many times `what` occurs in `text`.
+  static size_t Count(const std::string& text, const std::string& what) {
     size_t n = 0;
-    for (size_t at = log.find(what); at != std::string::npos;
-         at = log.find(what, at + 1)) {
+    for (size_t at = text.find(what); at != std::string::npos;
+         at = text.find(what, at + 1)) {
       ++n;
     }
     return n;
+  }
+
+  // How many times `what` occurs in the recording rsync's log.
+  size_t RsyncLogCount(const std::string& what) {
+    return Count(ReadFile(rsync_log_), what);
   }
 
   Appliances app_;
