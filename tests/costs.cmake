@@ -3,13 +3,14 @@
 # before the short ones and two parallel lanes end close together. The
 # figures are seconds on a loaded 2-core machine; only their order matters.
 set(s2s_long_cases
+    "ToolsTest.CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed" 20
+    "ToolsTest.SyncsFailuresDryRunAndOperatorCommandsOnOneServer" 16
+    "ServiceTest.RunsSendOnlyNeededCommandsCancelCleanlyAndPairAgain" 16
+    "ServiceTest.ScheduledRunsByThemselvesApartAndCatchUpOnceManualWaits" 14
     "ServerDaemonTest.SyncRunGuardedAgainstHostileClients" 10
+    "ToolsTest.KilledClientLeavesNoRsyncRunningAndNoCommandFiles" 10
     "RsyncerKeyTest.KeyFilesTravelOverSshEvenWithSshOff" 8
-    "ServiceTest.SharedShareNeverAtOnceAndNoMoreThanMaxParallelRuns" 6
-    "ServiceTest.ScheduledRunsByItselfManualWaitsAndRestartCatchesUpOnce" 6
-    "ToolsTest.ACutTransferResumesFromWhatArrived" 6
-    "ServiceTest.CancelEndsALongTransferAndTheServerShowsTheTaskIdle" 5
-    "ToolsTest.TaskFileRunWithBeaconsDuringTheTransfer" 5)
+    "ServiceControlTest.BadRequestsChangeNothingAndCtlRunsATaskEndToEnd" 5)
 while(s2s_long_cases)
   list(POP_FRONT s2s_long_cases name cost)
   set_tests_properties("${name}" PROPERTIES COST ${cost})
