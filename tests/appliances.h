@@ -59,7 +59,6 @@ class Appliances : NoCopy {
   // password, no SSH.
   S2S::SyncInfo Info() const;
   const std::string& user() const { return user_; }
-  RsyncDaemon& daemon() { return daemon_; }
   std::string DaemonLog() const { return daemon_.Log(); }
 
  private:

@@ -1,6 +1,7 @@
 #include "S2S/logger.h"
 
 #include <gtest/gtest.h>
+#include <sys/mman.h>
 #include <unistd.h>
 
 #include <map>
@@ -17,11 +18,36 @@
 namespace {
 
 using S2S::Logger;
-using s2s_test::CaptureFd;
 using s2s_test::Has;
 using s2s_test::ReadFile;
 using s2s_test::SyslogCapture;
 using s2s_test::TempDir;
+
+// Descriptor `fd` (1 or 2) redirected into an anonymous file while the object
+// lives.
+class CaptureFd {
+ public:
+  explicit CaptureFd(int fd) : fd_(fd) {
+    fflush(nullptr);
+    dup2(file_, fd_);
+  }
+  ~CaptureFd() {
+    fflush(nullptr);
+    dup2(saved_, fd_);
+    close(saved_);
+    close(file_);
+  }
+  // What was written so far.
+  std::string Text() const {
+    fflush(nullptr);
+    return ReadFile("/proc/self/fd/" + std::to_string(file_));
+  }
+
+ private:
+  int fd_;
+  int saved_ = dup(fd_);
+  int file_ = memfd_create("capture", MFD_CLOEXEC);
+};
 
 bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
 

@@ -1,6 +1,8 @@
 // An encrypted share's key file travels to the server's key directory, and
 // always over SSH, against a real sshd whose forced command serves the
 // server's daemon configuration.
+#include <sys/stat.h>
+
 #include <chrono>
 #include <filesystem>
 
@@ -28,10 +30,7 @@ class RsyncerKeyTest : public ::testing::Test {
         ReadFile(app_.server_root() + "/etc/s2s/shares.conf") +
             "[auto]\n\tpath=\"" + app_.server_root() + "/data/auto\"\n"));
     ASSERT_TRUE(app_.StartServer()) << app_.DaemonLog();
-    std::string ssh = app_.client_root() + "/etc/s2s/ssh";
-    ASSERT_TRUE(sshd_.Start("rsync --server --daemon --config=" +
-                                app_.server_root() + "/etc/s2s/rsyncd.conf .",
-                            ssh + "/id_ed25519", ssh + "/known_hosts"));
+    ASSERT_TRUE(StartSshd());
     // A share decrypted at start-up keeps its key elsewhere.
     std::string conf = ReadFile(app_.client_root() + "/etc/s2s/shares.conf") +
                        "[auto]\n\tpath=\"" + app_.client_root() +
@@ -45,14 +44,65 @@ class RsyncerKeyTest : public ::testing::Test {
     ASSERT_TRUE(WriteFile(app_.client_root() + "/keys/auto.stored", "auto"));
     // The probe and the pairing use the daemon; SSH is off for the sync.
     S2S::SyncInfo info = app_.Info();
-    info.SetSSHPort(sshd_.port());
+    info.SetSSHPort(ssh_port_);
     ASSERT_EQ(0, r_.Initialize(info));
+  }
+  void TearDown() override { s2s_test::StopChild(&sshd_); }
+
+  // A real sshd with a generated host key that lets the client's generated
+  // key in, for which it serves the server's daemon configuration.
+  bool StartSshd() {
+    const std::string ssh = app_.client_root() + "/etc/s2s/ssh";
+    const std::string host_key = ssh_dir_.Sub("host_key");
+    const std::string authorized = ssh_dir_.Sub("authorized_keys");
+    fs::create_directories(ssh);
+    for (const std::string& key : {host_key, ssh + "/id_ed25519"}) {
+      if (!s2s_test::RunQuiet(
+              {"ssh-keygen", "-q", "-t", "ed25519", "-N", "", "-f", key})) {
+        return false;
+      }
+    }
+    if (!WriteFile(authorized, "command=\"rsync --server --daemon --config=" +
+                                   app_.server_root() +
+                                   "/etc/s2s/rsyncd.conf .\",no-pty " +
+                                   ReadFile(ssh + "/id_ed25519.pub"))) {
+      return false;
+    }
+    mkdir("/run/sshd", 0755);  // sshd insists on its privilege separation
+    sshd_ = s2s_test::SpawnListening(
+        [&](int port) -> std::vector<std::string> {
+          return {"/usr/sbin/sshd",
+                  "-D",
+                  "-f",
+                  "/dev/null",
+                  "-E",
+                  ssh_dir_.Sub("sshd.log"),
+                  "-p",
+                  std::to_string(port),
+                  "-h",
+                  host_key,
+                  "-o",
+                  "ListenAddress=127.0.0.1",
+                  "-o",
+                  "AuthorizedKeysFile=" + authorized,
+                  "-o",
+                  "StrictModes=no",
+                  "-o",
+                  "PasswordAuthentication=no",
+                  "-o",
+                  "PidFile=none"};
+        },
+        "/dev/null", &ssh_port_);
+    return sshd_ > 0 && WriteFile(ssh + "/known_hosts",
+                                  "[127.0.0.1]:" + std::to_string(ssh_port_) +
+                                      " " + ReadFile(host_key + ".pub"));
   }
 
   s2s_test::Appliances app_{S2S_CMD_HANDLER};
   const std::string keys_ = app_.server_root() + "/usr/karo/etc/.encrypt";
   s2s_test::TempDir ssh_dir_;
-  s2s_test::SshServer sshd_{ssh_dir_.path()};
+  pid_t sshd_ = -1;
+  int ssh_port_ = -1;
   Rsyncer r_;
 };
 
@@ -93,7 +143,7 @@ TEST_F(RsyncerKeyTest, KeyFilesTravelOverSshEvenWithSshOff) {
   EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
   ASSERT_TRUE(WriteFile(known, hosts));
   // The daemon's own port would not do: without sshd the copy fails.
-  sshd_.Stop();
+  s2s_test::StopChild(&sshd_);
   EXPECT_NE(0, r_.SyncEncryptKey("vault"));
 }
 

@@ -36,6 +36,35 @@ std::string TempBase() {
   return (t != nullptr && *t != '\0') ? t : "/tmp";
 }
 
+// In a forked child: applies `env` (as Spawn takes it), puts `in`, `out` and
+// `err` (-1: inherited) on descriptors 0, 1 and 2 and runs `args`.
+[[noreturn]] void ExecChild(std::vector<std::string> args, int in, int out,
+                            int err, const std::vector<std::string>& env) {
+  for (const std::string& e : env) {
+    if (e.find('=') == std::string::npos) {
+      unsetenv(e.c_str());
+    } else {
+      putenv(strdup(e.c_str()));
+    }
+  }
+  const int fds[] = {in, out, err};
+  for (int i = 0; i < 3; ++i) {
+    if (fds[i] >= 0) dup2(fds[i], i);
+  }
+  std::vector<char*> argv;
+  for (std::string& a : args) argv.push_back(&a[0]);
+  argv.push_back(nullptr);
+  execvp(argv[0], argv.data());
+  _exit(127);
+}
+
+// Starts `args` with standard input `in` and output and error `out`.
+pid_t Exec(std::vector<std::string> args, int in, int out) {
+  pid_t pid = fork();
+  if (pid == 0) ExecChild(std::move(args), in, out, out, {});
+  return pid;
+}
+
 std::mutex syslog_mutex;
 std::vector<std::string> syslog_messages;
 std::vector<int> syslog_priorities;
@@ -66,7 +95,30 @@ bool Accepts(int port) {
   return fd >= 0;
 }
 
-// SIGTERM to a child this process started, then waits for it.
+// A root's registry lock outlives its files (a System V semaphore): the
+// locks of the directory and of the roots directly inside it go with it.
+void RemoveRegistryLocks(const std::string& dir) {
+  std::vector<std::string> roots = {dir};
+  std::error_code ec;
+  for (const auto& e : std::filesystem::directory_iterator(dir, ec)) {
+    if (e.is_directory(ec)) roots.push_back(e.path().string());
+  }
+  for (const std::string& root : roots) {
+    int id = semget(S2S::detail::RegistrySemKeyFor(root), 1, 0);
+    if (id >= 0) semctl(id, 0, IPC_RMID);
+  }
+}
+
+void RecordSyslog(int priority, const char* format, va_list ap) {
+  char buf[8192];
+  vsnprintf(buf, sizeof buf, format, ap);
+  std::lock_guard<std::mutex> lock(syslog_mutex);
+  syslog_messages.push_back(buf);
+  syslog_priorities.push_back(priority);
+}
+
+}  // namespace
+
 void StopChild(pid_t* pid) {
   if (*pid <= 0) return;
   kill(*pid, SIGTERM);
@@ -74,10 +126,6 @@ void StopChild(pid_t* pid) {
   *pid = -1;
 }
 
-// Starts the program that `argv_for` gives for a free port, with its output
-// appended to `log`, and waits until it accepts on that port. Retries on other
-// ports, since a port found free may be taken before the program binds it.
-// The program's pid (and the port in `port`), or -1.
 pid_t SpawnListening(
     const std::function<std::vector<std::string>(int)>& argv_for,
     const std::string& log, int* port) {
@@ -106,48 +154,6 @@ pid_t SpawnListening(
   }
   *port = -1;
   return -1;
-}
-
-void RecordSyslog(int priority, const char* format, va_list ap) {
-  char buf[8192];
-  vsnprintf(buf, sizeof buf, format, ap);
-  std::lock_guard<std::mutex> lock(syslog_mutex);
-  syslog_messages.push_back(buf);
-  syslog_priorities.push_back(priority);
-}
-
-}  // namespace
-
-namespace {
-
-// In a forked child: applies `env` (as Spawn takes it), puts `in`, `out` and
-// `err` (-1: inherited) on descriptors 0, 1 and 2 and runs `args`.
-[[noreturn]] void ExecChild(std::vector<std::string> args, int in, int out,
-                            int err, const std::vector<std::string>& env) {
-  for (const std::string& e : env) {
-    if (e.find('=') == std::string::npos) {
-      unsetenv(e.c_str());
-    } else {
-      putenv(strdup(e.c_str()));
-    }
-  }
-  const int fds[] = {in, out, err};
-  for (int i = 0; i < 3; ++i) {
-    if (fds[i] >= 0) dup2(fds[i], i);
-  }
-  std::vector<char*> argv;
-  for (std::string& a : args) argv.push_back(&a[0]);
-  argv.push_back(nullptr);
-  execvp(argv[0], argv.data());
-  _exit(127);
-}
-
-}  // namespace
-
-pid_t Exec(std::vector<std::string> args, int in, int out) {
-  pid_t pid = fork();
-  if (pid == 0) ExecChild(std::move(args), in, out, out, {});
-  return pid;
 }
 
 int Child::Wait(int seconds) {
@@ -199,50 +205,12 @@ bool WaitUntil(const std::function<bool()>& done, double seconds) {
   return true;
 }
 
-bool ReadAll(int fd, char* buf, size_t n) {
-  while (n > 0) {
-    ssize_t r = read(fd, buf, n);
-    if (r <= 0) return false;
-    buf += r;
-    n -= static_cast<size_t>(r);
-  }
-  return true;
-}
-
-bool WriteAll(int fd, const char* buf, size_t n) {
-  while (n > 0) {
-    ssize_t r = write(fd, buf, n);
-    if (r <= 0) return false;
-    buf += r;
-    n -= static_cast<size_t>(r);
-  }
-  return true;
-}
-
 TempDir::TempDir() {
   std::string tmpl = TempBase() + "/s2s-test.XXXXXX";
   char* made = mkdtemp(&tmpl[0]);
   if (made == nullptr) abort();
   path_ = made;
 }
-
-namespace {
-
-// A root's registry lock outlives its files (a System V semaphore): the
-// locks of the directory and of the roots directly inside it go with it.
-void RemoveRegistryLocks(const std::string& dir) {
-  std::vector<std::string> roots = {dir};
-  std::error_code ec;
-  for (const auto& e : std::filesystem::directory_iterator(dir, ec)) {
-    if (e.is_directory(ec)) roots.push_back(e.path().string());
-  }
-  for (const std::string& root : roots) {
-    int id = semget(S2S::detail::RegistrySemKeyFor(root), 1, 0);
-    if (id >= 0) semctl(id, 0, IPC_RMID);
-  }
-}
-
-}  // namespace
 
 TempDir::~TempDir() {
   RemoveRegistryLocks(path_);
@@ -273,28 +241,6 @@ bool TempRoot::Write(const std::string& abs, const std::string& data) const {
 bool WriteScript(const std::string& path, const std::string& body) {
   return WriteFile(path, "#!/bin/sh\n" + body) &&
          chmod(path.c_str(), 0755) == 0;
-}
-
-CaptureFd::CaptureFd(int fd) : fd_(fd) {
-  fflush(nullptr);
-  file_ = TempBase() + "/s2s-capture.XXXXXX";
-  int tmp = mkstemp(&file_[0]);
-  if (tmp < 0) abort();
-  saved_ = dup(fd_);
-  dup2(tmp, fd_);
-  close(tmp);
-}
-
-CaptureFd::~CaptureFd() {
-  fflush(nullptr);
-  dup2(saved_, fd_);
-  close(saved_);
-  unlink(file_.c_str());
-}
-
-std::string CaptureFd::Text() {
-  fflush(nullptr);
-  return ReadFile(file_);
 }
 
 SyslogCapture::SyslogCapture() {
@@ -440,102 +386,5 @@ bool RunQuiet(const std::vector<std::string>& args) {
   return pid > 0 && waitpid(pid, &status, 0) == pid && WIFEXITED(status) &&
          WEXITSTATUS(status) == 0;
 }
-
-PipedProcess::~PipedProcess() { Stop(); }
-
-bool PipedProcess::Start(std::vector<std::string> args) {
-  Stop();
-  int in[2], out[2];
-  if (pipe2(in, O_CLOEXEC) != 0) return false;
-  if (pipe2(out, O_CLOEXEC) != 0) {
-    close(in[0]);
-    close(in[1]);
-    return false;
-  }
-  pid_ = Exec(args, in[0], out[1]);
-  close(in[0]);
-  close(out[1]);
-  in_ = in[1];
-  out_ = out[0];
-  output_.clear();
-  return pid_ > 0;
-}
-
-bool PipedProcess::WaitFor(const std::string& text, double seconds) {
-  auto deadline = std::chrono::steady_clock::now() +
-                  std::chrono::milliseconds(static_cast<int>(seconds * 1000));
-  while (output_.find(text) == std::string::npos) {
-    auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-                    deadline - std::chrono::steady_clock::now())
-                    .count();
-    pollfd p = {out_, POLLIN, 0};
-    if (left <= 0 || poll(&p, 1, static_cast<int>(left)) <= 0) return false;
-    char buf[4096];
-    ssize_t n = read(out_, buf, sizeof buf);
-    if (n <= 0) return false;
-    output_.append(buf, static_cast<size_t>(n));
-  }
-  return true;
-}
-
-bool PipedProcess::Send(const std::string& data) {
-  return write(in_, data.data(), data.size()) ==
-         static_cast<ssize_t>(data.size());
-}
-
-void PipedProcess::Stop() {
-  StopChild(&pid_);
-  if (in_ >= 0) close(in_);
-  if (out_ >= 0) close(out_);
-  in_ = out_ = -1;
-}
-
-SshServer::SshServer(const std::string& dir) : dir_(dir) {}
-
-SshServer::~SshServer() { Stop(); }
-
-bool SshServer::Start(const std::string& forced_command,
-                      const std::string& client_key,
-                      const std::string& known_hosts) {
-  std::string host_key = dir_ + "/ssh_host_key";
-  std::filesystem::create_directories(
-      std::filesystem::path(client_key).parent_path());
-  if (!RunQuiet(
-          {"ssh-keygen", "-q", "-t", "ed25519", "-N", "", "-f", host_key}) ||
-      !RunQuiet(
-          {"ssh-keygen", "-q", "-t", "ed25519", "-N", "", "-f", client_key})) {
-    return false;
-  }
-  std::string authorized = dir_ + "/authorized_keys";
-  if (!WriteFile(authorized, "command=\"" + forced_command +
-                                 "\",no-pty,no-port-forwarding " +
-                                 ReadFile(client_key + ".pub"))) {
-    return false;
-  }
-  // sshd insists on its privilege separation directory.
-  mkdir("/run/sshd", 0755);
-  std::string conf = dir_ + "/sshd_config";
-  pid_ = SpawnListening(
-      [&](int port) -> std::vector<std::string> {
-        if (!WriteFile(conf, "Port " + std::to_string(port) +
-                                 "\nListenAddress 127.0.0.1\nHostKey " +
-                                 host_key + "\nAuthorizedKeysFile " +
-                                 authorized +
-                                 "\nStrictModes no\nUsePAM no"
-                                 "\nPasswordAuthentication no"
-                                 "\nKbdInteractiveAuthentication no"
-                                 "\nPermitRootLogin prohibit-password"
-                                 "\nPidFile none\n")) {
-          return {};
-        }
-        return {"/usr/sbin/sshd", "-D", "-f", conf, "-E", dir_ + "/sshd.log"};
-      },
-      "/dev/null", &port_);
-  return pid_ > 0 &&
-         WriteFile(known_hosts, "[127.0.0.1]:" + std::to_string(port_) + " " +
-                                    ReadFile(host_key + ".pub"));
-}
-
-void SshServer::Stop() { StopChild(&pid_); }
 
 }  // namespace s2s_test

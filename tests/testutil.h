@@ -1,6 +1,5 @@
-// Test plumbing shared by every test program: temporary roots, capture of
-// what goes to standard output, standard error and the system log, and free
-// loopback ports.
+// Test plumbing shared by every test program: temporary roots, the system
+// log's capture, loopback sockets and the programs a test starts.
 #ifndef S2S_TESTS_TESTUTIL_H_
 #define S2S_TESTS_TESTUTIL_H_
 
@@ -34,22 +33,6 @@ class TempDir : NoCopy {
 
  private:
   std::string path_;
-};
-
-// Redirects a descriptor (1 or 2) into a temporary file for its lifetime and
-// hands back what was written.
-class CaptureFd : NoCopy {
- public:
-  explicit CaptureFd(int fd);
-  ~CaptureFd();
-
-  // Everything written so far (flushes stdio first).
-  std::string Text();
-
- private:
-  int fd_;
-  int saved_;
-  std::string file_;
 };
 
 // Collects what the library sends to the system log while it lives. Each
@@ -100,6 +83,18 @@ int FreeLoopbackPort();
 // whether or not they are accepted.
 int LoopbackListener(int* port);
 
+// SIGTERM to a child this process started (*pid, unless <= 0), then waits for
+// it; *pid becomes -1.
+void StopChild(pid_t* pid);
+
+// Starts the program that `argv_for` gives for a free loopback port (an empty
+// vector: give up), with its output appended to `log`, and waits until it
+// accepts there. Retries on other ports, since a port found free may be taken
+// before the program binds it. Its pid (and the port in *port), or -1.
+pid_t SpawnListening(
+    const std::function<std::vector<std::string>(int)>& argv_for,
+    const std::string& log, int* port);
+
 // A real rsync daemon on 127.0.0.1 at a free port, in the foreground
 // (--no-detach), started by this object and stopped by its own pid. Its log
 // lives in `dir`.
@@ -114,31 +109,8 @@ class RsyncDaemon : NoCopy {
   void Stop();
 
   int port() const { return port_; }
-  pid_t pid() const { return pid_; }
   // The daemon's log file so far.
   std::string Log() const;
-
- private:
-  std::string dir_;
-  int port_ = -1;
-  pid_t pid_ = -1;
-};
-
-// A real sshd on 127.0.0.1 at a free port with a generated host key, which
-// lets one generated client key in and runs `forced_command` for it. Files
-// live in `dir`; the daemon is stopped by its own pid.
-class SshServer : NoCopy {
- public:
-  explicit SshServer(const std::string& dir);
-  ~SshServer();
-
-  // Generates the keys, writes the client's private key to `client_key`
-  // (mode 0600) and a known_hosts line for the server to `known_hosts`, and
-  // starts sshd. False on any failure.
-  bool Start(const std::string& forced_command, const std::string& client_key,
-             const std::string& known_hosts);
-  void Stop();
-  int port() const { return port_; }
 
  private:
   std::string dir_;
@@ -168,8 +140,7 @@ class TempRoot : public TempDir {
 
   // path() + `abs` (an absolute path inside the root).
   std::string Path(const std::string& abs) const;
-  // Writes `data` to Path(abs), creating the directories above it; true on
-  // success.
+  // Writes Path(abs), making the directories above it; true on success.
   bool Write(const std::string& abs, const std::string& data) const;
   // Creates Path(abs) and the directories above it.
   bool MakeDir(const std::string& abs) const;
@@ -178,46 +149,9 @@ class TempRoot : public TempDir {
   ScopedEnv env_;
 };
 
-// Starts `args` (looked up in PATH, no shell) with standard input `in` and
-// standard output and error `out` (-1: inherited); its pid, or -1. The
-// caller waits for it.
-pid_t Exec(std::vector<std::string> args, int in, int out);
-
-// Reads or writes exactly `n` bytes on a blocking descriptor; false on an
-// error or the end of the stream first.
-bool ReadAll(int fd, char* buf, size_t n);
-bool WriteAll(int fd, const char* buf, size_t n);
-
 // Runs a program (an argument vector, looked up in PATH, no shell) to
 // completion with its input and output on /dev/null; true on exit 0.
 bool RunQuiet(const std::vector<std::string>& args);
-
-// A program run by the test with its standard input and output (standard
-// error included) on pipes; stopped by its own pid (SIGTERM) at the latest
-// when the object goes away.
-class PipedProcess : NoCopy {
- public:
-  PipedProcess() = default;
-  ~PipedProcess();
-
-  // Starts `args` (looked up in PATH, no shell); false when it cannot.
-  bool Start(std::vector<std::string> args);
-  // Reads output until it holds `text`; false at the end of the output or
-  // after `seconds`.
-  bool WaitFor(const std::string& text, double seconds = 5);
-  // Writes to its standard input; true when all of `data` went.
-  bool Send(const std::string& data);
-  // Stops it and waits for it. Idempotent.
-  void Stop();
-  // Everything read so far.
-  const std::string& output() const { return output_; }
-
- private:
-  pid_t pid_ = -1;
-  int in_ = -1;
-  int out_ = -1;
-  std::string output_;
-};
 
 // A program started by Spawn: its exit code and what it wrote to standard
 // output and standard error, once Wait has returned.
