@@ -27,13 +27,14 @@
 #include "S2S/ipc.h"
 #include "S2S/stream.h"
 #include "appliances.h"
+#include "bench_io.h"
 #include "control_client.h"
 
 namespace {
 
 using S2S::PObject;
-using s2s_test::ReadAll;
-using s2s_test::WriteAll;
+using s2s_bench::ReadAll;
+using s2s_bench::WriteAll;
 using s2s_tools::ControlClient;
 
 // A client appliance with one share, "docs", and an s2sd on it that this

@@ -13,6 +13,7 @@
 
 #include "S2S/ipc.h"
 #include "S2S/stream.h"
+#include "bench_io.h"
 #include "testutil.h"
 
 namespace {
@@ -20,8 +21,8 @@ namespace {
 using S2S::IPCListener;
 using S2S::IPCSender;
 using S2S::PObject;
-using s2s_test::ReadAll;
-using s2s_test::WriteAll;
+using s2s_bench::ReadAll;
+using s2s_bench::WriteAll;
 
 constexpr unsigned kBulkStrings = 1024;
 constexpr unsigned kBulkStringSize = 65535;  // the largest 16-bit length

@@ -58,13 +58,6 @@ std::string TempBase() {
   _exit(127);
 }
 
-// Starts `args` with standard input `in` and output and error `out`.
-pid_t Exec(std::vector<std::string> args, int in, int out) {
-  pid_t pid = fork();
-  if (pid == 0) ExecChild(std::move(args), in, out, out, {});
-  return pid;
-}
-
 std::mutex syslog_mutex;
 std::vector<std::string> syslog_messages;
 std::vector<int> syslog_priorities;
@@ -118,6 +111,12 @@ void RecordSyslog(int priority, const char* format, va_list ap) {
 }
 
 }  // namespace
+
+pid_t Exec(std::vector<std::string> args, int in, int out) {
+  pid_t pid = fork();
+  if (pid == 0) ExecChild(std::move(args), in, out, out, {});
+  return pid;
+}
 
 void StopChild(pid_t* pid) {
   if (*pid <= 0) return;
