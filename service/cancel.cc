@@ -26,6 +26,8 @@ double Now() {
 
 void BindCancelFlag(const CancelFlag* flag) { t_flag = flag; }
 
+const CancelFlag* BoundCancelFlag() { return t_flag; }
+
 bool CancelRequested() { return t_flag != nullptr && t_flag->IsSet(); }
 
 bool CancelChecker() {

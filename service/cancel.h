@@ -36,6 +36,9 @@ class CancelFlag {
 // Binds `flag` to the calling thread (null: nothing cancels the thread's
 // runs). The flag must outlive the binding.
 void BindCancelFlag(const CancelFlag* flag);
+// The flag bound to the calling thread, or null: for the threads a run
+// starts to bind the run's flag too.
+const CancelFlag* BoundCancelFlag();
 // Whether the flag bound to the calling thread is set.
 bool CancelRequested();
 

@@ -44,6 +44,11 @@ bool LoadDaemonConfig(DaemonConfig& config, std::string& error) {
     error = file + ": max_parallel must be 1 to 64";
     return false;
   }
+  if (Get(file, "share_parallel", value) == 1 &&
+      !Number(value, 1, 16, config.share_parallel)) {
+    error = file + ": share_parallel must be 1 to 16";
+    return false;
+  }
   if (Get(file, "beacon_interval", value) == 1 &&
       !Number(value, 0, 86400, config.beacon_interval)) {
     error = file + ": beacon_interval must be 0 to 86400 seconds";

@@ -5,6 +5,7 @@
 //
 //   [Service]
 //   	max_parallel="2"        most runs at once, 1 to 64
+//   	share_parallel="3"      most shares of one run synced at once, 1 to 16
 //   	admin_group="s2sadmin"  a group whose members may use the socket
 //   	beacon_interval="30"    seconds between beacons during a transfer
 #ifndef S2S_SERVICE_CONFIG_H_
@@ -19,6 +20,7 @@ namespace s2s_service {
 
 struct DaemonConfig {
   unsigned int max_parallel = 2;
+  unsigned int share_parallel = 3;
   bool has_admin_group = false;
   gid_t admin_gid = 0;
   unsigned int beacon_interval = 30;

@@ -441,6 +441,7 @@ void Daemon::Start(unsigned long long id, const std::string& trigger) {
   run->trigger = trigger;
   run->options = tasks_[id].queued_options;
   run->options.guard = run->task.guard;
+  run->options.share_parallel = config_.share_parallel;
   run->started = clock_.WallSeconds();
   run->beacon_interval = config_.beacon_interval;
   run->sessions = &sessions_;

@@ -3,6 +3,13 @@
 #include <stdio.h>
 #include <time.h>
 
+#include <algorithm>
+#include <chrono>
+#include <condition_variable>
+#include <memory>
+#include <mutex>
+#include <thread>
+
 #include "S2S/rsyncer.h"
 #include "S2S/s2s_share.h"
 #include "karo/rsync_wrapper.h"
@@ -59,7 +66,7 @@ std::string Format(const char* format, double value) {
   return buf;
 }
 
-// One task's run: the Rsyncer and the outcome that the steps fill in.
+// One task's run: the Rsyncers and the outcome that the steps fill in.
 class Run {
  public:
   Run(const S2S::SyncTask& task, const std::list<std::string>& excludes,
@@ -67,7 +74,11 @@ class Run {
       const RunOptions& options, Session* session)
       : task_(task),
         excludes_(excludes),
-        report_(report),
+        // The shares' threads report through one lock.
+        report_([this, &report](const std::string& line) {
+          std::lock_guard<std::mutex> lock(report_mu_);
+          report(line);
+        }),
         progress_(progress),
         options_(options),
         session_(session != nullptr ? session : &own_session_) {
@@ -78,14 +89,23 @@ class Run {
   TaskOutcome& outcome() { return out_; }
 
  private:
+  // A thread's Rsyncer and the session generation it was resumed from.
+  struct Worker {
+    S2S::Rsyncer rsyncer;
+    int generation = -1;
+  };
+
   bool Connect();
-  bool ProbeAndPair();
-  bool Probe();
-  bool Pair();
-  bool Renew(const ShareOutcome& share);
+  bool ProbeAndPair(S2S::Rsyncer& r);
+  bool Probe(S2S::Rsyncer& r);
+  bool Pair(S2S::Rsyncer& r);
+  bool Renew(const ShareOutcome& share, Worker& w);
+  void Refresh(Worker& w);
   void Beacon(const char* when);
-  void SyncShare(const std::string& share);
-  PushResult Push(ShareOutcome& share);
+  void SyncShares();
+  void Work(Worker& w, bool beacons);
+  ShareOutcome SyncShare(const std::string& share, S2S::Rsyncer& r);
+  PushResult Push(S2S::Rsyncer& r, ShareOutcome& share);
   void DryRun();
   bool ShareStep(ShareOutcome& share, const char* step, int rc, int status);
   void FinishTask();
@@ -95,14 +115,27 @@ class Run {
 
   const S2S::SyncTask& task_;
   const std::list<std::string>& excludes_;
-  const Reporter& report_;
+  std::mutex report_mu_;
+  const Reporter report_;
   const ProgressReporter& progress_;
   const RunOptions& options_;
   Session own_session_;
   Session* session_;
+  // The calling thread's: probe and pairing, beacons, the task's end.
   S2S::Rsyncer rsyncer_;
+  // Guards the session, the generation, reused_, lost_ and out_'s probe
+  // fields while the shares' threads run.
+  std::mutex mu_;
+  int generation_ = 0;   // bumped by each new probe and pairing
   bool reused_ = false;  // the session came from an earlier run, unproven
   bool lost_ = false;    // probing or pairing again failed
+  // The task's shares, the next one to take, and their outcomes by place.
+  std::vector<std::string> shares_;
+  size_t next_ = 0;
+  std::vector<ShareOutcome> done_;
+  std::vector<bool> taken_;
+  std::condition_variable idle_;  // a share's thread has ended
+  size_t threads_ = 0;
   TaskOutcome out_;
 };
 
@@ -119,7 +152,7 @@ bool Run::Stop(int code, const std::string& error) {
 }
 
 bool Run::Connect() {
-  if (!session_->valid) return ProbeAndPair();
+  if (!session_->valid) return ProbeAndPair(rsyncer_);
   rsyncer_.Resume(session_->probed, session_->server_version);
   reused_ = true;
   out_.server_ip = session_->probed.GetServerIP();
@@ -130,41 +163,60 @@ bool Run::Connect() {
   return true;
 }
 
-bool Run::ProbeAndPair() {
+bool Run::ProbeAndPair(S2S::Rsyncer& r) {
   // A version held would survive a probe whose every address fails.
-  rsyncer_.Resume(S2S::SyncInfo(), -1);
+  r.Resume(S2S::SyncInfo(), -1);
   session_->valid = false;
-  if (!Probe() || !Pair()) return false;
+  if (!Probe(r) || !Pair(r)) return false;
   session_->valid = true;
-  session_->probed = rsyncer_.GetSyncInfo();
-  session_->server_version = rsyncer_.GetServerVersionValue();
+  session_->probed = r.GetSyncInfo();
+  session_->server_version = r.GetServerVersionValue();
   session_->made = SessionClock();
+  ++generation_;
   return true;
+}
+
+// REQUIRES: mu_ held.
+void Run::Refresh(Worker& w) {
+  if (w.generation == generation_) return;
+  w.rsyncer.Resume(session_->probed, session_->server_version);
+  w.generation = generation_;
 }
 
 // A share that failed on a session from an earlier run, with an answer that
 // session may have caused, gets a new probe and pairing at once; once per
-// run. True when the share's steps may be made again.
-bool Run::Renew(const ShareOutcome& share) {
+// run. A share that failed on a session another share's thread has renewed
+// since is made again on the new one. True when the share's steps may be
+// made again.
+bool Run::Renew(const ShareOutcome& share, Worker& w) {
   if (share.ok || !Stale(share.status)) return false;
+  std::lock_guard<std::mutex> lock(mu_);
+  if (w.generation != generation_) {
+    if (lost_ || !session_->valid) return false;
+    Refresh(w);
+    return !CancelRequested();
+  }
   // Whatever comes of it, the next run starts afresh.
   session_->valid = false;
   if (!reused_ || CancelRequested()) return false;
   reused_ = false;
   report_("session: probing and pairing again after " + share.cause);
-  if (ProbeAndPair()) return true;
+  if (ProbeAndPair(w.rsyncer)) {
+    w.generation = generation_;
+    return true;
+  }
   lost_ = true;
   return false;
 }
 
-bool Run::Probe() {
+bool Run::Probe(S2S::Rsyncer& r) {
   const S2S::SyncInfo& info = task_.GetInfo().GetSyncInfo();
   std::string target =
       info.GetServerIP().empty() ? info.GetServerName() : info.GetServerIP();
   report_("probe: " + target);
-  int rc = rsyncer_.Initialize(info);
-  out_.server_ip = rsyncer_.GetSyncInfo().GetServerIP();
-  out_.server_version = rsyncer_.GetServerVersionValue();
+  int rc = r.Initialize(info);
+  out_.server_ip = r.GetSyncInfo().GetServerIP();
+  out_.server_version = r.GetServerVersionValue();
   if (rc == kServiceDisabled || rc == kPairedElsewhere) {
     return Stop(kExitPairing, "server refused this client: " + FailureText(rc));
   }
@@ -177,10 +229,10 @@ bool Run::Probe() {
   return true;
 }
 
-bool Run::Pair() {
+bool Run::Pair(S2S::Rsyncer& r) {
   const std::list<std::string>& shares = task_.GetInfo().GetShareList();
   int status = 0;
-  int rc = rsyncer_.DoPairing(options_.dry_run, shares, out_.conflicts, status);
+  int rc = r.DoPairing(options_.dry_run, shares, out_.conflicts, status);
   // A dry run's question to an old server: this client is the paired one.
   if (options_.dry_run && status == kAlreadyPaired) status = 0;
   // 214 is the server's answer that some shares conflict; the list says
@@ -193,11 +245,12 @@ bool Run::Pair() {
     return Stop(kExitPairing, "pairing refused: " + FailureText(status));
   }
   report_("pair: " + Join(shares) +
-          (rsyncer_.SupportMultiSource() ? "" : " (single-client server)") +
+          (r.SupportMultiSource() ? "" : " (single-client server)") +
           (options_.dry_run ? " (dry run: nothing recorded)" : ""));
   return true;
 }
 
+// Only the calling thread sends beacons, with its own Rsyncer.
 void Run::Beacon(const char* when) {
   int status = 0;
   if (rsyncer_.SendBeacon(task_.GetInfo().GetName(), status) == 0 &&
@@ -221,24 +274,26 @@ bool Run::ShareStep(ShareOutcome& share, const char* step, int rc, int status) {
   return false;
 }
 
-PushResult Run::Push(ShareOutcome& share) {
+PushResult Run::Push(S2S::Rsyncer& r, ShareOutcome& share) {
   const std::string& name = share.name;
   return PushShare(
-      rsyncer_, task_.GetID(), excludes_, options_,
+      r, task_.GetID(), excludes_, options_,
       [this, &name](const KARO::Backup::RsyncWrapper::TransferProgress& p) {
-        if (progress_) progress_(name, p);
+        if (!progress_) return;
+        std::lock_guard<std::mutex> lock(report_mu_);
+        progress_(name, p);
       },
       share);
 }
 
-void Run::SyncShare(const std::string& name) {
+ShareOutcome Run::SyncShare(const std::string& name, S2S::Rsyncer& r) {
   ShareOutcome share;
   share.name = name;
   int status = 0;
-  int rc = rsyncer_.StartSyncShare(name, status);
+  int rc = r.StartSyncShare(name, status);
   if (ShareStep(share, "start", rc, status)) {
     report_("share " + name + ": started");
-    PushResult push = Push(share);
+    PushResult push = Push(r, share);
     if (!push.held.empty()) {
       share.failed_step = "guard";
       share.status = push.status;
@@ -249,20 +304,20 @@ void Run::SyncShare(const std::string& name) {
               Format("%.2f s", share.seconds));
       S2S::ShareInfo info;
       bool key_ok = true;
-      if (rsyncer_.GetShareInfo(name, info) == 0 && info.IsEncrypted()) {
-        rc = rsyncer_.SyncEncryptKey(name);
+      if (r.GetShareInfo(name, info) == 0 && info.IsEncrypted()) {
+        rc = r.SyncEncryptKey(name);
         key_ok = ShareStep(share, "key", rc, 0);
         if (key_ok) report_("share " + name + ": key file copied");
       }
       if (key_ok) {
         status = 0;
-        rc = rsyncer_.FinishSync("share", name, status);
+        rc = r.FinishSync("share", name, status);
         share.ok = ShareStep(share, "finish", rc, status);
         if (share.ok) report_("share " + name + ": finished");
       }
     }
   }
-  out_.shares.push_back(share);
+  return share;
 }
 
 void Run::DryRun() {
@@ -270,12 +325,76 @@ void Run::DryRun() {
     if (CancelRequested()) break;
     ShareOutcome share;
     share.name = name;
-    PushResult push = Push(share);
+    PushResult push = Push(rsyncer_, share);
     share.ok = ShareStep(share, "transfer", push.rc, push.status);
     if (share.ok) {
       report_("share " + name + ": " + DryRunSummary(share, options_.guard));
     }
     out_.shares.push_back(share);
+  }
+}
+
+// Takes the task's shares one by one until none is left, the run is
+// cancelled or its session is lost. `beacons`: the calling thread's, which
+// sends a beacon between shares once the interval has passed.
+void Run::Work(Worker& w, bool beacons) {
+  w.rsyncer.SetCancelChecker(CancelChecker);
+  for (;;) {
+    size_t i;
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      if (next_ == shares_.size() || lost_ || CancelRequested()) return;
+      i = next_++;
+      Refresh(w);
+    }
+    if (beacons && BeaconDue()) Beacon("next share");
+    ShareOutcome share = SyncShare(shares_[i], w.rsyncer);
+    if (Renew(share, w)) share = SyncShare(shares_[i], w.rsyncer);
+    std::lock_guard<std::mutex> lock(mu_);
+    done_[i] = share;
+    taken_[i] = true;
+  }
+}
+
+void Run::SyncShares() {
+  const std::list<std::string>& list = task_.GetInfo().GetShareList();
+  shares_.assign(list.begin(), list.end());
+  done_.assign(shares_.size(), ShareOutcome());
+  taken_.assign(shares_.size(), false);
+  size_t extra =
+      std::min<size_t>(std::max(1u, options_.share_parallel), shares_.size());
+  extra = extra > 0 ? extra - 1 : 0;
+  const CancelFlag* flag = BoundCancelFlag();
+  std::vector<std::thread> threads;
+  std::vector<std::unique_ptr<Worker>> workers;
+  threads_ = extra;
+  for (size_t t = 0; t < extra; ++t) {
+    workers.emplace_back(new Worker);
+    Worker* w = workers.back().get();
+    threads.emplace_back([this, w, flag] {
+      BindCancelFlag(flag);
+      Work(*w, false);
+      std::lock_guard<std::mutex> lock(mu_);
+      --threads_;
+      idle_.notify_all();
+    });
+  }
+  Worker mine;
+  Work(mine, true);
+  // The other threads' last shares: beacons go on while they last.
+  {
+    std::unique_lock<std::mutex> lock(mu_);
+    while (threads_ > 0) {
+      idle_.wait_for(lock, std::chrono::seconds(1));
+      if (threads_ == 0 || !BeaconDue()) continue;
+      lock.unlock();
+      Beacon("shares running");
+      lock.lock();
+    }
+  }
+  for (std::thread& t : threads) t.join();
+  for (size_t i = 0; i < shares_.size(); ++i) {
+    if (taken_[i]) out_.shares.push_back(done_[i]);
   }
 }
 
@@ -285,6 +404,9 @@ void Run::FinishTask() {
   rsyncer_.SetCancelChecker(nullptr);
   int status = 0;
   const std::string& name = task_.GetInfo().GetName();
+  if (session_->valid) {
+    rsyncer_.Resume(session_->probed, session_->server_version);
+  }
   int rc = rsyncer_.FinishSync("task", name, status);
   if (rc == 0 && Stale(status)) session_->valid = false;
   if (rc == 0 && status == 0) {
@@ -304,24 +426,13 @@ void Run::Go(unsigned int beacon_interval) {
   rsyncer_.SetCancelChecker(CancelChecker);
   if (options_.dry_run) {
     // A dry run asks its own questions and leaves any session alone.
-    if (Probe() && Pair()) {
+    if (Probe(rsyncer_) && Pair(rsyncer_)) {
       DryRun();
       Outcome();
     }
   } else if (Connect()) {
     SetBeaconHook([this] { Beacon("transfer running"); }, beacon_interval);
-    const std::list<std::string>& shares = task_.GetInfo().GetShareList();
-    for (const std::string& share : shares) {
-      if (CancelRequested()) break;
-      // Between shares as during a transfer: once the interval has passed.
-      if (BeaconDue()) Beacon("next share");
-      SyncShare(share);
-      if (Renew(out_.shares.back())) {
-        out_.shares.pop_back();
-        SyncShare(share);
-      }
-      if (lost_) break;
-    }
+    SyncShares();
     SetBeaconHook(nullptr, 0);
     // A run whose second probe or pairing failed has stopped already.
     if (!lost_) {
@@ -358,100 +469,6 @@ void Run::Outcome() {
 }
 
 }  // namespace
-
-std::string StatusText(int status) {
-  std::string text;
-  switch (status) {
-    case 0:
-      text = "ok";
-      break;
-    case 5:
-      text = "refused by the daemon (user, password or module)";
-      break;
-    case 10:
-      text = "no connection";
-      break;
-    case 20:
-      text = "cancelled";
-      break;
-    case 23:
-      text = "partial transfer";
-      break;
-    case 25:
-      text = "deletions held back";
-      break;
-    case 30:
-    case 35:
-      text = "time-out";
-      break;
-    case 42:
-      text = "address lookup failed";
-      break;
-    case 43:
-      text = "command unknown to the server";
-      break;
-    case 202:
-      text = "share attributes refused";
-      break;
-    case 213:
-      text = "no address to try";
-      break;
-    case 214:
-      text = "shares fed by another client";
-      break;
-    case 240:
-      text = "command malformed";
-      break;
-    case 241:
-      text = "a name was refused";
-      break;
-    case 242:
-      text = "server registry failure";
-      break;
-    case 243:
-      text = "no such share on the server";
-      break;
-    case 244:
-      text = "service switched off on the server";
-      break;
-    case 245:
-      text = "the server is paired with another client";
-      break;
-    case 246:
-      text = "the server holds no sync of this client";
-      break;
-    case 247:
-      text = "the server is not paired with this client";
-      break;
-    case 250:
-      text = "rsync could not be started";
-      break;
-    case 251:
-      text = "no reply from the server";
-      break;
-    case 252:
-      text = "incomplete settings";
-      break;
-    case 253:
-      text = "reply from the server too large";
-      break;
-    case 300:
-      text = "share record unreadable";
-      break;
-    case -1:
-      text = "request could not be prepared";
-      break;
-    default:
-      text = "failed";
-      break;
-  }
-  return text + " [" + std::to_string(status) + "]";
-}
-
-std::string FailureText(int status) {
-  std::string why = KARO::Backup::RsyncWrapper::lastError();
-  return StatusText(status) + (why.empty() ? "" : ": " + why);
-}
 
 TaskOutcome RunTask(const S2S::SyncTask& task,
                     const std::list<std::string>& excludes,

@@ -21,10 +21,15 @@
 // --dry-run: no sync is started, no beacon or end is reported, and each
 // share's outcome lists what would be sent and deleted.
 //
-// RunTask runs on the calling thread with its own Rsyncer; a cancel comes
-// through the flag bound to that thread (service/cancel.h), and its beacons
-// are the thread's own, so several tasks may run at once on threads of
-// their own.
+// With RunOptions::share_parallel above 1, that many shares are synced at
+// once, on the calling thread and threads the run starts; the outcome lists
+// the shares in the task's order all the same, and report lines of
+// different shares may interleave.
+//
+// RunTask runs on the calling thread with its own Rsyncers; a cancel comes
+// through the flag bound to that thread (service/cancel.h), which the run's
+// own threads bind too, and its beacons are the calling thread's, so
+// several tasks may run at once on threads of their own.
 #ifndef S2S_SERVICE_TASK_RUNNER_H_
 #define S2S_SERVICE_TASK_RUNNER_H_
 
@@ -53,6 +58,9 @@ struct RunOptions {
   bool dry_run = false;
   bool confirm_deletions = false;  // this run passes the guard
   DeleteGuard guard;
+  // Shares of the run synced at once, each on a thread with an Rsyncer of
+  // its own; 1 syncs them one after the other.
+  unsigned int share_parallel = 1;
 };
 
 struct ShareOutcome {

@@ -43,7 +43,8 @@ const char kUsage[] =
     "  --help, --version  this text; the version\n"
     "\n"
     "Settings: <root>/etc/s2s/s2sd.conf, section [Service]: max_parallel,\n"
-    "admin_group, beacon_interval. SIGHUP reloads the tasks; SIGTERM\n"
+    "share_parallel, admin_group, beacon_interval. SIGHUP reloads the tasks; "
+    "SIGTERM\n"
     "cancels the running transfers and stops. Exit: 0 stopped, 1 could not\n"
     "start, 2 usage.\n";
 
