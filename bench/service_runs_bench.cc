@@ -1,9 +1,10 @@
 // Runs of a task as the client service makes them when nothing has changed:
 // 1, 10 and 50 shares of ten small files each through the task runner, each
 // run reusing the session (probe and pairing) of the run before, as s2sd
-// does for ten minutes. Beside the time, per run: the commands and the data
-// transfers the server's daemon served (counted in its log), and their sum,
-// the rsync invocations.
+// does for ten minutes. The second argument is the number of shares synced
+// at once: 1, and s2sd's default. Beside the time, per run: the commands and
+// the data transfers the server's daemon served (counted in its log), and their
+// sum, the rsync invocations.
 #include <benchmark/benchmark.h>
 
 #include <fstream>
@@ -11,6 +12,7 @@
 
 #include "appliances.h"
 #include "karo/rsync_wrapper.h"
+#include "service/config.h"
 #include "service/task_runner.h"
 
 namespace {
@@ -65,24 +67,27 @@ void BM_NoChangeRun(benchmark::State& state) {
   Server& s = TheServer();
   if (!s.ok) return state.SkipWithError("no server");
   const int n = static_cast<int>(state.range(0));
+  s2s_service::RunOptions options;
+  options.share_parallel = static_cast<unsigned int>(state.range(1));
   S2S::SyncTask task;
-  task.SetID(static_cast<unsigned long long>(n));
-  task.GetInfo().SetName("bench-" + std::to_string(n));
+  task.SetID(static_cast<unsigned long long>(n * 100 + state.range(1)));
+  task.GetInfo().SetName("bench-" + std::to_string(n) + "-" +
+                         std::to_string(options.share_parallel));
   std::list<std::string> shares;
   for (int i = 0; i < n; ++i) shares.push_back(ShareName(i));
   task.GetInfo().SetShareList(shares);
   task.GetInfo().SetSyncInfo(s.app.Info());
   s2s_service::Session session;
   // The first sync, and the session the runs below reuse.
-  if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr,
-                           s2s_service::RunOptions(), &session)
+  if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr, options,
+                           &session)
           .exit_code != 0) {
     return state.SkipWithError("first run failed");
   }
   std::pair<size_t, size_t> before = s.Served();
   for (auto _ : state) {
-    if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr,
-                             s2s_service::RunOptions(), &session)
+    if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr, options,
+                             &session)
             .exit_code != 0) {
       return state.SkipWithError("run failed");
     }
@@ -96,16 +101,21 @@ void BM_NoChangeRun(benchmark::State& state) {
 }
 
 // One run per repetition, so that the median is the median run.
+const int kServiceDefault =
+    static_cast<int>(s2s_service::DaemonConfig().share_parallel);
+
 BENCHMARK(BM_NoChangeRun)
-    ->Arg(1)
-    ->Arg(10)
+    ->Args({1, 1})
+    ->Args({10, 1})
+    ->Args({10, kServiceDefault})
     ->UseRealTime()
     ->Unit(benchmark::kMillisecond)
     ->Iterations(1)
     ->Repetitions(10)
     ->ReportAggregatesOnly(true);
 BENCHMARK(BM_NoChangeRun)
-    ->Arg(50)
+    ->Args({50, 1})
+    ->Args({50, kServiceDefault})
     ->UseRealTime()
     ->Unit(benchmark::kMillisecond)
     ->Iterations(1)
