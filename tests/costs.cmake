@@ -1,6 +1,6 @@
 # Included by CTest after the discovered cases: the long ones by name, so
 # that a run with no timings of its own yet (a fresh clone) starts them
-# before the short ones and two parallel lanes end close together. The
+# before the short ones and the parallel lanes end close together. The
 # figures are seconds on a loaded 2-core machine; only their order matters.
 set(s2s_long_cases
     "ToolsTest.CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed" 20
