@@ -6,7 +6,6 @@
 #include <algorithm>
 #include <chrono>
 #include <condition_variable>
-#include <memory>
 #include <mutex>
 #include <thread>
 
@@ -129,11 +128,11 @@ class Run {
   int generation_ = 0;   // bumped by each new probe and pairing
   bool reused_ = false;  // the session came from an earlier run, unproven
   bool lost_ = false;    // probing or pairing again failed
-  // The task's shares, the next one to take, and their outcomes by place.
+  // The task's shares, the next one to take, and their outcomes by place
+  // (an outcome without a name: the share was not taken).
   std::vector<std::string> shares_;
   size_t next_ = 0;
   std::vector<ShareOutcome> done_;
-  std::vector<bool> taken_;
   std::condition_variable idle_;  // a share's thread has ended
   size_t threads_ = 0;
   TaskOutcome out_;
@@ -352,7 +351,6 @@ void Run::Work(Worker& w, bool beacons) {
     if (Renew(share, w)) share = SyncShare(shares_[i], w.rsyncer);
     std::lock_guard<std::mutex> lock(mu_);
     done_[i] = share;
-    taken_[i] = true;
   }
 }
 
@@ -360,20 +358,16 @@ void Run::SyncShares() {
   const std::list<std::string>& list = task_.GetInfo().GetShareList();
   shares_.assign(list.begin(), list.end());
   done_.assign(shares_.size(), ShareOutcome());
-  taken_.assign(shares_.size(), false);
-  size_t extra =
-      std::min<size_t>(std::max(1u, options_.share_parallel), shares_.size());
-  extra = extra > 0 ? extra - 1 : 0;
+  // Besides the calling thread.
+  threads_ = std::min<size_t>(options_.share_parallel, shares_.size());
+  threads_ = threads_ > 0 ? threads_ - 1 : 0;
   const CancelFlag* flag = BoundCancelFlag();
+  std::vector<Worker> workers(threads_);
   std::vector<std::thread> threads;
-  std::vector<std::unique_ptr<Worker>> workers;
-  threads_ = extra;
-  for (size_t t = 0; t < extra; ++t) {
-    workers.emplace_back(new Worker);
-    Worker* w = workers.back().get();
-    threads.emplace_back([this, w, flag] {
+  for (Worker& w : workers) {
+    threads.emplace_back([this, &w, flag] {
       BindCancelFlag(flag);
-      Work(*w, false);
+      Work(w, false);
       std::lock_guard<std::mutex> lock(mu_);
       --threads_;
       idle_.notify_all();
@@ -394,7 +388,7 @@ void Run::SyncShares() {
   }
   for (std::thread& t : threads) t.join();
   for (size_t i = 0; i < shares_.size(); ++i) {
-    if (taken_[i]) out_.shares.push_back(done_[i]);
+    if (!done_[i].name.empty()) out_.shares.push_back(done_[i]);
   }
 }
 
