@@ -115,24 +115,34 @@ bool WriteAll(int fd, const std::string& text) {
 }
 
 bool ReadAll(const char* file, std::string* text) {
-  FILE* f = fopen(file, "re");
-  if (f == nullptr) {
+  int fd = open(file, O_RDONLY | O_CLOEXEC);
+  if (fd < 0) {
     KLIBCErrSet(errno == ENOENT ? KERR_FILE_NOT_FOUND : KERR_SYSTEM);
     return false;
   }
+  // Read straight into the text, one byte more than the file's size so that
+  // the end is seen without another call when the size holds.
   struct stat st;
-  if (fstat(fileno(f), &st) == 0 && st.st_size > 0) {
-    text->reserve(static_cast<size_t>(st.st_size));
+  size_t size = fstat(fd, &st) == 0 && st.st_size > 0
+                    ? static_cast<size_t>(st.st_size) + 1
+                    : 4096;
+  size_t done = 0;
+  for (;;) {
+    if (done == size) size *= 2;
+    text->resize(size);
+    ssize_t n = read(fd, &(*text)[done], size - done);
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) {
+      close(fd);
+      text->clear();
+      KLIBCErrSet(KERR_SYSTEM);
+      return false;
+    }
+    if (n == 0) break;
+    done += static_cast<size_t>(n);
   }
-  char buf[65536];
-  size_t n;
-  while ((n = fread(buf, 1, sizeof buf, f)) > 0) text->append(buf, n);
-  bool failed = ferror(f) != 0;
-  fclose(f);
-  if (failed) {
-    KLIBCErrSet(KERR_SYSTEM);
-    return false;
-  }
+  close(fd);
+  text->resize(done);
   return true;
 }
 
@@ -233,23 +243,28 @@ int SectionDoc::Parse(const std::string& text, const std::string* only) {
 // ended, each section kept once and each of its keys once. False (the index
 // half made) for any other text.
 bool SectionDoc::IndexWritersForm(const std::string* only) {
-  const std::string_view all(text_);
-  if (!all.empty() && all.back() != '\n') return false;
+  const char* const first = text_.data();
+  const char* const stop = first + text_.size();
+  if (first == stop) return true;
+  if (stop[-1] != '\n') return false;
   if (only == nullptr) {
     // Sections of a few lines of some 20 bytes; the slots twice as many.
-    sections_.reserve(all.size() / 64);
+    sections_.reserve(text_.size() / 64);
     size_t slots = 64;
-    while (slots < all.size() / 16) slots *= 2;
+    while (slots < text_.size() / 16) slots *= 2;
     slots_.assign(slots, 0);
   }
-  std::vector<std::string_view> keys;  // the kept section's
+  // The kept section's keys, for the check that none comes twice.
+  std::string_view keys[kScanLimit];
+  size_t key_count = 0;
   bool in_section = false, kept = false;
-  for (size_t pos = 0; pos < all.size();) {
-    size_t end = all.find('\n', pos);
-    std::string_view line = all.substr(pos, end - pos);
-    pos = end + 1;
-    if (line.size() >= 3 && line.front() == '[' && line.back() == ']') {
-      std::string_view name = line.substr(1, line.size() - 2);
+  for (const char* p = first; p != stop;) {
+    const char* nl = static_cast<const char*>(memchr(p, '\n', stop - p));
+    const char* line = p;
+    p = nl + 1;
+    if (*line == '[') {
+      if (nl - line < 3 || nl[-1] != ']') return false;
+      std::string_view name(line + 1, nl - line - 2);
       if (IsBlank(name.front()) || IsBlank(name.back())) return false;
       in_section = true;
       kept = only == nullptr || name == *only;
@@ -257,20 +272,31 @@ bool SectionDoc::IndexWritersForm(const std::string* only) {
       if (!Intern(name).second) return false;
       Section& s = sections_.back();
       s.parsed = false;
-      s.begin = s.end = pos;
-      keys.clear();
+      s.begin = s.end = static_cast<size_t>(p - first);
+      key_count = 0;
       continue;
     }
-    std::string_view key, value;
-    if (!in_section || !WritersPair(line, &key, &value)) return false;
+    // "\tkey=\"value\"", the key up to the first '='; a key that starts
+    // with '#' or '[' would read as a comment or a section.
+    if (!in_section || *line != '\t') return false;
+    const char* eq = static_cast<const char*>(memchr(line, '=', nl - line));
+    if (eq == nullptr || eq - line < 2 || nl - eq < 3 || eq[1] != '"' ||
+        nl[-1] != '"' || IsBlank(line[1]) || IsBlank(eq[-1]) ||
+        line[1] == '#' || line[1] == '[') {
+      return false;
+    }
     if (!kept) continue;
     // Beyond kScanLimit keys the parse's key index does better.
-    if (keys.size() >= kScanLimit) return false;
-    for (std::string_view k : keys) {
-      if (k == key) return false;
+    if (key_count == kScanLimit) return false;
+    std::string_view key(line + 1, eq - line - 1);
+    for (size_t i = 0; i < key_count; ++i) {
+      const std::string_view k = keys[i];
+      if (k.size() == key.size() && k.back() == key.back() && k == key) {
+        return false;
+      }
     }
-    keys.push_back(key);
-    sections_.back().end = pos;
+    keys[key_count++] = key;
+    sections_.back().end = static_cast<size_t>(p - first);
   }
   return true;
 }
