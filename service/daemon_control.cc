@@ -29,6 +29,18 @@ std::string Named(unsigned long long id, const std::string& name) {
 
 PObject Ok(const std::string& message) { return MakeReply(kResultOk, message); }
 
+// rsync's progress figures of one transfer, zeros when none runs.
+void PutProgress(const KARO::Backup::RsyncWrapper::TransferProgress& p,
+                 PObject& to) {
+  to["bytes_done"] = p.bytes_done;
+  to["bytes_total"] = p.bytes_total;
+  to["percent"] = p.percent;
+  to["rate"] = static_cast<unsigned long long>(p.bytes_per_second + 0.5);
+  to["seconds_left"] = p.seconds_left;
+  to["files_checked"] = p.files_checked;
+  to["files_total"] = p.files_total;
+}
+
 }  // namespace
 
 PObject Daemon::Dispatch(const PObject& request) {
@@ -360,13 +372,16 @@ PObject Daemon::DoStatus(const PObject&) {
     run.Progress(share, step, p);
     r["share"] = share;
     r["step"] = step;
-    r["bytes_done"] = p.bytes_done;
-    r["bytes_total"] = p.bytes_total;
-    r["percent"] = p.percent;
-    r["rate"] = static_cast<unsigned long long>(p.bytes_per_second + 0.5);
-    r["seconds_left"] = p.seconds_left;
-    r["files_checked"] = p.files_checked;
-    r["files_total"] = p.files_total;
+    PutProgress(p, r);
+    PObject::Array shares;
+    for (const ActiveRun::ShareProgress& s : run.Shares()) {
+      PObject& entry = shares.emplace_back();
+      entry = PObject::Map();
+      entry["name"] = s.name;
+      entry["step"] = s.step;
+      PutProgress(s.transfer, entry);
+    }
+    r["shares"] = shares;
     running.push_back(r);
   }
   reply["running"] = running;

@@ -19,8 +19,17 @@ void ActiveRun::Progress(
   transfer = transfer_;
 }
 
+std::vector<ActiveRun::ShareProgress> ActiveRun::Shares() const {
+  std::lock_guard<std::mutex> lock(mu_);
+  std::vector<ShareProgress> shares;
+  for (const auto& it : shares_) shares.push_back(it.second);
+  return shares;
+}
+
 // Runner lines are "probe: ...", "pair: ...", "beacon: ...",
-// "share NAME: started|transferred ...|finished|..." and "task NAME: ...".
+// "share NAME: started|transferred ...|key file copied|finished|..." and
+// "task NAME: ...". A share is in progress from its start to any other line
+// of its own: its end, a failed step, the guard's or a dry run's summary.
 void ActiveRun::Note(const std::string& line) {
   S2S::Logger::LogMsg(S2S::Logger::Info, "[INFO] task %llu: %s\n", id,
                       line.c_str());
@@ -34,9 +43,21 @@ void ActiveRun::Note(const std::string& line) {
     share_ = line.substr(6, colon - 6);
     std::string rest = line.substr(colon + 2);
     step_ = rest.substr(0, rest.find(' '));
+    if (step_ == "started" || step_ == "transferred" || step_ == "key") {
+      ShareProgress& share = shares_[share_];
+      share.name = share_;
+      share.step = step_;
+      share.transfer = KARO::Backup::RsyncWrapper::TransferProgress();
+    } else {
+      shares_.erase(share_);
+    }
   } else if (colon != std::string::npos && line.compare(0, 7, "beacon:") != 0) {
     share_.clear();
     step_ = line.substr(0, line.find_first_of(" :"));
+    // The run's end, or its failure, ends its shares too.
+    if (line.compare(0, 5, "task ") == 0 || line.compare(0, 6, "error:") == 0) {
+      shares_.clear();
+    }
   }
 }
 
@@ -74,6 +95,7 @@ void StartRun(std::shared_ptr<ActiveRun> run,
               run->share_ = share;
               run->step_ = "transfer";
               run->transfer_ = p;
+              run->shares_[share] = {share, "transfer", p};
             },
             run->options, run->options.dry_run ? nullptr : &session);
         if (run->sessions != nullptr && !run->options.dry_run)

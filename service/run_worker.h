@@ -6,10 +6,12 @@
 #define S2S_SERVICE_RUN_WORKER_H_
 
 #include <functional>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "service/cancel.h"
 #include "service/session.h"
@@ -35,6 +37,15 @@ struct ActiveRun {
   void Progress(std::string& share, std::string& step,
                 KARO::Backup::RsyncWrapper::TransferProgress& transfer) const;
 
+  // The shares in progress, in name order, as a run syncs several at once:
+  // each from its start to its last line, with its step and, while it
+  // transfers, rsync's last progress figures.
+  struct ShareProgress {
+    std::string name, step;
+    KARO::Backup::RsyncWrapper::TransferProgress transfer;
+  };
+  std::vector<ShareProgress> Shares() const;
+
   std::thread thread;
 
  private:
@@ -44,6 +55,7 @@ struct ActiveRun {
   mutable std::mutex mu_;
   std::string share_, step_;
   KARO::Backup::RsyncWrapper::TransferProgress transfer_;
+  std::map<std::string, ShareProgress> shares_;
 };
 
 // Starts `run` on its thread; `done(id)` is called from that thread when

@@ -68,6 +68,16 @@ TEST(CtlPrint, SchedulesSettingsProgressAndWhyNotWatchingInWords) {
   run["bytes_done"] = 1u << 20;
   run["rate"] = 512u << 10;
   run["seconds_left"] = 2;
+  PObject& both = status["running"].asArray().emplace_back();
+  both["id"] = 5;
+  for (const char* name : {"alpha", "beta"}) {
+    PObject& share = both["shares"].asArray().emplace_back();
+    share["name"] = name;
+    share["step"] = "transfer";
+  }
+  PObject& alpha = both["shares"].asArray()[0];
+  alpha["bytes_total"] = 4u << 20;
+  alpha["bytes_done"] = 3u << 20;
   PObject& watch = status["realtime"].asArray().emplace_back();
   watch["id"] = 7;
   watch["source_note"] = "not root";
@@ -88,7 +98,9 @@ TEST(CtlPrint, SchedulesSettingsProgressAndWhyNotWatchingInWords) {
         "  task 7: not fanotify: not root\n",
         "  task 7: the server is unreachable\n",
         "  task 7: last batch failed: rsync?[31m failed\n",
-        "  task 7: share docs not watched: no such directory\n"}) {
+        "  task 7: share docs not watched: no such directory\n",
+        "alpha  transfer  3.0 MiB of 4.0 MiB",
+        "\n                              beta   transfer  -\n"}) {
     EXPECT_TRUE(s2s_test::Has(text, line)) << line << "\n" << text;
   }
 }

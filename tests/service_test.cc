@@ -351,8 +351,12 @@ TEST_F(ServiceTest, RunsSendOnlyNeededCommandsCancelCleanlyAndPairAgain) {
   EXPECT_TRUE(WaitFor(
       [&] {
         PObject::Array running = Request(Action("status"))["running"].asArray();
-        return running.size() == 1 && running[0]["bytes_done"].asUInt64() > 0 &&
-               running[0]["share"].asString() == "big";
+        if (running.size() != 1) return false;
+        const PObject::Array& shares = running[0]["shares"].asArray();
+        return running[0]["bytes_done"].asUInt64() > 0 &&
+               running[0]["share"].asString() == "big" && shares.size() == 1 &&
+               shares[0]["name"].asString() == "big" &&
+               shares[0]["bytes_done"].asUInt64() > 0;
       },
       10));
   auto start = std::chrono::steady_clock::now();

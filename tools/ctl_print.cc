@@ -231,18 +231,31 @@ std::string FormatStatus(const S2S::PObject& reply) {
       " tasks, at most " + Text(reply["max_parallel"]) + " runs at once\n";
   std::vector<Row> running = {
       {"ID", "NAME", "TRIGGER", "STARTED", "SHARE", "STEP", "PROGRESS"}};
-  for (const S2S::PObject& r : reply["running"].asArray()) {
-    std::string progress = "-";
-    if (r.hasMember("bytes_total") && r["bytes_total"].asUInt64() > 0) {
-      unsigned long long left = r["seconds_left"].asUInt64();
-      progress = Bytes(r["bytes_done"].asUInt64()) + " of " +
-                 Bytes(r["bytes_total"].asUInt64()) + ", " +
-                 Bytes(r["rate"].asUInt64()) + "/s, " + Duration(left) +
-                 " left";
+  auto progress = [](const S2S::PObject& p) -> std::string {
+    if (!p.hasMember("bytes_total") || p["bytes_total"].asUInt64() == 0) {
+      return "-";
     }
-    running.push_back({Text(r["id"]), Text(r["name"]), Text(r["trigger"]),
-                       TimeText(r["started"].asUInt64()), Text(r["share"]),
-                       Text(r["step"]), progress});
+    return Bytes(p["bytes_done"].asUInt64()) + " of " +
+           Bytes(p["bytes_total"].asUInt64()) + ", " +
+           Bytes(p["rate"].asUInt64()) + "/s, " +
+           Duration(p["seconds_left"].asUInt64()) + " left";
+  };
+  for (const S2S::PObject& r : reply["running"].asArray()) {
+    // A run syncing several shares at once shows a line for each.
+    const S2S::PObject::Array& shares = r["shares"].asArray();
+    Row row = {Text(r["id"]), Text(r["name"]), Text(r["trigger"]),
+               TimeText(r["started"].asUInt64())};
+    if (shares.size() < 2) {
+      row.insert(row.end(), {Text(r["share"]), Text(r["step"]), progress(r)});
+      running.push_back(row);
+      continue;
+    }
+    for (const S2S::PObject& share : shares) {
+      row.insert(row.end(),
+                 {Text(share["name"]), Text(share["step"]), progress(share)});
+      running.push_back(row);
+      row = {"", "", "", ""};
+    }
   }
   std::vector<Row> next = {{"ID", "NAME", "NEXT RUN"}};
   for (const S2S::PObject& n : reply["next_runs"].asArray()) {
