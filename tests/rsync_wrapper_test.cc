@@ -4,7 +4,12 @@
 // tested through the Rsyncer.
 #include "karo/rsync_wrapper.h"
 
+#include <poll.h>
+#include <signal.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -122,6 +127,43 @@ TEST_F(RsyncWrapperTest, PeerThatAcceptsAndStaysSilentTimesOut) {
   close(fd);
   EXPECT_NE(0, status);
   EXPECT_LT(took, std::chrono::seconds(5));
+}
+
+// A client killed while its rsync waits on a server never leaves that rsync
+// behind: it ends with the client, not at its own timeout a minute later.
+TEST_F(RsyncWrapperTest, RsyncEndsWithItsKilledClient) {
+  int port = 0;
+  int fd = s2s_test::LoopbackListener(&port);
+  ASSERT_GE(fd, 0);
+  s2s_test::ScopedEnv env("S2S_RSYNC_PORT", std::to_string(port));
+  pid_t client = fork();
+  if (client == 0) {
+    RsyncWrapper w;
+    Configure(w);
+    w.setTimeout(60);
+    w.setKaroCustCmdRule({"command=\"S2S_Pairing\""});
+    _exit(w.execute(boost::function<bool()>()));
+  }
+  ASSERT_GT(client, 0);
+  // Once rsync has connected it runs; it is the client's only child.
+  struct pollfd listening = {fd, POLLIN, 0};
+  int conn =
+      poll(&listening, 1, 10000) == 1 ? accept(fd, nullptr, nullptr) : -1;
+  const std::string id = std::to_string(client);
+  pid_t rsync = static_cast<pid_t>(
+      atol(ReadFile("/proc/" + id + "/task/" + id + "/children").c_str()));
+  kill(client, SIGKILL);
+  waitpid(client, nullptr, 0);
+  ASSERT_GE(conn, 0);
+  ASSERT_GT(rsync, 0);
+  int pidfd = static_cast<int>(syscall(SYS_pidfd_open, rsync, 0));
+  struct pollfd ended = {pidfd, POLLIN, 0};
+  bool gone = pidfd < 0 || poll(&ended, 1, 10000) == 1;
+  if (!gone) kill(rsync, SIGKILL);
+  EXPECT_TRUE(gone);
+  if (pidfd >= 0) close(pidfd);
+  close(conn);
+  close(fd);
 }
 
 }  // namespace
