@@ -359,6 +359,12 @@ TEST_F(ServiceTest, RunsSendOnlyNeededCommandsCancelCleanlyAndPairAgain) {
                shares[0]["bytes_done"].asUInt64() > 0;
       },
       10));
+  // A task on the same share waits in the queue until the share is free.
+  unsigned long long id_same = AddTask("same", {"big"}, S2S::Schedule());
+  ASSERT_EQ(0u, Request(Action("run", id_same))["result"].asUInt64());
+  EXPECT_EQ("queued",
+            Request(Action("get", id_same))["task"]["state"].asString());
+  EXPECT_EQ(0u, Request(Action("cancel", id_same))["was_running"].asUInt64());
   auto start = std::chrono::steady_clock::now();
   EXPECT_EQ(1u, Request(Action("cancel", id_long))["was_running"].asUInt64());
   ASSERT_TRUE(WaitFor(Ended(id_long, "cancelled"), 10));
