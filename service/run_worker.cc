@@ -43,7 +43,10 @@ void ActiveRun::Note(const std::string& line) {
     share_ = line.substr(6, colon - 6);
     std::string rest = line.substr(colon + 2);
     step_ = rest.substr(0, rest.find(' '));
-    if (step_ == "started" || step_ == "transferred" || step_ == "key") {
+    // A failed step reads "<step> failed: ...", so the whole rest is
+    // matched, not only its first word.
+    if (rest == "started" || rest.compare(0, 12, "transferred ") == 0 ||
+        rest == "key file copied") {
       ShareProgress& share = shares_[share_];
       share.name = share_;
       share.step = step_;
