@@ -46,12 +46,14 @@ struct ActiveRun {
   };
   std::vector<ShareProgress> Shares() const;
 
+  // Logs one line of the runner and follows the run's place by it.
+  void Note(const std::string& line);
+
   std::thread thread;
 
  private:
   friend void StartRun(std::shared_ptr<ActiveRun>,
                        std::function<void(unsigned long long)>);
-  void Note(const std::string& line);
   mutable std::mutex mu_;
   std::string share_, step_;
   KARO::Backup::RsyncWrapper::TransferProgress transfer_;

@@ -24,6 +24,7 @@
 #include "service/config.h"
 #include "service/history.h"
 #include "service/record.h"
+#include "service/run_worker.h"
 #include "service/scheduler.h"
 #include "service/task_store.h"
 #include "testutil.h"
@@ -118,6 +119,32 @@ TEST(Scheduler, EarliestFirstOncePerDueFollowsClockJumpsRetriesBackOff) {
   EXPECT_EQ(now + 60, s.ScheduleRetry(1, now));
   s.CancelRetry(1);
   EXPECT_EQ(At(2026, 3, 2, 0, 0), s.Earliest());
+}
+
+// The shares a status shows in progress, after each of a run's lines.
+TEST(ActiveRun, SharesInProgressFollowTheRunnersLines) {
+  const std::pair<const char*, const char*> lines[] = {
+      {"share a: started", "a:started"},
+      {"share b: started", "a:started b:started"},
+      {"beacon: sent", "a:started b:started"},
+      {"share a: transferred in 1.00 s", "a:transferred b:started"},
+      {"share a: key file copied", "a:key b:started"},
+      {"share b: transfer failed: timeout", "a:key"},
+      {"share a: key failed: no key", ""},
+      {"share c: started", "c:started"},
+      {"share c: would send 2, delete 0", ""},
+      {"share d: started", "d:started"},
+      {"task t: finished with errors", ""},
+  };
+  ActiveRun run;
+  for (const auto& line : lines) {
+    run.Note(line.first);
+    std::string shown;
+    for (const ActiveRun::ShareProgress& s : run.Shares()) {
+      shown += (shown.empty() ? "" : " ") + s.name + ":" + s.step;
+    }
+    EXPECT_EQ(line.second, shown) << line.first;
+  }
 }
 
 TEST(ServiceFiles, StoreRefusesBrokenFilesOneByOneAndHistoryIsBounded) {
