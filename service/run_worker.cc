@@ -47,10 +47,7 @@ void ActiveRun::Note(const std::string& line) {
     // matched, not only its first word.
     if (rest == "started" || rest.compare(0, 12, "transferred ") == 0 ||
         rest == "key file copied") {
-      ShareProgress& share = shares_[share_];
-      share.name = share_;
-      share.step = step_;
-      share.transfer = KARO::Backup::RsyncWrapper::TransferProgress();
+      shares_[share_] = {share_, step_, {}};
     } else {
       shares_.erase(share_);
     }
