@@ -50,6 +50,22 @@ bool WriteAtomic(const std::string& path, const std::string& data, int mode) {
   return false;
 }
 
+// rsync counts "max connections" over all the modules that share a lock
+// file, so each module counts in a file of its own: otherwise commands and
+// other shares' transfers would take up a share's few places. The file is
+// named by a hash of the module (FNV-1a), which no share name can bend
+// into a path.
+std::string LockLine(const std::string& module) {
+  unsigned long long h = 14695981039346656037ull;
+  for (unsigned char c : module) {
+    h ^= c;
+    h *= 1099511628211ull;
+  }
+  char hex[17];
+  snprintf(hex, sizeof hex, "%016llx", h);
+  return "\tlock file = " + DaemonLockPath() + "." + hex + "\n";
+}
+
 struct ShareFree {
   void operator()(KARO_SHARE* s) const { KAROShareFree(s); }
 };
@@ -89,8 +105,9 @@ std::string ShareModule(const std::string& name, const std::string& hook,
   // One sync into a share at a time, plus room for a retry whose
   // predecessor has not ended yet.
   return "[" + module + "]\n\tpath = " + path +
-         "\n\tread only = no\n\tlist = no\n\tmax connections = 4\n" + links +
-         auth + "\tpre-xfer exec = " + hook + " data\n";
+         "\n\tread only = no\n\tlist = no\n\tmax connections = 4\n" +
+         LockLine(module) + links + auth + "\tpre-xfer exec = " + hook +
+         " data\n";
 }
 
 }  // namespace
@@ -179,12 +196,13 @@ int WriteDaemonConfig(const DaemonConfig& c) {
   // included) away from the others' replies.
   conf += std::string("[") + kCommandModule + "]\n\tpath = " + ReplyDir() +
           "/%RSYNC_USER_NAME%\n\tread only = yes\n\tlist = no\n"
-          "\tmax connections = 64\n"
-          "\trefuse options = delete recursive\n" +
+          "\tmax connections = 64\n" +
+          LockLine(kCommandModule) + "\trefuse options = delete recursive\n" +
           auth + "\tearly exec = " + hook + " early\n";
   conf += std::string("[") + kSpoolModule + "]\n\tpath = " + UploadDir() +
           "\n\tread only = no\n\twrite only = yes\n\tlist = no\n"
-          "\tmax connections = 16\n"
+          "\tmax connections = 16\n" +
+          LockLine(kSpoolModule) +
           "\trefuse options = delete recursive dirs links devices specials\n"
           "\tincoming chmod = u=rw,go=\n" +
           auth + "\tpre-xfer exec = " + hook +
@@ -192,10 +210,11 @@ int WriteDaemonConfig(const DaemonConfig& c) {
   conf += std::string("[") + kKeyModule +
           "]\n\tpath = " + KaroRootPath(KARO_SHARE_KEY_DIR) +
           "\n\tread only = no\n\twrite only = yes\n\tlist = no\n"
-          "\tmax connections = 8\n"
-          "\tfilter = - /*/**\n\tincoming chmod = u=rw,go=\n" +
-          auth + "\tpre-xfer exec = " + hook +
-          " keys\n\tpost-xfer exec = " + hook + " keys-done\n";
+          "\tmax connections = 8\n" +
+          LockLine(kKeyModule) +
+          "\tfilter = - /*/**\n\tincoming chmod = u=rw,go=\n" + auth +
+          "\tpre-xfer exec = " + hook + " keys\n\tpost-xfer exec = " + hook +
+          " keys-done\n";
 
   KSZLIST* names = KLIBCSzListAlloc();
   int count = names != nullptr ? KAROShareEnum(names) : -1;

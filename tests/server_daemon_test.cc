@@ -1,6 +1,9 @@
 // The server end to end: a generated daemon configuration, the real rsync
 // daemon on loopback running the real handler, and the client's wrapper.
+#include <netinet/in.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <filesystem>
 
@@ -96,6 +99,31 @@ class ServerDaemonTest : public ::testing::Test {
     return w.execute(boost::function<bool()>());
   }
 
+  // A connection to `module` that stops at the password challenge, by
+  // which point the daemon counts it against the module's limit; -1 when
+  // it was refused.
+  int Stalled(const std::string& module) {
+    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_in addr = {};
+    addr.sin_family = AF_INET;
+    addr.sin_port = htons(static_cast<uint16_t>(daemon_.port()));
+    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    std::string said, hello = "@RSYNCD: 31.0\n" + module + "\n";
+    if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0 &&
+        write(fd, hello.data(), hello.size()) ==
+            static_cast<ssize_t>(hello.size())) {
+      char buf[256];
+      ssize_t n;
+      while (said.find("AUTHREQD") == std::string::npos &&
+             (n = read(fd, buf, sizeof buf)) > 0) {
+        said.append(buf, static_cast<size_t>(n));
+      }
+    }
+    if (said.find("AUTHREQD") != std::string::npos) return fd;
+    close(fd);
+    return -1;
+  }
+
   s2s_test::TempRoot tmp_;
   s2s_test::RsyncDaemon daemon_{tmp_.path()};
   std::unique_ptr<s2s_test::ScopedEnv> port_;
@@ -122,7 +150,14 @@ TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   // No running sync yet: the data module refuses the push.
   EXPECT_NE(0, Push());
   ASSERT_EQ(0, Command("CL1", "S2S_SyncStart", start));
+  // Connections to other modules leave the share's own places free.
+  std::vector<int> stalled;
+  for (int i = 0; i < 4; ++i) stalled.push_back(Stalled("s2sspool"));
   EXPECT_EQ(0, Push());
+  for (int fd : stalled) {
+    EXPECT_GE(fd, 0);
+    close(fd);
+  }
   EXPECT_EQ("payload", ReadFile(tmp_.Sub("share1/file")));
   std::string upload = tmp_.Sub("var/spool/s2s/upload");
   ASSERT_TRUE(tmp_.MakeDir("/empty"));

@@ -65,8 +65,12 @@ std::string SshVariant(const std::string& conf) {
       continue;
     }
     if (line == "\tuse chroot = yes") line = "\tmunge symlinks = no";
-    if (line.compare(0, 12, "lock file = ") == 0) {
-      line = "lock file = " + SshRunDir() + "/rsyncd.lock";
+    // The daemon's and the modules' lock files, in a directory the user
+    // may write.
+    size_t lock = line[0] == '\t' ? 1 : 0;
+    if (line.compare(lock, 12, "lock file = ") == 0) {
+      line = line.substr(0, lock + 12) + SshRunDir() +
+             line.substr(line.rfind('/'));
     }
     if (line.compare(0, 16, "\tsecrets file = ") == 0) {
       line = "\tsecrets file = " + SshSecretsPath();
