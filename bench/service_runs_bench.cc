@@ -6,8 +6,10 @@
 // the data transfers the server's daemon served (counted in its log), and their
 // sum, the rsync invocations.
 #include <benchmark/benchmark.h>
+#include <stdio.h>
 
 #include <fstream>
+#include <mutex>
 #include <string>
 
 #include "appliances.h"
@@ -20,7 +22,22 @@ namespace {
 const int kShares = 50;
 
 void QuietLog(int, const char*) {}
-void QuietReport(const std::string&) {}
+// A run's report, kept for the failure of a run, which goes to stderr.
+struct Report {
+  std::mutex mu;
+  std::string text;
+  s2s_service::Reporter Keep() {
+    text.clear();
+    return [this](const std::string& line) {
+      std::lock_guard<std::mutex> lock(mu);
+      text += line + "\n";
+    };
+  }
+  void Failed(benchmark::State& state, const char* what) {
+    fprintf(stderr, "%s:\n%s", what, text.c_str());
+    state.SkipWithError(what);
+  }
+};
 
 std::string ShareName(int i) { return "share" + std::to_string(i); }
 
@@ -78,18 +95,19 @@ void BM_NoChangeRun(benchmark::State& state) {
   task.GetInfo().SetShareList(shares);
   task.GetInfo().SetSyncInfo(s.app.Info());
   s2s_service::Session session;
+  Report report;
   // The first sync, and the session the runs below reuse.
-  if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr, options,
+  if (s2s_service::RunTask(task, {}, 30, report.Keep(), nullptr, options,
                            &session)
           .exit_code != 0) {
-    return state.SkipWithError("first run failed");
+    return report.Failed(state, "first run failed");
   }
   std::pair<size_t, size_t> before = s.Served();
   for (auto _ : state) {
-    if (s2s_service::RunTask(task, {}, 30, QuietReport, nullptr, options,
+    if (s2s_service::RunTask(task, {}, 30, report.Keep(), nullptr, options,
                              &session)
             .exit_code != 0) {
-      return state.SkipWithError("run failed");
+      return report.Failed(state, "run failed");
     }
   }
   std::pair<size_t, size_t> after = s.Served();
