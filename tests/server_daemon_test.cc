@@ -109,6 +109,8 @@ class ServerDaemonTest : public ::testing::Test {
     addr.sin_port = htons(static_cast<uint16_t>(daemon_.port()));
     addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
     std::string said, hello = "@RSYNCD: 31.0\n" + module + "\n";
+    timeval bound = {10, 0};
+    setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &bound, sizeof bound);
     if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0 &&
         write(fd, hello.data(), hello.size()) ==
             static_cast<ssize_t>(hello.size())) {
