@@ -18,6 +18,7 @@
 #include <cstdint>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <random>
 #include <string>
 #include <vector>
@@ -252,6 +253,14 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   ASSERT_EQ(0, init.code) << init.out << init.err;
   Child start = as_user({"start"});
   ASSERT_EQ(0, start.code) << start.out << start.err;
+  // However the test ends, its daemon does not outlive it.
+  bool stopped = false;
+  struct AtEnd {
+    std::function<void()> run;
+    ~AtEnd() { run(); }
+  } stop_anyway{[&] {
+    if (!stopped) as_user({"stop"});
+  }};
 
   std::string client = MakeClient("client", "CLIENT-A");
   ASSERT_EQ(
@@ -263,6 +272,7 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   EXPECT_TRUE(S_ISLNK(st.st_mode));
   EXPECT_EQ("bravo from CLIENT-A\n", ReadFile(root + "/volume1/docs/link"));
   Child stop = as_user({"stop"});
+  stopped = true;
   EXPECT_EQ(0, stop.code) << stop.out << stop.err;
 }
 
