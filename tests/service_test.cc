@@ -402,6 +402,9 @@ TEST_F(ServiceTest, RunsSendOnlyNeededCommandsCancelCleanlyAndPairAgain) {
             Request(Action("get", id_long))["task"]["state"].asString());
 
   // SIGTERM during the next transfer: cancelled the same way, and s2sd ends.
+  // New data, so that the transfer outlasts the stop however much of the
+  // blob the cancelled run left to resume from.
+  WriteBlob(app_.ClientShare("big") + "/blob2", 41);
   ASSERT_EQ(0u, Request(Action("run", id_long))["result"].asUInt64());
   ASSERT_TRUE(
       WaitFor([&] { return RsyncLogCount(app_.ClientShare("big")) == 2; }, 30));
