@@ -1,9 +1,15 @@
 #include "service/task_map.h"
 
+#include <arpa/inet.h>
+#include <ctype.h>
 #include <stdlib.h>
+
+#include <set>
 
 #include "S2S/s2s_share.h"
 #include "S2S/sync_obj_pobject.h"
+#include "server/command_file.h"
+#include "server/hooks.h"
 
 namespace s2s_service {
 
@@ -124,7 +130,71 @@ bool CheckValue(const Key& k, const PObject& v) {
   return false;
 }
 
+// A DNS host name (RFC 1123, '_' tolerated for local names): dot-separated
+// labels of 1-63 letters, digits, '-' and '_', none starting or ending with
+// '-', 253 bytes at most. Whatever begins with '-' would read as an option.
+bool IsHostName(const std::string& s) {
+  if (s.empty() || s.size() > 253) return false;
+  size_t begin = 0;
+  for (;;) {
+    size_t end = s.find('.', begin);
+    if (end == std::string::npos) end = s.size();
+    size_t len = end - begin;
+    if (len == 0 || len > 63 || s[begin] == '-' || s[end - 1] == '-') {
+      return false;
+    }
+    for (size_t i = begin; i < end; ++i) {
+      unsigned char c = static_cast<unsigned char>(s[i]);
+      if (!isalnum(c) && c != '-' && c != '_') return false;
+    }
+    if (end == s.size()) return true;
+    begin = end + 1;
+    // One trailing dot names the root: "host.example." is fine.
+    if (begin == s.size()) return true;
+  }
+}
+
+bool IsIPv4(const std::string& s) {
+  in_addr a;
+  return inet_pton(AF_INET, s.c_str(), &a) == 1;
+}
+
 }  // namespace
+
+std::string ServerSideProblem(const std::string& task_name,
+                              const std::string& server_ip,
+                              const std::string& server_name,
+                              const std::string& user,
+                              const std::list<std::string>& shares) {
+  using namespace S2S::server;
+  if (!IsValidTaskName(task_name)) {
+    return "task name \"" + task_name + "\" would be refused by the server (" +
+           kTaskNameRule + ")";
+  }
+  if (!server_ip.empty() && !IsIPv4(server_ip) && !IsHostName(server_ip)) {
+    return "server address \"" + server_ip +
+           "\" is neither an IPv4 address nor a host name";
+  }
+  if (!server_name.empty() && !IsHostName(server_name)) {
+    return "server name \"" + server_name + "\" is not a host name";
+  }
+  if (!user.empty() && !IsValidDaemonUser(user)) {
+    return "user \"" + user +
+           "\" would be refused by the server (1-64 of letters, digits and "
+           ". _ - +, not . or ..)";
+  }
+  std::set<std::string> seen;
+  for (const std::string& share : shares) {
+    if (!IsValidShareName(share)) {
+      return "share name \"" + share + "\" would be refused by the server (" +
+             kShareNameRule + ")";
+    }
+    if (!seen.insert(share).second) {
+      return "share \"" + share + "\" is listed twice";
+    }
+  }
+  return "";
+}
 
 bool ReadTaskId(const PObject& value, unsigned long long& id) {
   if (value.isInteger()) {
@@ -225,7 +295,12 @@ bool CheckTask(const StoredTask& task, std::string& error) {
     error = "the task id must be at least 1";
     return false;
   }
-  if (info.Validate()) return true;
+  if (info.Validate()) {
+    error = ServerSideProblem(info.GetName(), sync.GetServerIP(),
+                              sync.GetServerName(), sync.GetUser(),
+                              info.GetShareList());
+    return error.empty();
+  }
   // Validate logs the rule it found broken; the same rules, in words.
   if (sync.GetServerIP().empty() && sync.GetServerName().empty()) {
     error = "no server address or name";

@@ -53,10 +53,21 @@ bool ApplyTaskMap(const S2S::PObject& in, StoredTask& task, std::string& error);
 // file), otherwise only "has_password".
 S2S::PObject TaskToMap(const StoredTask& task, bool with_password);
 
-// Whether the task may be stored and run: the library's TaskInfo::Validate
-// and an id of at least 1. False with `error` saying, in words, the first
-// rule broken.
+// Whether the task may be stored and run: the library's TaskInfo::Validate,
+// an id of at least 1 and no ServerSideProblem. False with `error` saying, in
+// words, the first rule broken.
 bool CheckTask(const StoredTask& task, std::string& error);
+
+// What the server would refuse, or what rsync cannot reach, about a task's
+// server and shares: an address that is neither an IPv4 address nor a host
+// name, a server name that is no host name, a user name the server's daemon
+// does not take, a task or share name the server refuses, a share listed
+// twice. Returns "" when all is well, else the first problem in words.
+std::string ServerSideProblem(const std::string& task_name,
+                              const std::string& server_ip,
+                              const std::string& server_name,
+                              const std::string& user,
+                              const std::list<std::string>& shares);
 
 // An id from the control socket: an integer, or a decimal string. Returns
 // true with `id` (at least 1), false for anything else.

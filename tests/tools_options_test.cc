@@ -81,13 +81,20 @@ TEST(ClientOptions, RefusesBadInputsWithoutEchoingSecrets) {
       {"[Task]\n\tcolour=\"red\"\n", {}, "unknown key 'colour'"},
       {"[Task]\n\tcompress=\"maybe\"\n", {}, "'compress'"},
       {"[Other]\n\tname=\"x\"\n", {}, "no [Task] section"},
-      {"", {"--task", "t1 "}, "task name 't1 ' would be refused by the server"},
-      {"",
-       {"--task=t1", "--share=a=b", "--server-ip=127.0.0.1", "--user=s2s"},
-       "share name 'a=b' would be refused by the server"},
+      {"", {"--task=t1 "}, "task name \"t1 \" would be refused"},
+      {"", {"--share=a=b"}, "share name \"a=b\" would be refused"},
+      {"", {"--share=docs", "--share=docs"}, "\"docs\" is listed twice"},
+      {"", {"--server-ip=::1"}, "neither an IPv4 address nor a host name"},
+      {"", {"--server-ip=-oX=y"}, "neither an IPv4 address nor a host name"},
+      {"", {"--server-name=a..b"}, "\"a..b\" is not a host name"},
+      {"", {"--user=u@h"}, "user \"u@h\" would be refused"},
   };
+  // A complete task but for what the case says.
+  const std::vector<std::string> base = {"--task=t1", "--share=docs",
+                                         "--server-ip=127.0.0.1", "--user=s2s"};
   for (const Case& c : cases) {
-    std::vector<std::string> args = c.args;
+    std::vector<std::string> args = base;
+    args.insert(args.end(), c.args.begin(), c.args.end());
     if (!c.task_file.empty()) {
       ASSERT_TRUE(WriteFile(tmp.Sub("t.task"), c.task_file));
       args.push_back("--task-file=" + tmp.Sub("t.task"));

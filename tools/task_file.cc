@@ -5,8 +5,8 @@
 #include <memory>
 
 #include "S2S/s2s_share.h"
-#include "command_file.h"
 #include "karo_section.h"
+#include "service/task_map.h"
 
 namespace s2s_tools {
 
@@ -131,9 +131,6 @@ bool LoadTaskFile(const std::string& path, TaskSpec& spec, std::string& error) {
 bool CheckTaskSpec(const TaskSpec& spec, std::string& error) {
   if (spec.name.empty()) {
     error = "no task name (--task)";
-  } else if (!S2S::server::IsValidTaskName(spec.name)) {
-    error = "task name '" + spec.name + "' would be refused by the server (" +
-            S2S::server::kTaskNameRule + ")";
   } else if (spec.shares.empty()) {
     error = "no share to sync (--share)";
   } else if (spec.server_ip.empty() && spec.server_name.empty()) {
@@ -141,13 +138,13 @@ bool CheckTaskSpec(const TaskSpec& spec, std::string& error) {
   } else if (spec.user.empty()) {
     error = "no daemon user (--user)";
   } else {
+    error = s2s_service::ServerSideProblem(
+        spec.name, spec.server_ip, spec.server_name, spec.user, spec.shares);
+    if (!error.empty()) return false;
     for (const std::string& share : spec.shares) {
       S2S::ShareInfo info;
       bool valid = false;
-      if (!S2S::server::IsValidShareName(share)) {
-        error = "share name '" + share + "' would be refused by the server (" +
-                S2S::server::kShareNameRule + ")";
-      } else if (S2S::GetShareInfo(share, info) != 0) {
+      if (S2S::GetShareInfo(share, info) != 0) {
         error = "no local share '" + share + "'";
       } else if (S2S::IsValidShare(share, valid) != 0 || !valid) {
         error = "share '" + share +

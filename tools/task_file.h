@@ -64,10 +64,10 @@ bool ParseNumber(const std::string& text, unsigned long long max,
 // Splits at ':' dropping empty pieces.
 std::list<std::string> SplitList(const std::string& text);
 
-// Checks that the task is complete (name, shares, server, user), that its
-// name and share names pass the server's name rules, and that every share is
-// known locally and may be synced. Returns true, or false
-// with `error`.
+// Checks that the task is complete (name, shares, server, user), that
+// nothing in it is what the server would refuse (s2s_service's
+// ServerSideProblem), and that every share is known locally and may be
+// synced. Returns true, or false with `error`.
 bool CheckTaskSpec(const TaskSpec& spec, std::string& error);
 
 // The library's task for `spec` with `password`.
