@@ -73,6 +73,8 @@ class Daemon {
     std::unique_ptr<Watcher> watcher;
     std::unique_ptr<RealtimeSession> session;
     std::vector<S2S::Event> batch;  // in flight
+    bool confirm_full = false;      // the next full sync may delete past
+                                    // the guard
   };
 
   bool Setup();

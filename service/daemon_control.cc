@@ -314,6 +314,12 @@ PObject Daemon::DoRun(const PObject& request) {
                            "stopped (disable it first)");
     }
     watching->second.watcher->FullSync(clock_.MonotonicSeconds());
+    if (options.confirm_deletions) {
+      watching->second.confirm_full = true;
+      return Ok(name +
+                ": a full sync of every share is queued; it may delete past "
+                "the delete guard");
+    }
     return Ok(name + ": a full sync of every share is queued");
   }
   // A dry run does not stand in for the retry that a failed run awaits.

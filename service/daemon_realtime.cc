@@ -10,6 +10,7 @@
 
 #include "S2S/logger.h"
 #include "service/daemon.h"
+#include "service/exit_codes.h"
 
 namespace s2s_service {
 
@@ -23,7 +24,7 @@ bool IsRealtime(const StoredTask& t) {
 
 bool SameSettings(const StoredTask& a, const StoredTask& b) {
   return a.task == b.task && a.excludes == b.excludes &&
-         a.realtime == b.realtime;
+         a.realtime == b.realtime && a.guard == b.guard;
 }
 
 bool HasWhole(const std::vector<S2S::Event>& batch) {
@@ -185,7 +186,9 @@ void Daemon::StartBatches() {
       S2S::Logger::LogMsg(S2S::Logger::Error, "[ERROR] s2sd: %s\n",
                           error.c_str());
     }
-    rt.session->Push(rt.batch);
+    bool confirmed = rt.confirm_full && HasWhole(rt.batch);
+    if (confirmed) rt.confirm_full = false;
+    rt.session->Push(rt.batch, confirmed);
   }
 }
 
@@ -226,16 +229,21 @@ PObject Daemon::BatchMap(const BatchResult& r, bool whole) const {
   map["start"] = static_cast<unsigned long long>(r.started);
   map["end"] = static_cast<unsigned long long>(r.ended);
   map["trigger"] = whole ? "full sync" : "realtime";
-  map["outcome"] = r.ok ? "ok" : r.cancelled ? "cancelled" : "failed";
+  bool held = r.ok && !r.held.empty();
+  map["outcome"] = held          ? "held"
+                   : r.ok        ? "ok"
+                   : r.cancelled ? "cancelled"
+                                 : "failed";
   std::string message = std::to_string(r.pushed) + " paths, " +
                         std::to_string(r.runs) + " rsync runs";
+  if (held) message += "; " + r.held;
   if (!r.error.empty()) {
     message += "; " + r.error + "; " + std::to_string(r.unpushed.size()) +
                " paths kept for the next try";
   }
   map["message"] = message;
   map["task_status"] = 1;  // a watching task stays busy on the server
-  map["task_result"] = r.ok ? 0 : 1;
+  map["task_result"] = held ? kExitDeletions : r.ok ? 0 : 1;
   map["paths"] = static_cast<unsigned long long>(r.pushed);
   map["runs"] = static_cast<unsigned long long>(r.runs);
   PObject::Array shares;

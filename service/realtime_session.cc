@@ -12,6 +12,7 @@
 #include "S2S/s2s_share.h"
 #include "service/batcher.h"
 #include "service/config.h"
+#include "service/share_transfer.h"
 
 namespace s2s_service {
 
@@ -71,9 +72,10 @@ RealtimeSession::~RealtimeSession() {
   Join();
 }
 
-void RealtimeSession::Push(std::vector<S2S::Event> batch) {
+void RealtimeSession::Push(std::vector<S2S::Event> batch, bool confirmed) {
   std::lock_guard<std::mutex> lock(mu_);
   batch_ = std::move(batch);
+  confirmed_ = confirmed;
   has_batch_ = true;
   wake_.notify_all();
 }
@@ -149,9 +151,54 @@ void RealtimeSession::Beacon(const char* when) {
   BeaconSent();
 }
 
+bool RealtimeSession::PushPath(const std::string& name, const std::string& path,
+                               bool confirmed, ShareOutcome& share,
+                               BatchResult& r) {
+  using KARO::Backup::RsyncWrapper;
+  RsyncWrapper::TransferMode mode;
+  mode.max_delete = task_.guard.on && !confirmed ? 0 : -1;
+  RsyncWrapper::TransferStats stats;
+  for (;;) {
+    RsyncWrapper::setThreadProgressHandler(
+        [](const RsyncWrapper::TransferProgress&) {});
+    RsyncWrapper::setThreadTransferMode(mode);
+    int status = 0;
+    int rc = rsyncer_->RunSync(id_, name, path, task_.excludes, status);
+    // Read before the handler goes: clearing it clears the figures too.
+    stats = RsyncWrapper::lastStats();
+    RsyncWrapper::setThreadTransferMode(RsyncWrapper::TransferMode());
+    RsyncWrapper::setThreadProgressHandler({});
+    AddStats(share.stats, stats);
+    ++r.runs;
+    if (rc != 0 || (status != 0 && status != kVanished)) {
+      share.failed_step = "transfer";
+      share.status = status != 0 ? status : rc;
+      share.cause = FailureText(share.status);
+      return false;
+    }
+    unsigned long long held = stats.deletions_skipped;
+    if (mode.max_delete != 0 || held == 0) break;
+    unsigned long long entries = EntriesBefore(stats, held);
+    if (path != "/") entries = std::max(entries, entries_[name]);
+    std::string refusal = GuardRefusal(task_.guard, held, entries);
+    if (!refusal.empty()) {
+      // The rest went through; the deletions wait for a confirmed run.
+      if (share.failed_step.empty()) {
+        share.failed_step = "guard";
+        share.status = kDeletionsHeld;
+        share.cause = path == "/" ? refusal : path + ": " + refusal;
+      }
+      return true;
+    }
+    mode.max_delete = -1;
+  }
+  if (path == "/" && stats.complete) entries_[name] = stats.files;
+  return true;
+}
+
 void RealtimeSession::PushShare(const std::string& name,
                                 const std::vector<S2S::Event>& events,
-                                BatchResult& r) {
+                                bool confirmed, BatchResult& r) {
   ShareOutcome share;
   share.name = name;
   auto keep = [&](size_t from) {
@@ -180,17 +227,7 @@ void RealtimeSession::PushShare(const std::string& name,
     bool covered = false;
     for (const std::string& p : pushed) covered = covered || Inside(path, p);
     if (!covered) {
-      KARO::Backup::RsyncWrapper::setThreadProgressHandler(
-          [](const KARO::Backup::RsyncWrapper::TransferProgress&) {});
-      status = 0;
-      rc = rsyncer_->RunSync(id_, name, path, task_.excludes, status);
-      KARO::Backup::RsyncWrapper::setThreadProgressHandler({});
-      AddStats(share.stats, KARO::Backup::RsyncWrapper::lastStats());
-      ++r.runs;
-      if (rc != 0 || (status != 0 && status != kVanished)) {
-        share.failed_step = "transfer";
-        share.status = status != 0 ? status : rc;
-        share.cause = FailureText(share.status);
+      if (!PushPath(name, path, confirmed, share, r)) {
         keep(i);
         break;
       }
@@ -199,7 +236,8 @@ void RealtimeSession::PushShare(const std::string& name,
     ++r.pushed;
   }
   share.seconds = Now() - t0;
-  if (share.failed_step.empty() && info.IsEncrypted()) {
+  bool held = share.failed_step == "guard";
+  if ((share.failed_step.empty() || held) && info.IsEncrypted()) {
     rc = rsyncer_->SyncEncryptKey(name);
     if (rc != 0) {
       share.failed_step = "key";
@@ -211,16 +249,22 @@ void RealtimeSession::PushShare(const std::string& name,
   // does not hold its sync as running.
   status = 0;
   rc = rsyncer_->FinishSync("share", name, status);
-  if (share.failed_step.empty() && (rc != 0 || status != 0)) {
+  if ((share.failed_step.empty() || held) && (rc != 0 || status != 0)) {
     share.failed_step = "finish";
     share.status = status != 0 ? status : rc;
     share.cause = FailureText(share.status);
+    held = false;
+  }
+  if (held) {
+    r.held +=
+        (r.held.empty() ? "share " : "; share ") + name + ": " + share.cause;
   }
   share.ok = share.failed_step.empty();
   r.shares.push_back(share);
 }
 
-BatchResult RealtimeSession::RunBatch(const std::vector<S2S::Event>& batch) {
+BatchResult RealtimeSession::RunBatch(const std::vector<S2S::Event>& batch,
+                                      bool confirmed) {
   BatchResult r;
   r.started = static_cast<long>(time(nullptr));
   std::map<std::string, std::vector<S2S::Event>> by_share;
@@ -241,11 +285,13 @@ BatchResult RealtimeSession::RunBatch(const std::vector<S2S::Event>& batch) {
     r.unpushed = batch;
   } else {
     SetBeaconHook([this] { Beacon("transfer running"); }, beacon_interval_);
-    for (const auto& it : by_share) PushShare(it.first, it.second, r);
+    for (const auto& it : by_share) {
+      PushShare(it.first, it.second, confirmed, r);
+    }
     SetBeaconHook(nullptr, 0);
     last_contact_ = Now();
     for (const ShareOutcome& s : r.shares) {
-      if (s.ok) continue;
+      if (s.ok || s.failed_step == "guard") continue;
       r.error =
           "share " + s.name + ": " + s.failed_step + " failed: " + s.cause;
       connected_at_ = -1;
@@ -266,8 +312,9 @@ void RealtimeSession::Main() {
     if (has_batch_) {
       std::vector<S2S::Event> batch;
       batch.swap(batch_);
+      bool confirmed = confirmed_;
       lock.unlock();
-      BatchResult r = RunBatch(batch);
+      BatchResult r = RunBatch(batch, confirmed);
       lock.lock();
       result_ = std::move(r);
       has_result_ = true;

@@ -6,7 +6,11 @@
 // sync announced (StartSyncShare), each sub-path pushed (RunSync, with the
 // task's excludes; a path gone meanwhile is pushed through the nearest
 // directory that is still there), an encrypted share's key file, and the
-// share's end (FinishSync). While the task watches, a beacon goes out
+// share's end (FinishSync). The task's mass-delete guard holds as in a run:
+// a push that would delete more than it allows deletes nothing (the rest
+// goes through) unless the batch is confirmed, and its paths are not tried
+// again; a part of a share counts against the share's entries as the last
+// full push of it found them. While the task watches, a beacon goes out
 // whenever the beacon interval passes without one, so the server shows the
 // task busy; when the session stops it reports the task's end.
 //
@@ -18,6 +22,7 @@
 
 #include <condition_variable>
 #include <functional>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -40,6 +45,7 @@ struct BatchResult {
   size_t runs = 0;                   // rsync transfers made
   std::vector<S2S::Event> unpushed;  // to be tried again
   std::vector<ShareOutcome> shares;  // figures summed per share
+  std::string held;                  // deletions the guard held, in words
   long started = 0, ended = 0;       // wall clock
 };
 
@@ -57,7 +63,8 @@ class RealtimeSession {
 
   unsigned long long id() const { return id_; }
   // Hands over a batch. REQUIRES: the previous one has ended.
-  void Push(std::vector<S2S::Event> batch);
+  // `confirmed`: deletions past the guard go ahead.
+  void Push(std::vector<S2S::Event> batch, bool confirmed = false);
   // The result of the batch that ended; false when none waits.
   bool TakeResult(BatchResult& result);
   // Stops the batch's transfer; what it did not push comes back unpushed.
@@ -73,9 +80,13 @@ class RealtimeSession {
   void Main();
   bool Connect(std::string& error);
   void Beacon(const char* when);
-  BatchResult RunBatch(const std::vector<S2S::Event>& batch);
+  BatchResult RunBatch(const std::vector<S2S::Event>& batch, bool confirmed);
   void PushShare(const std::string& share,
-                 const std::vector<S2S::Event>& events, BatchResult& r);
+                 const std::vector<S2S::Event>& events, bool confirmed,
+                 BatchResult& r);
+  // One path of `share` pushed within the guard; false when rsync failed.
+  bool PushPath(const std::string& share, const std::string& path,
+                bool confirmed, ShareOutcome& out, BatchResult& r);
 
   const unsigned long long id_;
   const StoredTask task_;
@@ -86,10 +97,13 @@ class RealtimeSession {
   std::unique_ptr<S2S::Rsyncer> rsyncer_;
   double connected_at_ = -1;  // monotonic; -1 not connected
   double last_contact_ = 0;
+  // Entries of each share's copy on the server after its last full push.
+  std::map<std::string, unsigned long long> entries_;
 
   mutable std::mutex mu_;
   std::condition_variable wake_;
   bool stop_ = false, ended_ = false, has_batch_ = false, has_result_ = false;
+  bool confirmed_ = false;
   std::vector<S2S::Event> batch_;
   BatchResult result_;
   std::thread thread_;

@@ -16,9 +16,6 @@ namespace {
 
 using KARO::Backup::RsyncWrapper;
 
-// rsync's own exit code for deletions that --max-delete stopped.
-const int kDeletionsHeld = 25;
-
 double Now() {
   timespec ts;
   clock_gettime(CLOCK_MONOTONIC, &ts);
@@ -49,13 +46,6 @@ void SetResumeMark(const std::string& share, bool on) {
     return;
   }
   close(fd);
-}
-
-// The entries of the server's copy before the push: those of the client's
-// list that it had already, and those only it has (the deletions).
-unsigned long long OnServer(const RsyncWrapper::TransferStats& s,
-                            unsigned long long deletions) {
-  return s.files - std::min(s.files_created, s.files) + deletions;
 }
 
 // The most deletions `guard` lets through on a copy of `entries`.
@@ -127,15 +117,10 @@ PushResult PushShare(S2S::Rsyncer& rsyncer, unsigned long long task_id,
   SetResumeMark(out.name, false);
   unsigned long long held = out.stats.deletions_skipped;
   if (held == 0) return result;
-  unsigned long long entries = OnServer(out.stats, held);
-  unsigned long long allowed = Allowed(options.guard, entries);
-  if (held > allowed) {
+  result.held =
+      GuardRefusal(options.guard, held, EntriesBefore(out.stats, held));
+  if (!result.held.empty()) {
     result.status = kDeletionsHeld;
-    result.held = "deletions held back: " + std::to_string(held) + " of " +
-                  std::to_string(entries) +
-                  " entries on the server would be deleted, more than the "
-                  "guard allows (" +
-                  std::to_string(allowed) + "); confirm the run to delete them";
     return result;
   }
   mode.max_delete = -1;
@@ -144,11 +129,29 @@ PushResult PushShare(S2S::Rsyncer& rsyncer, unsigned long long task_id,
   return result;
 }
 
+// Those of the client's list that it had already, and those only it has
+// (the deletions).
+unsigned long long EntriesBefore(const RsyncWrapper::TransferStats& s,
+                                 unsigned long long held) {
+  return s.files - std::min(s.files_created, s.files) + held;
+}
+
+std::string GuardRefusal(const DeleteGuard& guard, unsigned long long held,
+                         unsigned long long entries) {
+  unsigned long long allowed = Allowed(guard, entries);
+  if (held <= allowed) return "";
+  return "deletions held back: " + std::to_string(held) + " of " +
+         std::to_string(entries) +
+         " entries on the server would be deleted, more than the guard "
+         "allows (" +
+         std::to_string(allowed) + "); confirm the run to delete them";
+}
+
 std::string DryRunSummary(const ShareOutcome& share, const DeleteGuard& guard) {
   const RsyncWrapper::TransferStats& s = share.stats;
   std::string line = "would send " + std::to_string(s.would_send) +
                      ", delete " + std::to_string(s.would_delete);
-  unsigned long long allowed = Allowed(guard, OnServer(s, s.would_delete));
+  unsigned long long allowed = Allowed(guard, EntriesBefore(s, s.would_delete));
   if (guard.on && s.would_delete > allowed) {
     line += " (more than the guard allows, " + std::to_string(allowed) +
             ": a run would hold the deletions back unless confirmed)";

@@ -41,6 +41,22 @@ PushResult PushShare(
     const KARO::Backup::RsyncWrapper::ProgressHandler& progress,
     ShareOutcome& out);
 
+// The guard's verdict on `held` deletions from a copy of `entries` entries:
+// "" when they stay within what it allows, else its refusal in words, with
+// the counts.
+std::string GuardRefusal(const DeleteGuard& guard, unsigned long long held,
+                         unsigned long long entries);
+
+// The entries the server's copy had before a push with figures `s` that
+// held back `held` deletions (of the pushed tree only, for a part of it).
+unsigned long long EntriesBefore(
+    const KARO::Backup::RsyncWrapper::TransferStats& s,
+    unsigned long long held);
+
+// rsync's own exit code for deletions that --max-delete stopped; a share's
+// status when the guard held its deletions back.
+const int kDeletionsHeld = 25;
+
 // A dry run's finding for a share in one line: how much would be sent and
 // deleted, and whether the guard would hold the deletions back.
 std::string DryRunSummary(const ShareOutcome& share, const DeleteGuard& guard);

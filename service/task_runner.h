@@ -52,6 +52,9 @@ struct DeleteGuard {
   bool on = true;
   unsigned int percent = 50;
   unsigned long long files = 10000;
+  bool operator==(const DeleteGuard& o) const {
+    return on == o.on && percent == o.percent && files == o.files;
+  }
 };
 
 struct RunOptions {

@@ -215,6 +215,10 @@ class RealtimeTest : public s2s_test::S2sdTest,
 
 TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   WriteFile(client_ + "/before.txt", "made before the task\n");
+  // Enough for the deletions below to stay within the delete guard.
+  fs::create_directories(client_ + "/base");
+  for (int i = 0; i < 30; ++i)
+    WriteFile(client_ + "/base/" + std::to_string(i), "");
   // A share's directory is looked at every 0.2 s instead of 2 s.
   StartDaemon({"--watch-check-ms", "200"});
   const PObject status = AddLive();
@@ -282,10 +286,37 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   WriteFile(client_ + "/back.txt", "back\n");
   EXPECT_LE(0, Arrival("/back.txt", "back\n"));
 
-  // Disabled: the server shows the task idle again.
+  // Back empty (a volume mounted over it, say): the guard holds the mass
+  // deletion while the rest arrives, until a confirmed full sync.
   PObject id;
   id = PObject::Map();
   id["id"] = 1u;
+  size_t kept = Files(server_);
+  fs::rename(client_, client_ + ".old");
+  fs::create_directories(client_);
+  WriteFile(client_ + "/fresh.txt", "fresh\n");
+  EXPECT_LE(0, Arrival("/fresh.txt", "fresh\n")) << Log();
+  PObject last;
+  EXPECT_TRUE(WaitUntil(
+      [&] {
+        PObject runs = Request("history", id)["runs"];
+        if (!runs.isArray() || runs.asArray().empty()) return false;
+        last = runs.asArray()[0];
+        return last["outcome"].asString() == "held";
+      },
+      10))
+      << Log();
+  EXPECT_EQ(kept + 1, Files(server_));
+  // The batch's figures count what it sent: fresh.txt's 6 bytes.
+  const PObject shares = last["shares"];
+  EXPECT_LE(6u, shares[0u]["bytes"].asUInt64()) << last["message"].asString();
+  PObject confirmed = id;
+  confirmed["confirm_deletions"] = 1u;
+  ASSERT_EQ(0u, Request("run", confirmed)["result"].asUInt64());
+  EXPECT_TRUE(WaitSlowly([&] { return Same(); }, 10)) << Log();
+  fs::remove_all(client_ + ".old");
+
+  // Disabled: the server shows the task idle again.
   ASSERT_EQ(0u, Request("disable", id)["result"].asUInt64());
   EXPECT_TRUE(WaitUntil(
       [&] { return app_.ServerRegistry("TASK_live", "status") == "idle"; },
