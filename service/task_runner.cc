@@ -1,6 +1,7 @@
 #include "service/task_runner.h"
 
 #include <stdio.h>
+#include <sys/stat.h>
 #include <time.h>
 
 #include <algorithm>
@@ -107,6 +108,8 @@ class Run {
   PushResult Push(S2S::Rsyncer& r, ShareOutcome& share);
   void DryRun();
   bool ShareStep(ShareOutcome& share, const char* step, int rc, int status);
+  // False, with the share failed at "start", when its directory is gone.
+  bool ShareThere(ShareOutcome& share, S2S::Rsyncer& r);
   void FinishTask();
   // The exit code and error from the shares' outcomes.
   void Outcome();
@@ -273,6 +276,23 @@ bool Run::ShareStep(ShareOutcome& share, const char* step, int rc, int status) {
   return false;
 }
 
+bool Run::ShareThere(ShareOutcome& share, S2S::Rsyncer& r) {
+  // rsync would send nothing from a missing directory and call that done;
+  // an unmounted volume is no share synced.
+  S2S::ShareInfo info;
+  struct stat st;
+  if (r.GetShareInfo(share.name, info) != 0 ||
+      (stat(info.GetModulePath().c_str(), &st) == 0 && S_ISDIR(st.st_mode))) {
+    return true;
+  }
+  share.failed_step = "start";
+  share.status = -1;
+  share.cause = "its directory " + info.GetModulePath() +
+                " is not there (deleted, moved or unmounted)";
+  report_("share " + share.name + ": start failed: " + share.cause);
+  return false;
+}
+
 PushResult Run::Push(S2S::Rsyncer& r, ShareOutcome& share) {
   const std::string& name = share.name;
   return PushShare(
@@ -288,6 +308,7 @@ PushResult Run::Push(S2S::Rsyncer& r, ShareOutcome& share) {
 ShareOutcome Run::SyncShare(const std::string& name, S2S::Rsyncer& r) {
   ShareOutcome share;
   share.name = name;
+  if (!ShareThere(share, r)) return share;
   int status = 0;
   int rc = r.StartSyncShare(name, status);
   if (ShareStep(share, "start", rc, status)) {
@@ -324,6 +345,10 @@ void Run::DryRun() {
     if (CancelRequested()) break;
     ShareOutcome share;
     share.name = name;
+    if (!ShareThere(share, rsyncer_)) {
+      out_.shares.push_back(share);
+      continue;
+    }
     PushResult push = Push(rsyncer_, share);
     share.ok = ShareStep(share, "transfer", push.rc, push.status);
     if (share.ok) {

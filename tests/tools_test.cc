@@ -366,6 +366,11 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
   EXPECT_EQ(before, ReadFile(registry));
   EXPECT_EQ("alpha\n", ReadFile(server_ + "/volume1/docs/a.txt"));
   EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/docs/new.txt"));
+  // Its directory gone (a volume not mounted): failed, not "synced".
+  std::filesystem::rename(client + "/volume1/docs", client + "/docs.away");
+  ExpectRuns({{Client(client, "docs"), kExitShare,
+               "is not there (deleted, moved or unmounted)"}});
+  std::filesystem::rename(client + "/docs.away", client + "/volume1/docs");
 
   std::string extra = tmp_.Sub("extra");
   ExpectRuns({{ServerArgv({"share", "add", "extra=" + extra}), 0,
