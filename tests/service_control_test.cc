@@ -96,6 +96,7 @@ TEST(CtlOptions, TaskOptionsBecomeOnlyTheKeysTheyName) {
       {{"task", "edit", "x", "--settle", "1e3"}, ""},
       {{"task", "edit", "x", "--change-source", "dnotify"}, ""},
       {{"history", "x", "--limit", "5"}, "{}"},
+      {{"history", "x", "--limit", "0"}, ""},
       {{"task", "add", "--password", "secret"}, ""},
       {{"status", "--at", "10:00"}, ""},
       {{"run"}, ""},

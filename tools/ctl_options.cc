@@ -473,7 +473,11 @@ bool ParseCtlArgs(int argc, char** argv, CtlOptions& o, std::string& error) {
         o.json = true;
         break;
       case kLimit:
-        if (!Number("limit", optarg, 1000, o.limit, error)) return false;
+        // The daemon keeps 50 runs a task; 0 would read as "not given".
+        if (!Number("limit", optarg, 50, o.limit, error) || o.limit == 0) {
+          return Fail(error, std::string("bad value for --limit: ") + optarg +
+                                 " (1 to 50)");
+        }
         limit_given = true;
         break;
       case kDryRun:
