@@ -99,6 +99,18 @@ TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
        {{"share", "list"}, 0, root + "/volume1/extra, encrypted"},
        {{"share", "remove", "nosuch"}, 1, "no share nosuch"},
        {{"share", "remove", "extra"}, 0, "share: extra removed"},
+       // What the daemon would misread, or what would mix data.
+       {{"share", "add", "%RSYNC_USER_NAME%"}, 1, "no '%'"},
+       {{"share", "add", "tr=" + root + "/volume1/docs "},
+        1,
+        "end with a blank"},
+       {{"share", "add", "a b  c"}, 1, "two blanks in a row"},
+       {{"share", "add", "Docs"}, 1, "only in case"},
+       {{"share", "add", "S2SCMD"}, 1, "the daemon's own"},
+       {{"share", "add", "docs"}, 1, "is there already"},
+       {{"share", "add", "all=" + root}, 1, "the server's own"},
+       {{"share", "add", "vol=" + root + "/volume1"}, 1, "each other's data"},
+       {{"share", "add", "sys=/etc/ssh"}, 1, "a system directory"},
        {{"share", "move", "docs"}, 2, "share add NAME[=PATH]"},
        {{"stop"}, 0, "was not running"},
        {{"status", "extra"}, 2, "unexpected arguments to status"},
@@ -110,6 +122,19 @@ TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
        {{"status", "--no-such-option"}, 2, "unknown or incomplete option"},
        {{"--version"}, 0, "s2s-server "},
        {{"--help"}, 0, "ssh-setup --user USER --key-file FILE"}});
+
+  // Shares added at once all arrive: each change waits for the last.
+  std::vector<Child> adds;
+  for (int i = 0; i < 6; ++i) {
+    adds.push_back(
+        s2s_test::Spawn(tmp.path(), {S2S_SERVER_PROGRAM, "--root", root,
+                                     "share", "add", "p" + std::to_string(i)}));
+  }
+  for (Child& c : adds) EXPECT_EQ(0, c.Wait()) << c.err;
+  const std::string daemon_conf = ReadFile(root + "/etc/s2s/rsyncd.conf");
+  for (int i = 0; i < 6; ++i) {
+    EXPECT_TRUE(Has(daemon_conf, "[p" + std::to_string(i) + "]")) << i;
+  }
 
   // The old line of the same key was replaced, the other key kept.
   const std::string conf = root + "/etc/s2s/rsyncd-ssh.conf";

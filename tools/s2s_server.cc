@@ -13,18 +13,22 @@
 //
 // Exit codes: 0 done, 1 failed, 2 usage, 3 the daemon is not running
 // (status, pairings).
+#include <fcntl.h>
 #include <getopt.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/file.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <string>
 #include <vector>
 
 #include "S2S/is_syncedshare.h"
 #include "S2S/logger.h"
 #include "karo_root.h"
+#include "root_files.h"
 #include "secret.h"
 #include "server_daemon.h"
 #include "server_report.h"
@@ -185,6 +189,7 @@ int Share(const Args& a) {
     if (!ParseShareSpec(w[1], s)) return Usage("bad share " + w[1]);
     s.encrypted = a.spec.encrypted;
     add.spec.shares.push_back(s);
+    add.spec.add_only = true;
     return AddShares(add);
   }
   if (w.size() == 2 && w[0] == "remove") {
@@ -366,6 +371,25 @@ int main(int argc, char** argv) {
     return Usage(
         "no root: give --root DIR or set S2S_ROOT (--root / for "
         "the real one)");
+  }
+  // The daemon's configuration names paths under the root, and the daemon
+  // runs elsewhere: a relative root is made absolute here.
+  std::error_code ec;
+  std::string absolute =
+      std::filesystem::absolute(root, ec).lexically_normal().string();
+  if (ec) return Usage(std::string("bad root ") + root);
+  if (absolute.size() > 1 && absolute.back() == '/') absolute.pop_back();
+  setenv(KARO_ROOT_ENV, absolute.c_str(), 1);
+  // One change of a root at a time (two shares added at once would each
+  // rewrite the configuration from what it read): its directory is the
+  // lock, held until this program ends.
+  bool reads_only = a.command == "status" || a.command == "pairings" ||
+                    (a.command == "share" && a.words.size() == 1);
+  if (!reads_only) {
+    std::string error;
+    if (a.command == "init" && !MakeDirs(absolute, error)) return Fail(error);
+    int lock = open(absolute.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (lock >= 0) flock(lock, LOCK_EX);
   }
   if (a.command == "config" && a.user.empty()) return Usage("config: --user");
   if (a.command == "ssh-setup" && (a.user.empty() || a.ssh.key_file.empty())) {

@@ -22,14 +22,27 @@ struct RootSpec {
   std::string hostname;    // "" keeps the machine's
   std::string serial;      // "" keeps the machine's
   bool encrypted = false;  // --encrypted: every share given is encrypted
+  // share add: a share already there is refused, not replaced.
+  bool add_only = false;
 };
 
 // Parses "NAME" or "NAME=PATH". False when the name is not a valid share
 // name or the path is not absolute.
 bool ParseShareSpec(const std::string& text, ShareSpec& out);
 
+// Why `s` cannot be a share of this server, where `others` (name and
+// directory) are the shares it keeps, or "". The daemon's configuration
+// would misread it (a '%', a blank at the end of its directory, two blanks
+// in a row in its name), its name is one of the daemon's own modules or
+// differs from another share's only in case, or its directory holds or lies
+// within another share's, the server's own state or a system directory.
+std::string ServerShareProblem(
+    const ShareSpec& s,
+    const std::vector<std::pair<std::string, std::string>>& others);
+
 // Adds the shares to /etc/s2s/shares.conf (a share already there is
-// replaced), creates their directories (for an encrypted share its
+// replaced, unless `add_only`), after checking them all with
+// ServerShareProblem, creates their directories (for an encrypted share its
 // encrypted directory too), merges the identity into
 // /etc/s2s/platform.conf (names looked up in the root's hosts file only),
 // creates the registry with the service switched on, and the directories
