@@ -403,6 +403,13 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
     KLIBCSzHashFree(stuck);
     ASSERT_EQ(0, KAROUISetS2S(1, "OLD-1", "oldname"));
   }
+  // An upload at 1 KiB/s for a minute, cut by the stop below: the daemon's
+  // connections end with it.
+  WriteFile(tmp_.Sub("upload"), std::string(60 << 10, 'u'));
+  Child upload = Spawn(tmp_.path(),
+                       {"rsync", "--bwlimit=1", tmp_.Sub("upload"),
+                        "rsync://s2s@127.0.0.1:" + port_ + "/s2sspool/up1"},
+                       {std::string("RSYNC_PASSWORD=") + kPassword});
   ExpectRuns({
       {ServerArgv({"status"}), 0, "service:  running"},
       {ServerArgv({"status"}), 0, "last completed by CLIENT-A"},
@@ -420,6 +427,7 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
       {ServerArgv({"pairings", "--json"}), 3, "\"SHARE_extra\": {"},
       {ServerArgv({"start"}), 0, "daemon: pid"},
   });
+  EXPECT_NE(0, upload.Wait()) << "the upload outlived the daemon's stop";
   EXPECT_EQ("", ShareKey("docs", "RunningID"));
 }
 

@@ -12,6 +12,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <fstream>
 #include <sstream>
 
@@ -24,6 +25,28 @@
 namespace s2s_tools {
 
 namespace {
+
+// Whether a process that has not yet ended is in process group `pgid` (a
+// zombie waiting for its parent to reap it has ended).
+bool GroupRuns(pid_t pgid) {
+  std::error_code ec;
+  for (const auto& e : std::filesystem::directory_iterator("/proc", ec)) {
+    const std::string name = e.path().filename().string();
+    if (name.find_first_not_of("0123456789") != std::string::npos) continue;
+    std::ifstream in(e.path() / "stat");
+    std::string stat((std::istreambuf_iterator<char>(in)), {});
+    size_t paren = stat.rfind(')');
+    if (paren == std::string::npos) continue;
+    // After the name: the state, the parent and the process group.
+    std::istringstream fields(stat.substr(paren + 2));
+    char state = 0;
+    long parent = 0, group = 0;
+    if (fields >> state >> parent >> group && group == pgid && state != 'Z') {
+      return true;
+    }
+  }
+  return false;
+}
 
 const int kStartAttempts = 5;
 const int kStartWaitMs = 5000;
@@ -215,15 +238,20 @@ int StopServerDaemon(std::string& error) {
             " is not this root's rsync daemon; not signalled, pid file kept";
     return -1;
   }
-  if (kill(pid, SIGTERM) != 0) {
+  // A daemon that leads its process group (as ExecDaemon starts it) has its
+  // connections, and the transfers they run, in that group: they end too.
+  pid_t target = getpgid(pid) == pid ? -pid : pid;
+  if (kill(target, SIGTERM) != 0) {
     error = "cannot signal pid " + std::to_string(pid) + ": " + strerror(errno);
     return -1;
   }
-  for (int waited = 0; KLIBCProcAliveByPidFile(pid_path.c_str()) == 1;
+  for (int waited = 0;
+       target < 0 ? GroupRuns(pid)
+                  : KLIBCProcAliveByPidFile(pid_path.c_str()) == 1;
        waited += 10) {
-    if (waited == kStopWaitMs) kill(pid, SIGKILL);
+    if (waited == kStopWaitMs) kill(target, SIGKILL);
     if (waited > 2 * kStopWaitMs) {
-      error = "pid " + std::to_string(pid) + " does not end";
+      error = "pid " + std::to_string(pid) + " or its connections do not end";
       return -1;
     }
     SleepMs(10);
