@@ -30,6 +30,8 @@
 #include "karo_root.h"
 #include "root_files.h"
 #include "secret.h"
+#include "server/command_file.h"
+#include "server/hooks.h"
 #include "server_daemon.h"
 #include "server_report.h"
 #include "server_root.h"
@@ -132,6 +134,11 @@ int Usage(const std::string& error) {
   return 2;
 }
 
+std::string BadShare(const std::string& spec) {
+  return "bad share " + spec + ": NAME[=PATH], NAME of " +
+         S2S::server::kShareNameRule + ", PATH absolute";
+}
+
 int Fail(const std::string& error) {
   fprintf(stderr, "s2s-server: %s\n", error.c_str());
   return 1;
@@ -186,7 +193,7 @@ int Share(const Args& a) {
     Args add = a;
     add.spec.shares.clear();
     ShareSpec s;
-    if (!ParseShareSpec(w[1], s)) return Usage("bad share " + w[1]);
+    if (!ParseShareSpec(w[1], s)) return Usage(BadShare(w[1]));
     s.encrypted = a.spec.encrypted;
     add.spec.shares.push_back(s);
     add.spec.add_only = true;
@@ -247,6 +254,9 @@ int Run(const Args& a) {
                 " (run s2s-server init)");
   }
   if (a.command == "share") return Share(a);
+  if (a.command == "release" && !has_words) {
+    return Usage("release: give the share's name");
+  }
   if (has_words != (a.command == "release") || a.words.size() > 1) {
     return Usage("unexpected arguments to " + a.command);
   }
@@ -303,7 +313,7 @@ int main(int argc, char** argv) {
         break;
       case kShare:
         if (!ParseShareSpec(optarg, share)) {
-          return Usage(std::string("bad share ") + optarg);
+          return Usage(BadShare(optarg));
         }
         a.spec.shares.push_back(share);
         break;
@@ -391,7 +401,13 @@ int main(int argc, char** argv) {
     int lock = open(absolute.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
     if (lock >= 0) flock(lock, LOCK_EX);
   }
-  if (a.command == "config" && a.user.empty()) return Usage("config: --user");
+  if (a.command == "config" && a.user.empty()) {
+    return Usage("config needs --user USER");
+  }
+  if (!a.user.empty() && !S2S::server::IsValidDaemonUser(a.user)) {
+    return Usage("bad daemon user " + a.user +
+                 " (1-64 of letters, digits and . _ - +, not . or ..)");
+  }
   if (a.command == "ssh-setup" && (a.user.empty() || a.ssh.key_file.empty())) {
     return Usage("ssh-setup: --user USER --key-file FILE");
   }
