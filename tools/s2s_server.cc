@@ -144,11 +144,22 @@ int Fail(const std::string& error) {
   return 1;
 }
 
-int Config(const Args& a) {
-  std::string handler = a.handler.empty() ? DefaultHandler() : a.handler;
+// The handler and the password that config writes, read before anything
+// is changed. 0, or the exit code with the reason printed.
+int ConfigInputs(const Args& a, std::string& handler, std::string& password) {
+  handler = a.handler.empty() ? DefaultHandler() : a.handler;
   if (handler.empty()) return Fail("no s2s-cmd-handler beside this program");
-  std::string password, error;
+  std::string error;
   if (!ReadPassword(a.password_file, password, error)) return Fail(error);
+  return 0;
+}
+
+int Config(const Args& a, std::string handler = "", std::string password = "") {
+  std::string error;
+  if (password.empty()) {
+    int rc = ConfigInputs(a, handler, password);
+    if (rc != 0) return rc;
+  }
   if (!WriteServerConfig(handler, a.user, password, a.old_server, error)) {
     return Fail(error);
   }
@@ -214,12 +225,17 @@ int Run(const Args& a) {
   std::string error;
   bool has_words = !a.words.empty();
   if (a.command == "init" && !has_words) {
+    std::string handler, password;
+    if (!a.user.empty()) {
+      int rc = ConfigInputs(a, handler, password);
+      if (rc != 0) return rc;
+    }
     if (!InitServerRoot(a.spec, error)) return Fail(error);
     for (const ShareSpec& s : a.spec.shares) {
       printf("init: share %s\n", s.name.c_str());
     }
     printf("init: root %s ready\n", KaroRootPrefix());
-    return a.user.empty() ? Regenerate() : Config(a);
+    return a.user.empty() ? Regenerate() : Config(a, handler, password);
   }
   if (a.command == "config" && !has_words) return Config(a);
   if (a.command == "start" && !has_words) {
