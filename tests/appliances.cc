@@ -6,7 +6,6 @@
 
 #include <filesystem>
 
-#include "S2S/is_syncedshare.h"
 #include "daemon_config.h"
 
 namespace s2s_test {
@@ -159,15 +158,8 @@ std::string Appliances::ShareDir(const std::string& root,
 
 std::string Appliances::ServerRegistry(const std::string& section,
                                        const std::string& key) {
-  std::string value;
   ScopedEnv server("S2S_ROOT", server_root_);
-  KSZHASH* hash = KLIBCSzHashAlloc(64);
-  if (hash != nullptr && S2SGetServerInfo(section.c_str(), hash) == 1) {
-    const char* v = KLIBCSzHashGetValue(hash, key.c_str());
-    if (v != nullptr) value = v;
-  }
-  KLIBCSzHashFree(hash);
-  return value;
+  return RegistryValue(section, key);
 }
 
 S2S::SyncInfo Appliances::Info() const {

@@ -15,25 +15,9 @@
 namespace {
 
 using s2s_test::Has;
+using s2s_test::MakeHash;
 using s2s_test::ReadFile;
-
-KSZHASH* Hash(std::initializer_list<std::pair<const char*, const char*>> kv) {
-  KSZHASH* h = KLIBCSzHashAlloc(16);
-  for (const auto& p : kv) KLIBCSzHashSetValue(h, p.first, p.second);
-  return h;
-}
-
-// `key` of registry section `section`, or "<none>".
-std::string Value(const char* section, const char* key) {
-  KSZHASH* h = KLIBCSzHashAlloc(64);
-  std::string out = "<none>";
-  if (S2SGetServerInfo(section, h) == 1 &&
-      KLIBCSzHashGetValue(h, key) != nullptr) {
-    out = KLIBCSzHashGetValue(h, key);
-  }
-  KLIBCSzHashFree(h);
-  return out;
-}
+const auto Value = s2s_test::RegistryValue;
 
 std::string Joined(const KSZLIST* l) {
   std::string out;
@@ -77,14 +61,14 @@ TEST_F(RegistryTest, IsSyncedShareFollowsRunningIdAndTheSwitch) {
 }
 
 TEST_F(RegistryTest, RecordsAreReplacedWholeAndNamesFromTheNetworkChecked) {
-  KSZHASH* a = Hash({{"k1", "1"}, {"RunningID", "c1"}});
-  KSZHASH* b = Hash({{"k2", "two"}});
-  ASSERT_EQ(S2SUpdateServerInfo("A", a), 0);
-  ASSERT_EQ(S2SUpdateServerInfo("A", b), 0);
-  EXPECT_EQ(Value("A", "k1"), "<none>");
+  auto a = MakeHash({{"k1", "1"}, {"RunningID", "c1"}});
+  auto b = MakeHash({{"k2", "two"}});
+  ASSERT_EQ(S2SUpdateServerInfo("A", a.get()), 0);
+  ASSERT_EQ(S2SUpdateServerInfo("A", b.get()), 0);
+  EXPECT_EQ(Value("A", "k1"), "");
   EXPECT_EQ(Value("A", "k2"), "two");
-  ASSERT_EQ(S2SServerUpdateShare("docs", a), 0);
-  ASSERT_EQ(S2SServerUpdateTask("t1", a), 0);
+  ASSERT_EQ(S2SServerUpdateShare("docs", a.get()), 0);
+  ASSERT_EQ(S2SServerUpdateTask("t1", a.get()), 0);
   char buf[16];
   EXPECT_EQ(S2SServerGetShare("docs", "RunningID", buf, sizeof buf), 2);
   EXPECT_STREQ(buf, "c1");
@@ -96,18 +80,16 @@ TEST_F(RegistryTest, RecordsAreReplacedWholeAndNamesFromTheNetworkChecked) {
   // Names a section cannot hold are refused whole, and said so once.
   const std::string before = ReadFile(File());
   syslog_.Clear();
-  EXPECT_EQ(S2SUpdateServerInfo("C]", a), -1);
-  EXPECT_EQ(S2SUpdateServerInfo(nullptr, a), -1);
-  EXPECT_EQ(S2SServerUpdateShare("x]\n[PairedClientInfo", a), -1);
+  EXPECT_EQ(S2SUpdateServerInfo("C]", a.get()), -1);
+  EXPECT_EQ(S2SUpdateServerInfo(nullptr, a.get()), -1);
+  EXPECT_EQ(S2SServerUpdateShare("x]\n[PairedClientInfo", a.get()), -1);
   EXPECT_EQ(ReadFile(File()), before);
   EXPECT_EQ(syslog_.Messages()[1],
             "Set section [C] ] value into [" + File() + "] error.");
   // A registry that does not parse is not overwritten.
   Write("[A]\nno equals sign\n");
-  EXPECT_EQ(S2SUpdateServerInfo("A", b), -1);
+  EXPECT_EQ(S2SUpdateServerInfo("A", b.get()), -1);
   EXPECT_EQ(ReadFile(File()), "[A]\nno equals sign\n");
-  KLIBCSzHashFree(a);
-  KLIBCSzHashFree(b);
 }
 
 TEST_F(RegistryTest, PairingMovesToManyClientModeAndResetRemembersTheClient) {
@@ -122,14 +104,15 @@ TEST_F(RegistryTest, PairingMovesToManyClientModeAndResetRemembersTheClient) {
   EXPECT_EQ(KAROUISetS2S(1, "bad\nid", "srv"), -1);
   EXPECT_EQ(S2SServerUpdatePairInfo("c1", ""), S2S_SVR_BAD_ARGUMENT);
   EXPECT_EQ(S2SServerUpdatePairInfo("c1]", "srv1"), S2S_SVR_WRITE_ERROR);
-  EXPECT_EQ(Value("CLIENTID_c1", "ServerName"), "<none>");
+  EXPECT_EQ(Value("CLIENTID_c1", "ServerName"), "");
   EXPECT_EQ(S2SServerUpdatePairInfo("c1", "srv1"), S2S_SVR_OK);
   EXPECT_EQ(Value("CLIENTID_c1", "ServerName"), "srv1");
   EXPECT_EQ(Value("PairedClientInfo", "clientID"), S2S_MULTI_SRC_MARKER);
   EXPECT_EQ(Value("PairedClientInfo", "s2sEnabled"), "yes");
   EXPECT_EQ(S2SServerIfOldClientPaired(), 0);
 
-  KSZHASH* half = Hash({{"clientID", S2S_MULTI_SRC_MARKER}});
+  auto owned = MakeHash({{"clientID", S2S_MULTI_SRC_MARKER}});
+  KSZHASH* half = owned.get();
   EXPECT_EQ(S2SServerSetPairValue(nullptr), S2S_SVR_BAD_ARGUMENT);
   EXPECT_EQ(S2SServerSetPairValue(half), S2S_SVR_VALUE_ERROR);
   KLIBCSzHashSetValue(half, "serverName", "srv9");
@@ -137,7 +120,6 @@ TEST_F(RegistryTest, PairingMovesToManyClientModeAndResetRemembersTheClient) {
   EXPECT_EQ(S2SServerIfOldClientPaired(), 1);  // marker id, real name
   KLIBCSzHashSetValue(half, "serverName", "two\nlines");
   EXPECT_EQ(S2SServerSetPairValue(half), S2S_SVR_WRITE_ERROR);
-  KLIBCSzHashFree(half);
 
   ASSERT_EQ(KAROUISetS2S(1, "c2", "srv2"), 0);
   ASSERT_EQ(s2s_svr_reset_pair(), 0);
@@ -186,9 +168,8 @@ TEST_F(RegistryTest, CheckIfSharePairedSortsByFeeder) {
 int BusyAtAge(const char* task, long age) {
   for (;;) {
     time_t before = time(nullptr);
-    KSZHASH* h = Hash({{"status", std::to_string(before - age).c_str()}});
-    EXPECT_EQ(S2SServerUpdateTask(task, h), 0);
-    KLIBCSzHashFree(h);
+    auto h = MakeHash({{"status", std::to_string(before - age).c_str()}});
+    EXPECT_EQ(S2SServerUpdateTask(task, h.get()), 0);
     S2S_SVR_STATUS st;
     EXPECT_EQ(s2s_svr_get_status(&st), 0);
     s2s_svr_put_status(&st);
@@ -240,14 +221,13 @@ TEST_F(RegistryTest, WritersInManyProcessesLoseNothing) {
       if (read(go[0], &c, 1) != 0) _exit(1);
       for (int i = 1; i <= kRounds; ++i) {
         std::string n = std::to_string(i), name = std::to_string(who);
-        KSZHASH* h = Hash({{"clientID", ("c" + n).c_str()},
+        auto h = MakeHash({{"clientID", ("c" + n).c_str()},
                            {"serverName", ("srv" + n).c_str()},
                            {"round", n.c_str()}});
         int r = who == 0   ? KAROUISetS2S(i % 2, nullptr, nullptr)
-                : who == 1 ? S2SServerSetPairValue(h)
-                : who % 2  ? S2SServerUpdateTask(name.c_str(), h)
-                           : S2SServerUpdateShare(name.c_str(), h);
-        KLIBCSzHashFree(h);
+                : who == 1 ? S2SServerSetPairValue(h.get())
+                : who % 2  ? S2SServerUpdateTask(name.c_str(), h.get())
+                           : S2SServerUpdateShare(name.c_str(), h.get());
         if (r != 0) _exit(1);
       }
       _exit(0);

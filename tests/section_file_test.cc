@@ -7,7 +7,6 @@
 #include <time.h>
 #include <unistd.h>
 
-#include <memory>
 #include <random>
 #include <string>
 
@@ -17,19 +16,10 @@
 
 namespace {
 
+using s2s_test::Hash;
+using s2s_test::MakeHash;
 using s2s_test::ReadFile;
 using s2s_test::WriteFile;
-
-struct HashDeleter {
-  void operator()(KSZHASH* h) const { KLIBCSzHashFree(h); }
-};
-using Hash = std::unique_ptr<KSZHASH, HashDeleter>;
-
-Hash MakeHash(std::initializer_list<std::pair<const char*, const char*>> kv) {
-  Hash h(KLIBCSzHashAlloc(64));
-  for (const auto& p : kv) KLIBCSzHashSetValue(h.get(), p.first, p.second);
-  return h;
-}
 
 // The error a call that returned -1 left behind; 0 for any other result.
 int ErrorOf(int rc) { return rc == -1 ? KLIBCErrGet() : 0; }
@@ -85,7 +75,7 @@ TEST_F(SectionFileTest, WritesTheDocumentedFormatAndReadsItBack) {
   ASSERT_EQ(stat(file_.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0644u);
   EXPECT_EQ(Value("SHARE_a", "quote"), "say \"hi\" \"");
-  Hash got(KLIBCSzHashAlloc(8));
+  Hash got = MakeHash();
   EXPECT_EQ(KLIBCFileGetSection(file_.c_str(), "SHARE_a", got.get()), 1);
   EXPECT_EQ(KLIBCSzHashCount(got.get()), 2);
   EXPECT_EQ(KLIBCFileGetSection(file_.c_str(), "SHARE_b", got.get()), 0);
@@ -139,7 +129,7 @@ TEST_F(SectionFileTest, ReadsWhatAPersonTypes) {
   for (int i = 1; i < 30; ++i) many += "k" + std::to_string(i) + "=\"x\"\n";
   many += "[N]\nk0=\"n\"\n[M]\nk0=\"b\"\nk29=\"c\"\nk30=\"d\"\n";
   ASSERT_TRUE(WriteFile(file_, many));
-  Hash got(KLIBCSzHashAlloc(64));
+  Hash got = MakeHash();
   ASSERT_EQ(KLIBCFileGetSection(file_.c_str(), "M", got.get()), 1);
   ASSERT_EQ(KLIBCSzHashCount(got.get()), 31);
   EXPECT_STREQ(KLIBCSzHashKeyAt(got.get(), 0), "k0");
@@ -211,7 +201,7 @@ TEST_F(SectionFileTest, WriterKilledAtRandomLeavesAParsableFile) {
     pid_t pid = fork();
     ASSERT_GE(pid, 0);
     if (pid == 0) {
-      Hash h(KLIBCSzHashAlloc(64));
+      Hash h = MakeHash();
       for (int i = 0;; ++i) {
         std::string v(200, static_cast<char>('a' + i % 26));
         for (int k = 0; k < 20; ++k) {

@@ -65,7 +65,7 @@ long At(int year, int month, int day, int hour, int minute) {
 }
 
 TEST(Scheduler, EarliestFirstOncePerDueFollowsClockJumpsRetriesBackOff) {
-  s2s_test::ScopedTZ tz("UTC");
+  s2s_test::ScopedEnv tz("TZ", "UTC");
   S2S::Schedule daily = EveryMinute();
   daily.SetPeriod(0);  // once a day, at 00:00
   daily.SetStartHour(0);

@@ -13,7 +13,7 @@ namespace {
 
 using S2S::Schedule;
 using s2s_test::Has;
-using s2s_test::ScopedTZ;
+using s2s_test::ScopedEnv;
 
 // A schedule written "<mode> <what> <HH:MM> [<period>x<repeat>]": mode W, M,
 // Y or O; <what> is the week string for W, the begin date YYYY-MM-DD else.
@@ -116,7 +116,7 @@ TEST(Schedule, ValidateReportsTheFirstBrokenRule) {
       {"O 2014-13-01 00:00", "Invalid begin date\n"},
       {"O 1960-01-01 00:00", "Invalid begin\n"},  // before the epoch
   };
-  ScopedTZ tz("UTC");
+  ScopedEnv tz("TZ", "UTC");
   bool ok = false;
   EXPECT_EQ(ValidateMessage(Schedule(), &ok), "");  // manual by default
   EXPECT_TRUE(ok);
@@ -162,7 +162,7 @@ struct Case {
 };
 
 void Check(const char* zone, const std::vector<Case>& cases) {
-  ScopedTZ tz(zone);
+  ScopedEnv tz("TZ", zone);
   for (const Case& c : cases) {
     Schedule s = Make(c.schedule);
     ASSERT_TRUE(s.Validate()) << c.schedule;
@@ -247,7 +247,7 @@ TEST(NextScheduledSeconds, ModeTableInEveryZoneAndAroundDstChanges) {
 }
 
 TEST(NextScheduledSeconds, ManualRealtimeNegativeNowAndFailures) {
-  ScopedTZ tz("Europe/Berlin");
+  ScopedEnv tz("TZ", "Europe/Berlin");
   Schedule s;
   for (long now : {0L, 1L, 1735689600L}) {
     s.SetMode(S2S::SCHD_MANUAL);

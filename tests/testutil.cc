@@ -340,13 +340,11 @@ bool RsyncDaemon::StartWithConfig(const std::string& conf) {
   std::string log = dir_ + "/rsyncd.log";
   pid_ = SpawnListening(
       [&](int port) -> std::vector<std::string> {
-        return {"rsync",
-                "--daemon",
-                "--no-detach",
-                "--address=127.0.0.1",
-                "--port=" + std::to_string(port),
-                "--config=" + conf,
-                "--log-file=" + log};
+        return {"rsync",       "--daemon",
+                "--no-detach", "--address=127.0.0.1",
+                "--port",      std::to_string(port),
+                "--config",    conf,
+                "--log-file",  log};
       },
       log, &port_);
   return pid_ > 0;
@@ -375,6 +373,20 @@ ScopedEnv::~ScopedEnv() {
     unsetenv(name_.c_str());
   }
   tzset();
+}
+
+Hash MakeHash(std::initializer_list<std::pair<const char*, const char*>> kv) {
+  Hash h(KLIBCSzHashAlloc(64), &KLIBCSzHashFree);
+  for (const auto& p : kv) KLIBCSzHashSetValue(h.get(), p.first, p.second);
+  return h;
+}
+
+std::string RegistryValue(const std::string& section, const std::string& key) {
+  Hash h = MakeHash();
+  const char* v = S2SGetServerInfo(section.c_str(), h.get()) == 1
+                      ? KLIBCSzHashGetValue(h.get(), key.c_str())
+                      : nullptr;
+  return v != nullptr ? v : "";
 }
 
 bool RunQuiet(const std::vector<std::string>& args) {

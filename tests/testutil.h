@@ -11,6 +11,8 @@
 #include <string>
 #include <vector>
 
+#include "S2S/is_syncedshare.h"
+
 namespace s2s_test {
 
 // The plumbing below owns files, descriptors and processes: none is copied.
@@ -109,7 +111,6 @@ class RsyncDaemon : NoCopy {
   void Stop();
 
   int port() const { return port_; }
-  pid_t pid() const { return pid_; }
   // The daemon's log file so far.
   std::string Log() const;
 
@@ -186,10 +187,12 @@ bool WaitUntil(const std::function<bool()>& done, double seconds);
 // at `path`; true on success.
 bool WriteScript(const std::string& path, const std::string& body);
 
-// TZ set for the lifetime of the object.
-struct ScopedTZ : ScopedEnv {
-  explicit ScopedTZ(const std::string& tz) : ScopedEnv("TZ", tz) {}
-};
+// A hash of the platform layer holding `kv`, freed with the pointer.
+using Hash = std::unique_ptr<KSZHASH, void (*)(KSZHASH*)>;
+Hash MakeHash(
+    std::initializer_list<std::pair<const char*, const char*>> kv = {});
+// `key` of section `section` of the registry under S2S_ROOT; "" if absent.
+std::string RegistryValue(const std::string& section, const std::string& key);
 
 }  // namespace s2s_test
 
