@@ -18,7 +18,6 @@
 #include <cstdint>
 #include <filesystem>
 #include <fstream>
-#include <functional>
 #include <random>
 #include <string>
 #include <vector>
@@ -79,12 +78,10 @@ std::vector<std::pair<pid_t, pid_t>> RsyncChildren(pid_t parent) {
   std::vector<std::pair<pid_t, pid_t>> out;
   for (const auto& p : AllProcs("stat")) {
     // "pid (comm) state ppid pgrp session ..."
-    size_t close_paren = p.second.rfind(')');
-    char state;
-    int ppid, pgrp, session;
-    if (p.second.find("(rsync)") != std::string::npos &&
-        sscanf(p.second.c_str() + close_paren + 1, " %c %d %d %d", &state,
-               &ppid, &pgrp, &session) == 4 &&
+    int ppid, session;
+    if (Has(p.second, "(rsync)") &&
+        sscanf(p.second.c_str() + p.second.rfind(')') + 1, " %*c %d %*d %d",
+               &ppid, &session) == 2 &&
         ppid == parent) {
       out.emplace_back(p.first, session);
     }
@@ -107,14 +104,12 @@ void WriteBlob(const std::string& path, int mb) {
 // Bytes of file data a run's summary says were sent: "N files and 20.1 MiB
 // sent".
 double SentBytes(const std::string& out) {
-  size_t at = out.find(" files and ");
   double v = -1;
-  char unit[8] = "";
-  if (at == std::string::npos ||
-      sscanf(out.c_str() + at + 11, "%lf %7s", &v, unit) != 2) {
-    return -1;
-  }
-  return v * (unit[0] == 'K' ? 1 << 10 : unit[0] == 'M' ? 1 << 20 : 1);
+  char unit = 0;
+  size_t at = out.find(" files and ");
+  if (at != std::string::npos)
+    sscanf(out.c_str() + at + 11, "%lf %c", &v, &unit);
+  return v * (unit == 'K' ? 1 << 10 : unit == 'M' ? 1 << 20 : 1);
 }
 
 class ToolsTest : public ::testing::Test {
@@ -135,7 +130,6 @@ class ToolsTest : public ::testing::Test {
   void TearDown() override {
     Child stop = Server({"stop"});
     EXPECT_EQ(0, stop.code) << stop.err;
-    EXPECT_TRUE(Has(stop.out, "stopped")) << stop.out;
   }
 
   std::vector<std::string> ServerArgv(std::vector<std::string> words) {
@@ -181,14 +175,11 @@ class ToolsTest : public ::testing::Test {
   std::vector<std::string> Client(const std::string& root,
                                   const std::string& share,
                                   const std::vector<std::string>& more = {}) {
-    std::vector<std::string> argv = {S2S_CLIENT_PROGRAM,
-                                     "--root=" + root,
-                                     "--server-ip=127.0.0.1",
-                                     "--port=" + port_,
-                                     "--user=s2s",
-                                     "--task=t1",
-                                     "--share=" + share,
-                                     "--password-file=" + pw_file_};
+    // --root=ROOT as one word: the form no other test gives s2s-client.
+    std::vector<std::string> argv({S2S_CLIENT_PROGRAM, "--root=" + root,
+                                   "--server-ip", "127.0.0.1", "--port", port_,
+                                   "--user", "s2s", "--task", "t1", "--share",
+                                   share, "--password-file", pw_file_});
     argv.insert(argv.end(), more.begin(), more.end());
     return argv;
   }
@@ -236,17 +227,13 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   ASSERT_EQ(0, mkdir(root.c_str(), 0755));
   ASSERT_EQ(0, chown(root.c_str(), nobody->pw_uid, nobody->pw_gid));
   ASSERT_EQ(0, chmod(tmp_.path().c_str(), 0755));
+  const std::string uid = std::to_string(nobody->pw_uid);
+  const std::string gid = std::to_string(nobody->pw_gid);
   auto as_user = [&](std::vector<std::string> words) {
-    std::vector<std::string> argv = {
-        "/usr/bin/setpriv",
-        "--reuid=" + std::to_string(nobody->pw_uid),
-        "--regid=" + std::to_string(nobody->pw_gid),
-        "--clear-groups",
-        bin + "/s2s-server",
-        "--root",
-        root};
-    argv.insert(argv.end(), words.begin(), words.end());
-    return RunProgram(tmp_.path(), argv, {"LD_LIBRARY_PATH=" + bin});
+    words.insert(words.begin(),
+                 {"/usr/bin/setpriv", "--reuid", uid, "--regid", gid,
+                  "--clear-groups", bin + "/s2s-server", "--root", root});
+    return RunProgram(tmp_.path(), words, {"LD_LIBRARY_PATH=" + bin});
   };
   Child init = as_user(
       {"init", "--share", "docs", "--user", "s2s", "--password-file", pw});
@@ -255,12 +242,9 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   ASSERT_EQ(0, start.code) << start.out << start.err;
   // However the test ends, its daemon does not outlive it.
   bool stopped = false;
-  struct AtEnd {
-    std::function<void()> run;
-    ~AtEnd() { run(); }
-  } stop_anyway{[&] {
+  std::shared_ptr<void> stop_anyway(nullptr, [&](void*) {
     if (!stopped) as_user({"stop"});
-  }};
+  });
 
   std::string client = MakeClient("client", "CLIENT-A");
   ASSERT_EQ(
@@ -276,17 +260,14 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   EXPECT_EQ(0, stop.code) << stop.out << stop.err;
 }
 
-// One client's round on a running server. Its first sync takes the password
-// from the environment with every log line on, and no process's command
-// line, no output and no log shows it. Then the failures' exit codes, a dry
-// run that changes nothing, and what an operator does: a share added is
-// synced at once (a sparse disk image stays sparse), a stuck sync and a
-// pairing bound to one client are cleared, and the exit code of status says
-// whether the daemon runs.
+// One client's round on a running server: a first sync whose password no
+// command line, output or log shows; the failures' exit codes; a dry run
+// that changes nothing; and an operator's commands: a share added (a sparse
+// image stays sparse), a stuck sync and a one-client pairing cleared.
 TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
   std::string client = MakeClient("client", "CLIENT-A");
   std::vector<std::string> argv = Client(client, "docs", {"-v", "-v"});
-  argv.erase(argv.end() - 3);  // --password-file=FILE
+  argv.erase(argv.end() - 4, argv.end() - 2);  // --password-file FILE
   Child c =
       Spawn(tmp_.path(), argv, {std::string("S2S_PASSWORD=") + kPassword});
   int rsync_seen = 0;
@@ -397,10 +378,8 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
 
   {
     s2s_test::ScopedEnv root("S2S_ROOT", server_);
-    KSZHASH* stuck = KLIBCSzHashAlloc(4);
-    KLIBCSzHashSetValue(stuck, "RunningID", "GONE-1");
-    ASSERT_EQ(0, S2SServerUpdateShare("docs", stuck));
-    KLIBCSzHashFree(stuck);
+    auto stuck = s2s_test::MakeHash({{"RunningID", "GONE-1"}});
+    ASSERT_EQ(0, S2SServerUpdateShare("docs", stuck.get()));
     ASSERT_EQ(0, KAROUISetS2S(1, "OLD-1", "oldname"));
   }
   // An upload at 1 KiB/s for a minute, cut by the stop below: the daemon's
