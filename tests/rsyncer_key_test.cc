@@ -62,37 +62,24 @@ class RsyncerKeyTest : public ::testing::Test {
         return false;
       }
     }
+    const std::string conf = ssh_dir_.Sub("sshd_config");
     if (!WriteFile(authorized, "command=\"rsync --server --daemon --config=" +
                                    app_.server_root() +
                                    "/etc/s2s/rsyncd.conf .\",no-pty " +
-                                   ReadFile(ssh + "/id_ed25519.pub"))) {
+                                   ReadFile(ssh + "/id_ed25519.pub")) ||
+        !WriteFile(conf, "ListenAddress 127.0.0.1\nHostKey " + host_key +
+                             "\nAuthorizedKeysFile " + authorized +
+                             "\nStrictModes no\nPasswordAuthentication no\n"
+                             "PidFile none\n")) {
       return false;
     }
     mkdir("/run/sshd", 0755);  // sshd insists on its privilege separation
     sshd_ = s2s_test::SpawnListening(
         [&](int port) -> std::vector<std::string> {
-          return {"/usr/sbin/sshd",
-                  "-D",
-                  "-f",
-                  "/dev/null",
-                  "-E",
-                  ssh_dir_.Sub("sshd.log"),
-                  "-p",
-                  std::to_string(port),
-                  "-h",
-                  host_key,
-                  "-o",
-                  "ListenAddress=127.0.0.1",
-                  "-o",
-                  "AuthorizedKeysFile=" + authorized,
-                  "-o",
-                  "StrictModes=no",
-                  "-o",
-                  "PasswordAuthentication=no",
-                  "-o",
-                  "PidFile=none"};
+          return {"/usr/sbin/sshd",    "-D", "-e", "-f", conf, "-p",
+                  std::to_string(port)};
         },
-        "/dev/null", &ssh_port_);
+        ssh_dir_.Sub("sshd.log"), &ssh_port_);
     return sshd_ > 0 && WriteFile(ssh + "/known_hosts",
                                   "[127.0.0.1]:" + std::to_string(ssh_port_) +
                                       " " + ReadFile(host_key + ".pub"));
