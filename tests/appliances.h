@@ -61,8 +61,6 @@ class Appliances : NoCopy {
   const std::string& user() const { return user_; }
   std::string DaemonLog() const { return daemon_.Log(); }
 
-  RsyncDaemon& daemon() { return daemon_; }
-
  private:
   struct Share {
     std::string name;

@@ -99,13 +99,10 @@ class S2sdTest : public ::testing::Test {
     t.GetInfo().SetShareList(shares);
     t.GetInfo().SetSyncInfo(app_.Info());
     t.GetInfo().SetSchedule(schedule);
-    S2S::PObject req;
-    req["action"] = "add";
+    S2S::PObject req = Action("add");
     S2S::SyncTask2PObj(t, req["task"]);
     req["task"].asMap().erase("id");
-    if (settings.isMap()) {
-      for (const auto& it : settings.asMap()) req["task"][it.first] = it.second;
-    }
+    for (const auto& it : settings.asMap()) req["task"][it.first] = it.second;
     S2S::PObject reply = Request(req);
     EXPECT_EQ(0u, reply["result"].asUInt64()) << reply["message"].asString();
     return reply["id"].asUInt64();

@@ -128,18 +128,10 @@ class RealtimeTest : public s2s_test::S2sdTest,
     server_ = app_.ServerShare("docs");
   }
 
-  PObject Request(const std::string& action, const PObject& more = PObject()) {
-    PObject req = more;
-    if (!req.isMap()) req = PObject::Map();
-    req["action"] = action;
-    return S2sdTest::Request(req);
-  }
-
   // Adds the realtime task over docs with the test's change source, a
   // settle delay of 0.2 s and `settings` beside; its status map once it
   // watches, or a null object.
   PObject AddLive(PObject settings = PObject()) {
-    if (!settings.isMap()) settings = PObject::Map();
     settings["realtime_source"] = GetParam();
     settings["realtime_settle_ms"] = 200u;
     S2S::Schedule realtime;
@@ -157,7 +149,7 @@ class RealtimeTest : public s2s_test::S2sdTest,
 
   // The task's realtime status (null when the daemon did not answer).
   PObject Status() {
-    const PObject reply = Request("status");
+    const PObject reply = Request(Action("status"));
     return reply["realtime"][0u];
   }
 
@@ -178,16 +170,9 @@ class RealtimeTest : public s2s_test::S2sdTest,
 
   bool Same() { return s2s_test::RunQuiet({"diff", "-r", client_, server_}); }
 
-  // WaitUntil for a check that compares or walks whole trees: asked every
-  // 50 ms, so that the asking leaves the machine to the daemon under test.
-  static bool WaitSlowly(const std::function<bool()>& done, double seconds) {
-    return WaitUntil(
-        [&] {
-          usleep(50 * 1000);
-          return done();
-        },
-        seconds);
-  }
+  // How often a wait compares or walks whole trees: seldom enough to leave
+  // the machine to the daemon under test.
+  static constexpr double kSlowly = 0.05;
 
   size_t Files(const std::string& dir) {
     std::error_code ec;
@@ -254,7 +239,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   EXPECT_LE(0, Arrival("/new/sub/x", "x\n"));
   EXPECT_LE(0, Arrival("/quick/deep/er/f49", "q"));
   EXPECT_LE(0, Arrival(odd[2] + odd[0], "both\n"));
-  EXPECT_TRUE(WaitSlowly([&] { return Same(); }, 10));
+  EXPECT_TRUE(WaitUntil([&] { return Same(); }, 10, kSlowly));
 
   // A burst: 200 files in 20 new directories, far more paths than one batch
   // pushes one by one.
@@ -264,7 +249,8 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
     fs::create_directories(dir);
     for (int f = 0; f < 10; ++f) WriteFile(dir + "/f" + std::to_string(f), "b");
   }
-  ASSERT_TRUE(WaitSlowly([&] { return Files(server_ + "/burst") == 200; }, 60))
+  ASSERT_TRUE(
+      WaitUntil([&] { return Files(server_ + "/burst") == 200; }, 60, kSlowly))
       << Log();
   EXPECT_TRUE(Same());
   EXPECT_LE(RsyncLogCount(client_) - runs_before, 10u);
@@ -288,9 +274,6 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
 
   // Back empty (a volume mounted over it, say): the guard holds the mass
   // deletion while the rest arrives, until a confirmed full sync.
-  PObject id;
-  id = PObject::Map();
-  id["id"] = 1u;
   size_t kept = Files(server_);
   fs::rename(client_, client_ + ".old");
   fs::create_directories(client_);
@@ -299,9 +282,8 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   PObject last;
   EXPECT_TRUE(WaitUntil(
       [&] {
-        PObject runs = Request("history", id)["runs"];
-        if (!runs.isArray() || runs.asArray().empty()) return false;
-        last = runs.asArray()[0];
+        const PObject runs = Request(Action("history", 1u))["runs"];
+        last = runs[0u];
         return last["outcome"].asString() == "held";
       },
       10))
@@ -310,18 +292,18 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   // The batch's figures count what it sent: fresh.txt's 6 bytes.
   const PObject shares = last["shares"];
   EXPECT_LE(6u, shares[0u]["bytes"].asUInt64()) << last["message"].asString();
-  PObject confirmed = id;
+  PObject confirmed = Action("run", 1u);
   confirmed["confirm_deletions"] = 1u;
-  ASSERT_EQ(0u, Request("run", confirmed)["result"].asUInt64());
-  EXPECT_TRUE(WaitSlowly([&] { return Same(); }, 10)) << Log();
+  ASSERT_EQ(0u, Request(confirmed)["result"].asUInt64());
+  EXPECT_TRUE(WaitUntil([&] { return Same(); }, 10, kSlowly)) << Log();
   fs::remove_all(client_ + ".old");
 
   // Disabled: the server shows the task idle again.
-  ASSERT_EQ(0u, Request("disable", id)["result"].asUInt64());
+  ASSERT_EQ(0u, Request(Action("disable", 1u))["result"].asUInt64());
   EXPECT_TRUE(WaitUntil(
       [&] { return app_.ServerRegistry("TASK_live", "status") == "idle"; },
       10));
-  EXPECT_TRUE(Request("status")["realtime"].asArray().empty());
+  EXPECT_TRUE(Request(Action("status"))["realtime"].asArray().empty());
 }
 
 TEST_P(RealtimeTest, OverflowWatchLimitAndAnUnreachableServerEndEqual) {
@@ -333,7 +315,6 @@ TEST_P(RealtimeTest, OverflowWatchLimitAndAnUnreachableServerEndEqual) {
   StartDaemon({"--watch-queue-limit", "16", "--watch-limit", "4",
                "--watch-check-ms", "200"});
   PObject settings;
-  settings = PObject::Map();
   settings["realtime_full_sync"] = 2u;
   const PObject added = AddLive(settings);
   SKIP_UNLESS_SOURCE(added);
@@ -345,7 +326,7 @@ TEST_P(RealtimeTest, OverflowWatchLimitAndAnUnreachableServerEndEqual) {
     WriteFile(client_ + dir + "/f" + std::to_string(i), std::to_string(i));
   }
   kill(daemon_.pid, SIGCONT);
-  EXPECT_TRUE(WaitSlowly([&] { return Same(); }, 30)) << Log();
+  EXPECT_TRUE(WaitUntil([&] { return Same(); }, 30, kSlowly)) << Log();
   const PObject status = Status();
   EXPECT_LE(1u, status["overflows"].asUInt64());
   if (std::string(GetParam()) == "inotify") {

@@ -21,6 +21,7 @@
 #include <fstream>
 #include <mutex>
 #include <sstream>
+#include <thread>
 
 #include "S2S/is_syncedshare_detail.h"
 #include "S2S/logger.h"
@@ -56,6 +57,14 @@ std::string TempBase() {
   argv.push_back(nullptr);
   execvp(argv[0], argv.data());
   _exit(127);
+}
+
+// Starts `args` with standard input `in` and output and error `out` (-1:
+// inherited); its pid, or -1.
+pid_t Exec(std::vector<std::string> args, int in, int out) {
+  pid_t pid = fork();
+  if (pid == 0) ExecChild(std::move(args), in, out, out, {});
+  return pid;
 }
 
 std::mutex syslog_mutex;
@@ -111,12 +120,6 @@ void RecordSyslog(int priority, const char* format, va_list ap) {
 }
 
 }  // namespace
-
-pid_t Exec(std::vector<std::string> args, int in, int out) {
-  pid_t pid = fork();
-  if (pid == 0) ExecChild(std::move(args), in, out, out, {});
-  return pid;
-}
 
 void StopChild(pid_t* pid) {
   if (*pid <= 0) return;
@@ -193,13 +196,13 @@ Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
   return c;
 }
 
-bool WaitUntil(const std::function<bool()>& done, double seconds) {
+bool WaitUntil(const std::function<bool()>& done, double seconds,
+               double every) {
   auto deadline = std::chrono::steady_clock::now() +
                   std::chrono::milliseconds(static_cast<int>(seconds * 1000));
   while (!done()) {
     if (std::chrono::steady_clock::now() > deadline) return false;
-    timespec ts = {0, 5 * 1000 * 1000};
-    nanosleep(&ts, nullptr);
+    std::this_thread::sleep_for(std::chrono::duration<double>(every));
   }
   return true;
 }

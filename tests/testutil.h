@@ -151,9 +151,6 @@ class TempRoot : public TempDir {
   ScopedEnv env_;
 };
 
-// Starts `args` (looked up in PATH, no shell) with standard input `in` and
-// output and error `out` (-1: inherited); its pid, or -1.
-pid_t Exec(std::vector<std::string> args, int in, int out);
 // Runs a program (an argument vector, looked up in PATH, no shell) to
 // completion with its input and output on /dev/null; true on exit 0.
 bool RunQuiet(const std::vector<std::string>& args);
@@ -179,9 +176,10 @@ Child Spawn(const std::string& dir, const std::vector<std::string>& argv,
 Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
                  const std::vector<std::string>& env = {});
 
-// Polls `done` every few milliseconds until it holds (true) or `seconds`
+// Polls `done` every `every` seconds until it holds (true) or `seconds`
 // have passed (false).
-bool WaitUntil(const std::function<bool()>& done, double seconds);
+bool WaitUntil(const std::function<bool()>& done, double seconds,
+               double every = 0.005);
 
 // Writes an executable shell script `body` (without the "#!/bin/sh" line)
 // at `path`; true on success.
