@@ -1,7 +1,6 @@
 #include "appliances.h"
 
 #include <pwd.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -190,8 +189,7 @@ bool ScriptedServer::Start(const std::string& user,
                      "\n[s2sspool]\n\tpath = " + dir_ + "/upload\n" + auth +
                      "\tread only = no\n\twrite only = yes\n";
   if (!WriteScript(hook, kScriptedHook) ||
-      !WriteFile(secrets, user + ":" + password + "\n") ||
-      chmod(secrets.c_str(), 0600) != 0 ||
+      !WriteFile(secrets, user + ":" + password + "\n", 0600) ||
       !WriteFile(dir_ + "/rsyncd.conf", conf) ||
       !daemon_.StartWithConfig(dir_ + "/rsyncd.conf")) {
     return false;

@@ -53,11 +53,10 @@ TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
   const std::string root = tmp.Sub("server"), pw = tmp.Sub("password");
   const std::string key = tmp.Sub("key.pub"), keys = tmp.Sub("ssh/keys");
   ASSERT_EQ(0, mkdir(tmp.Sub("ssh").c_str(), 0755));
-  ASSERT_TRUE(s2s_test::WriteFile(pw, "pw-ssh-admin\n"));
+  ASSERT_TRUE(s2s_test::WriteFile(pw, "pw-ssh-admin\n", 0600));
   // The hooks run as the user, who may not reach the build tree.
   const std::string handler = tmp.Sub("s2s-cmd-handler");
   std::filesystem::copy(S2S_HANDLER_PROGRAM, handler);
-  ASSERT_EQ(0, chmod(pw.c_str(), 0600));
   const std::string blob = "AAAAC3NzaC1lZDI1NTE5AAAAIBv2";
   ASSERT_TRUE(s2s_test::WriteFile(key, "ssh-ed25519 " + blob + " me@client\n"));
   ASSERT_TRUE(s2s_test::WriteFile(keys,

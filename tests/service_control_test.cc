@@ -133,8 +133,7 @@ TEST(CtlOptions, AddTakesTheTaskFileUnderTheOptionsAndAPrivatePassword) {
       "\texcludes=\"*.tmp\"\n\tcompress=\"yes\"\n"
       "\tpassword_file=\"" +
           pass + "\"\n"));
-  ASSERT_TRUE(s2s_test::WriteFile(pass, "pw1\n"));
-  chmod(pass.c_str(), 0600);
+  ASSERT_TRUE(s2s_test::WriteFile(pass, "pw1\n", 0600));
   CtlOptions o;
   std::string error, note;
   ASSERT_TRUE(ParseCtl({"task", "add", "--task-file", task, "--user", "other",
@@ -391,8 +390,7 @@ TEST_F(ServiceControlTest, BadRequestsChangeNothingAndCtlRunsATaskEndToEnd) {
 
   const std::string password = app_.Info().GetPassword();
   const std::string pass = tmp_.Sub("pass");
-  ASSERT_TRUE(s2s_test::WriteFile(pass, password + "\n"));
-  chmod(pass.c_str(), 0600);
+  ASSERT_TRUE(s2s_test::WriteFile(pass, password + "\n", 0600));
   const std::string docs = app_.ClientShare("docs");
   for (const char* f : {"/a.txt", "/b.txt", "/c.txt"}) {
     ASSERT_TRUE(s2s_test::WriteFile(docs + f, "a\n"));

@@ -3,12 +3,10 @@
 // server daemon.
 #include <gtest/gtest.h>
 #include <signal.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <filesystem>
-#include <functional>
 #include <string>
 #include <tuple>
 #include <vector>

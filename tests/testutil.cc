@@ -241,8 +241,7 @@ bool TempRoot::Write(const std::string& abs, const std::string& data) const {
 }
 
 bool WriteScript(const std::string& path, const std::string& body) {
-  return WriteFile(path, "#!/bin/sh\n" + body) &&
-         chmod(path.c_str(), 0755) == 0;
+  return WriteFile(path, "#!/bin/sh\n" + body, 0755);
 }
 
 SyslogCapture::SyslogCapture() {
@@ -320,10 +319,11 @@ std::string ReadFile(const std::string& path) {
   return out.str();
 }
 
-bool WriteFile(const std::string& path, const std::string& data) {
+bool WriteFile(const std::string& path, const std::string& data, int mode) {
   std::ofstream out(path, std::ios::binary | std::ios::trunc);
   out << data;
-  return static_cast<bool>(out);
+  out.close();
+  return out && (mode == -1 || chmod(path.c_str(), mode) == 0);
 }
 
 int FreeLoopbackPort() {

@@ -76,8 +76,9 @@ inline double SecondsSince(std::chrono::steady_clock::time_point start) {
 
 // Reads a whole file; "" when it cannot be read.
 std::string ReadFile(const std::string& path);
-// Writes a whole file; true on success.
-bool WriteFile(const std::string& path, const std::string& data);
+// Writes a whole file, then gives it `mode` unless that is -1; true on
+// success.
+bool WriteFile(const std::string& path, const std::string& data, int mode = -1);
 // A TCP port on 127.0.0.1 that was free a moment ago.
 int FreeLoopbackPort();
 // A socket listening on 127.0.0.1 at *port (0: any free port, which is then

@@ -1,7 +1,6 @@
 // The client program's inputs: task files, options on top of them, password
 // sources, and the cancel checker's beacons.
 #include <stdlib.h>
-#include <sys/stat.h>
 
 #include <string>
 #include <thread>
@@ -111,14 +110,12 @@ TEST(ClientOptions, RefusesBadInputsWithoutEchoingSecrets) {
 TEST(Secret, FirstLineOfTheFileWinsAndTheEnvironmentIsConsumed) {
   s2s_test::TempDir tmp;
   std::string path = tmp.Sub("pw");
-  ASSERT_TRUE(WriteFile(path, "s3cret-line\nsecond line\n"));
+  ASSERT_TRUE(WriteFile(path, "s3cret-line\nsecond line\n", 0600));
   std::string pw, error;
-  chmod(path.c_str(), 0600);
   ASSERT_TRUE(ReadPassword(path, pw, error)) << error;
   EXPECT_EQ("s3cret-line", pw);
 
-  ASSERT_TRUE(WriteFile(tmp.Sub("empty"), "\n"));
-  chmod(tmp.Sub("empty").c_str(), 0600);
+  ASSERT_TRUE(WriteFile(tmp.Sub("empty"), "\n", 0600));
   EXPECT_FALSE(ReadPassword(tmp.Sub("empty"), pw, error));
 
   // A file given wins over the variable, which is removed all the same so

@@ -117,8 +117,7 @@ class ToolsTest : public ::testing::Test {
   void SetUp() override {
     server_ = tmp_.Sub("server");
     pw_file_ = tmp_.Sub("password");
-    ASSERT_TRUE(WriteFile(pw_file_, std::string(kPassword) + "\n"));
-    chmod(pw_file_.c_str(), 0600);
+    ASSERT_TRUE(WriteFile(pw_file_, std::string(kPassword) + "\n", 0600));
     Child init = Server({"init", "--share", "docs", "--share", "big", "--user",
                          "s2s", "--password-file", pw_file_});
     ASSERT_EQ(0, init.code) << init.err;
@@ -307,10 +306,8 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
   std::string other = MakeClient("other", "CLIENT-B");
   const std::string wrong_pw = tmp_.Sub("wrong"), open_pw = tmp_.Sub("open");
   const std::string fifo_pw = tmp_.Sub("fifo");
-  WriteFile(wrong_pw, "not-the-password\n");
-  WriteFile(open_pw, kPassword);
-  chmod(wrong_pw.c_str(), 0600);
-  chmod(open_pw.c_str(), 0644);
+  WriteFile(wrong_pw, "not-the-password\n", 0600);
+  WriteFile(open_pw, kPassword, 0644);
   ASSERT_EQ(0, mkfifo(fifo_pw.c_str(), 0600));
   ExpectRuns({
       {Client(client, "docs",
