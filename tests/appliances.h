@@ -73,11 +73,7 @@ class Appliances : NoCopy {
   bool MakeShareDirs(const std::string& root, const std::string& name) const;
 
   TempDir dir_;
-  std::string client_root_;
-  std::string server_root_;
-  std::string handler_;
-  std::string user_;
-  std::string password_;
+  std::string client_root_, server_root_, handler_, user_, password_;
   std::vector<Share> shares_;
   std::vector<std::string> roots_;  // the server's and every client's
   std::unique_ptr<ScopedEnv> root_env_;

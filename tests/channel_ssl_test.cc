@@ -114,8 +114,7 @@ class ChannelSSLTest : public ::testing::Test {
       return r;
     }
     Channel server, client;
-    int server_result = 1;
-    int peer;
+    int server_result = 1, peer;
     bool ok;
   };
 

@@ -53,8 +53,8 @@ class RsyncerKeyTest : public ::testing::Test {
   // key in, for which it serves the server's daemon configuration.
   bool StartSshd() {
     const std::string ssh = app_.client_root() + "/etc/s2s/ssh";
-    const std::string host_key = ssh_dir_.Sub("host_key");
-    const std::string authorized = ssh_dir_.Sub("authorized_keys");
+    const std::string host_key = ssh_dir_.Sub("host_key"),
+                      authorized = ssh_dir_.Sub("authorized_keys");
     fs::create_directories(ssh);
     for (const std::string& key : {host_key, ssh + "/id_ed25519"}) {
       if (!s2s_test::RunQuiet(

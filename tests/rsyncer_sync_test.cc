@@ -84,8 +84,7 @@ TEST_F(RsyncerSyncTest, SubPathWithExcludesThenWholeShareWithDelete) {
   info.SetCompression(true);
   info.SetBlockLevelSync(true);
   ASSERT_NO_FATAL_FAILURE(StartShare("docs", info));
-  std::string c = app_.ClientShare("docs");
-  std::string s = app_.ServerShare("docs");
+  std::string c = app_.ClientShare("docs"), s = app_.ServerShare("docs");
   ASSERT_TRUE(fs::create_directories(c + "/a/b"));
   ASSERT_TRUE(WriteFile(c + "/a/b/keep.txt", std::string(200000, 'k')));
   ASSERT_TRUE(WriteFile(c + "/a/b/skip.tmp", "temporary"));
@@ -246,8 +245,8 @@ class RsyncerTreeTest : public RsyncerSyncTest {
     return status;
   }
 
-  const std::string c_ = app_.ClientShare("tree");
-  const std::string s_ = app_.ServerShare("tree");
+  const std::string c_ = app_.ClientShare("tree"),
+                    s_ = app_.ServerShare("tree");
 };
 
 TEST_F(RsyncerTreeTest, AwkwardNamesLinksModesAndOwners) {

@@ -65,8 +65,7 @@ TEST_F(HostTest, ClientIdIsTheSerialElseAMacAddress) {
 TEST_F(HostTest, TempFilesLiveUnderTheRoot) {
   EXPECT_EQ(S2S::GetTempFile(), "");  // the directory is not created
   ASSERT_TRUE(root_.MakeDir("/tmp/S2S"));
-  std::string a = S2S::GetTempFile();
-  std::string b = S2S::GetTempFile();
+  std::string a = S2S::GetTempFile(), b = S2S::GetTempFile();
   EXPECT_NE(a, b);
   EXPECT_EQ(a.rfind(root_.Path("/tmp/S2S/temp."), 0), 0u);
   EXPECT_TRUE(S2S::IsPathExist(a) && S2S::IsPathExist(b));

@@ -177,8 +177,8 @@ TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
   // A live process that is not this root's daemon, behind its pid file:
   // stop refuses to signal it and forgets nothing.
   Child sleeper = s2s_test::Spawn(tmp.path(), {"/bin/sleep", "30"});
-  const std::string pid = root + "/var/run/s2s-rsyncd.pid";
-  const std::string port = root + "/var/run/s2s-rsyncd.port";
+  const std::string pid = root + "/var/run/s2s-rsyncd.pid",
+                    port = root + "/var/run/s2s-rsyncd.port";
   s2s_test::WriteFile(pid, std::to_string(sleeper.pid) + "\n");
   s2s_test::WriteFile(port, "873\n");
   RunCases(tmp, root, {{{"stop"}, 1, "not signalled"}});

@@ -40,8 +40,7 @@ bool ParseCtl(std::vector<std::string> args, CtlOptions& o,
 
 TEST(ControlJson, StringsAreValidWhateverTheirBytesValuesKeepTheirKinds) {
   const struct {
-    std::string in;
-    std::string out;
+    std::string in, out;
   } kCases[] = {
       {"q\"b\\s/", "\"q\\\"b\\\\s/\""},
       {"\n\t\r\x01\x7f", "\"\\n\\t\\r\\u0001\\u007f\""},

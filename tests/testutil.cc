@@ -49,22 +49,13 @@ std::string TempBase() {
     }
   }
   const int fds[] = {in, out, err};
-  for (int i = 0; i < 3; ++i) {
+  for (int i = 0; i < 3; ++i)
     if (fds[i] >= 0) dup2(fds[i], i);
-  }
   std::vector<char*> argv;
   for (std::string& a : args) argv.push_back(&a[0]);
   argv.push_back(nullptr);
   execvp(argv[0], argv.data());
   _exit(127);
-}
-
-// Starts `args` with standard input `in` and output and error `out` (-1:
-// inherited); its pid, or -1.
-pid_t Exec(std::vector<std::string> args, int in, int out) {
-  pid_t pid = fork();
-  if (pid == 0) ExecChild(std::move(args), in, out, out, {});
-  return pid;
 }
 
 std::mutex syslog_mutex;
@@ -136,7 +127,8 @@ pid_t SpawnListening(
     std::vector<std::string> args = argv_for(*port);
     if (args.empty()) return -1;
     int fd = open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
-    pid_t pid = Exec(args, -1, fd);
+    pid_t pid = fork();
+    if (pid == 0) ExecChild(args, -1, fd, fd, {});
     if (fd >= 0) close(fd);
     if (pid < 0) return -1;
     bool exited = false;
@@ -198,10 +190,9 @@ Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
 
 bool WaitUntil(const std::function<bool()>& done, double seconds,
                double every) {
-  auto deadline = std::chrono::steady_clock::now() +
-                  std::chrono::milliseconds(static_cast<int>(seconds * 1000));
+  auto start = std::chrono::steady_clock::now();
   while (!done()) {
-    if (std::chrono::steady_clock::now() > deadline) return false;
+    if (SecondsSince(start) > seconds) return false;
     std::this_thread::sleep_for(std::chrono::duration<double>(every));
   }
   return true;
@@ -220,15 +211,7 @@ TempDir::~TempDir() {
   std::filesystem::remove_all(path_, ec);
 }
 
-std::string TempDir::Sub(const std::string& name) const {
-  return path_ + "/" + name;
-}
-
 TempRoot::TempRoot() : env_("S2S_ROOT", path()) {}
-
-std::string TempRoot::Path(const std::string& abs) const {
-  return path() + abs;
-}
 
 bool TempRoot::MakeDir(const std::string& abs) const {
   std::error_code ec;
@@ -238,10 +221,6 @@ bool TempRoot::MakeDir(const std::string& abs) const {
 
 bool TempRoot::Write(const std::string& abs, const std::string& data) const {
   return MakeDir(abs.substr(0, abs.rfind('/'))) && WriteFile(Path(abs), data);
-}
-
-bool WriteScript(const std::string& path, const std::string& body) {
-  return WriteFile(path, "#!/bin/sh\n" + body, 0755);
 }
 
 SyslogCapture::SyslogCapture() {
@@ -311,11 +290,11 @@ int LoopbackListener(int* port) {
   return fd;
 }
 
+// Through operator<<, which keeps what a read error (a gone /proc file) cut.
 std::string ReadFile(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
-  if (!in) return std::string();
   std::ostringstream out;
-  out << in.rdbuf();
+  if (in) out << in.rdbuf();
   return out.str();
 }
 
@@ -327,27 +306,20 @@ bool WriteFile(const std::string& path, const std::string& data, int mode) {
 }
 
 int FreeLoopbackPort() {
-  int port = 0;
-  int fd = LoopbackListener(&port);
-  if (fd < 0) return -1;
-  close(fd);
-  return port;
+  int port = 0, fd = LoopbackListener(&port);
+  if (fd >= 0) close(fd);
+  return fd >= 0 ? port : -1;
 }
-
-RsyncDaemon::RsyncDaemon(const std::string& dir) : dir_(dir) {}
-
-RsyncDaemon::~RsyncDaemon() { Stop(); }
 
 bool RsyncDaemon::StartWithConfig(const std::string& conf) {
   Stop();
   std::string log = dir_ + "/rsyncd.log";
   pid_ = SpawnListening(
       [&](int port) -> std::vector<std::string> {
-        return {"rsync",       "--daemon",
-                "--no-detach", "--address=127.0.0.1",
-                "--port",      std::to_string(port),
-                "--config",    conf,
-                "--log-file",  log};
+        return std::vector<std::string>({"rsync", "--daemon", "--no-detach",
+                                         "--address=127.0.0.1", "--port",
+                                         std::to_string(port), "--config", conf,
+                                         "--log-file", log});
       },
       log, &port_);
   return pid_ > 0;
@@ -394,7 +366,8 @@ std::string RegistryValue(const std::string& section, const std::string& key) {
 
 bool RunQuiet(const std::vector<std::string>& args) {
   int fd = open("/dev/null", O_RDWR | O_CLOEXEC);
-  pid_t pid = Exec(args, fd, fd);
+  pid_t pid = fork();
+  if (pid == 0) ExecChild(args, fd, fd, fd, {});
   close(fd);
   int status = 0;
   return pid > 0 && waitpid(pid, &status, 0) == pid && WIFEXITED(status) &&

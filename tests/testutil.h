@@ -31,7 +31,7 @@ class TempDir : NoCopy {
 
   const std::string& path() const { return path_; }
   // path() + "/" + name.
-  std::string Sub(const std::string& name) const;
+  std::string Sub(const std::string& name) const { return path_ + "/" + name; }
 
  private:
   std::string path_;
@@ -103,8 +103,8 @@ pid_t SpawnListening(
 // lives in `dir`.
 class RsyncDaemon : NoCopy {
  public:
-  explicit RsyncDaemon(const std::string& dir);
-  ~RsyncDaemon();
+  explicit RsyncDaemon(const std::string& dir) : dir_(dir) {}
+  ~RsyncDaemon() { Stop(); }
 
   // Starts the daemon on configuration `conf`; false when it does not answer.
   bool StartWithConfig(const std::string& conf);
@@ -142,7 +142,7 @@ class TempRoot : public TempDir {
   TempRoot();
 
   // path() + `abs` (an absolute path inside the root).
-  std::string Path(const std::string& abs) const;
+  std::string Path(const std::string& abs) const { return path() + abs; }
   // Writes Path(abs), making the directories above it; true on success.
   bool Write(const std::string& abs, const std::string& data) const;
   // Creates Path(abs) and the directories above it.
@@ -184,7 +184,9 @@ bool WaitUntil(const std::function<bool()>& done, double seconds,
 
 // Writes an executable shell script `body` (without the "#!/bin/sh" line)
 // at `path`; true on success.
-bool WriteScript(const std::string& path, const std::string& body);
+inline bool WriteScript(const std::string& path, const std::string& body) {
+  return WriteFile(path, "#!/bin/sh\n" + body, 0755);
+}
 
 // A hash of the platform layer holding `kv`, freed with the pointer.
 using Hash = std::unique_ptr<KSZHASH, void (*)(KSZHASH*)>;

@@ -226,8 +226,8 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   ASSERT_EQ(0, mkdir(root.c_str(), 0755));
   ASSERT_EQ(0, chown(root.c_str(), nobody->pw_uid, nobody->pw_gid));
   ASSERT_EQ(0, chmod(tmp_.path().c_str(), 0755));
-  const std::string uid = std::to_string(nobody->pw_uid);
-  const std::string gid = std::to_string(nobody->pw_gid);
+  const std::string uid = std::to_string(nobody->pw_uid),
+                    gid = std::to_string(nobody->pw_gid);
   auto as_user = [&](std::vector<std::string> words) {
     words.insert(words.begin(),
                  {"/usr/bin/setpriv", "--reuid", uid, "--regid", gid,
