@@ -89,21 +89,15 @@ class ChannelSSLTest : public ::testing::Test {
     client.SetSSLHostname(host);
   }
 
-  // Our server end and client end over a loopback TCP connection; with
+  // Our client end and server end over a loopback TCP connection; with
   // `raw`, only `client` is ours and the test has the other end, `peer`.
-  struct Pair {
+  struct Pair : s2s_test::ChannelPair {
     explicit Pair(unsigned int capacity = 4096, int timeout = 5,
                   bool raw = false)
-        : server(capacity), client(capacity) {
-      int fds[2];
-      ok = s2s_test::TcpSocketPair(fds) && client.Open(fds[0], true) == 0 &&
-           (raw || server.Open(fds[1], true) == 0);
-      peer = raw ? fds[1] : -1;
-      server.SetTimeout(timeout);
+        : ChannelPair(capacity, true) {
+      ok = raw ? ok : Both();
       client.SetTimeout(timeout);
-    }
-    ~Pair() {
-      if (peer >= 0) close(peer);
+      server.SetTimeout(timeout);
     }
     // Both ends convert at once; the client's result.
     int Convert() {
@@ -113,9 +107,8 @@ class ChannelSSLTest : public ::testing::Test {
       t.join();
       return r;
     }
-    Channel server, client;
-    int server_result = 1, peer;
-    bool ok;
+    Channel &client = a, &server = b;
+    int server_result = 1;
   };
 
   static s2s_test::TempDir* dir_;

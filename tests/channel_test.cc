@@ -42,29 +42,7 @@ using s2s_test::LogCapture;
 using s2s_test::SecondsSince;
 using Clock = std::chrono::steady_clock;
 
-// A channel on one end of a socket pair (Unix, or TCP over loopback); `peer`
-// is the other end: a second channel, or a raw descriptor the test keeps.
-struct Pair {
-  Pair(unsigned int capacity, bool tcp = false) : a(capacity), b(capacity) {
-    int fds[2];
-    ok = tcp ? s2s_test::TcpSocketPair(fds) : s2s_test::UnixSocketPair(fds);
-    ok = ok && a.Open(fds[0], true) == 0;
-    EXPECT_TRUE(ok);
-    peer = fds[1];
-  }
-  ~Pair() {
-    if (b.IsClosed() && peer >= 0) close(peer);
-  }
-  bool Both() { return ok && b.Open(peer, true) == 0; }
-  std::string Pending() {
-    char buf[4096];
-    ssize_t n = recv(peer, buf, sizeof buf, MSG_DONTWAIT);
-    return n > 0 ? std::string(buf, n) : std::string();
-  }
-  Channel a, b;
-  int peer = -1;
-  bool ok;
-};
+using Pair = s2s_test::ChannelPair;
 
 class ChannelStreamTest : public ::testing::TestWithParam<bool> {};
 

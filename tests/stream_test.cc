@@ -23,16 +23,10 @@ std::string Bytes(std::initializer_list<int> b) {
   return s;
 }
 
-// A channel on one end of a socket pair; the test speaks raw bytes on the
-// other end, `peer`.
-struct Wire {
-  Wire() : ch(256) {
-    int fds[2];
-    ok = s2s_test::UnixSocketPair(fds) && ch.Open(fds[0], true) == 0;
-    peer = fds[1];
-    ch.SetTimeout(1);
-  }
-  ~Wire() { close(peer); }
+// A channel, `a`, on one end of a socket pair; the test speaks raw bytes on
+// the other end, `peer`.
+struct Wire : s2s_test::ChannelPair {
+  Wire() : ChannelPair(256) { a.SetTimeout(1); }
   // Feeds `bytes` and ends the stream, then decodes one message into `obj`.
   int Decode(const std::string& bytes, PObject& obj) {
     if (write(peer, bytes.data(), bytes.size()) !=
@@ -40,13 +34,10 @@ struct Wire {
       return 1;
     }
     shutdown(peer, SHUT_WR);
-    return stream.Recv(ch, obj);
+    return stream.Recv(a, obj);
   }
 
   PStream stream;
-  Channel ch;
-  int peer = -1;
-  bool ok = false;
 };
 
 // Each value encodes to exactly its bytes, and those bytes decode to it again.
@@ -90,7 +81,7 @@ TEST(PStreamTest, ValuesTravelAsTheirExactBytes) {
     SCOPED_TRACE(c.value.toString());
     Wire w;
     ASSERT_TRUE(w.ok);
-    ASSERT_EQ(w.stream.Send(w.ch, c.value), 0);
+    ASSERT_EQ(w.stream.Send(w.a, c.value), 0);
     std::string sent(2048, '\0');
     ssize_t n = recv(w.peer, &sent[0], sent.size(), MSG_DONTWAIT);
     EXPECT_EQ(sent.substr(0, n > 0 ? n : 0), c.bytes);

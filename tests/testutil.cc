@@ -275,6 +275,25 @@ bool TcpSocketPair(int fds[2]) {
   return fds[1] >= 0;
 }
 
+ChannelPair::ChannelPair(unsigned int capacity, bool tcp)
+    : a(capacity), b(capacity) {
+  int fds[2];
+  ok = (tcp ? TcpSocketPair(fds) : UnixSocketPair(fds)) &&
+       a.Open(fds[0], true) == 0;
+  EXPECT_TRUE(ok);
+  peer = fds[1];
+}
+
+ChannelPair::~ChannelPair() {
+  if (b.IsClosed() && peer >= 0) close(peer);
+}
+
+std::string ChannelPair::Pending() {
+  char buf[4096];
+  ssize_t n = recv(peer, buf, sizeof buf, MSG_DONTWAIT);
+  return n > 0 ? std::string(buf, n) : std::string();
+}
+
 int LoopbackListener(int* port) {
   int fd = socket(AF_INET, SOCK_STREAM, 0);
   if (fd < 0) return -1;

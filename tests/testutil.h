@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "S2S/channel.h"
 #include "S2S/is_syncedshare.h"
 
 namespace s2s_test {
@@ -63,6 +64,21 @@ class LogCapture : public SyslogCapture {
 // connection over 127.0.0.1. Both ends blocking; false on failure.
 bool UnixSocketPair(int fds[2]);
 bool TcpSocketPair(int fds[2]);
+
+// A channel of `capacity` bytes, `a`, on one end of a socket pair (Unix, or
+// TCP over loopback); the other end, `peer`, is the test's until Both()
+// opens channel `b` on it.
+struct ChannelPair : NoCopy {
+  explicit ChannelPair(unsigned int capacity, bool tcp = false);
+  ~ChannelPair();
+  bool Both() { return ok && b.Open(peer, true) == 0; }
+  // What has reached `peer` so far, without waiting.
+  std::string Pending();
+
+  S2S::Channel a, b;
+  int peer = -1;
+  bool ok = false;
+};
 
 // Whether `text` holds `what`.
 inline bool Has(const std::string& text, const std::string& what) {
