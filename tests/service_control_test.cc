@@ -1,6 +1,7 @@
 // The client service's control socket from the front end's side: what
-// s2sctl makes of its command line, the JSON it prints for scripts, and
-// requests against a real s2sd.
+// s2sctl makes of its command line, the JSON it prints for scripts, what it
+// shows a person (schedules in words, a transfer's progress, why a realtime
+// task is not watching), and requests against a real s2sd.
 #include <pwd.h>
 #include <signal.h>
 #include <stdlib.h>
@@ -19,6 +20,7 @@
 #include "appliances.h"
 #include "control_client.h"
 #include "ctl_options.h"
+#include "ctl_print.h"
 #include "ctl_task.h"
 #include "gtest/gtest.h"
 #include "json_writer.h"
@@ -28,6 +30,7 @@
 namespace {
 
 using namespace s2s_tools;
+using S2S::PObject;
 
 bool ParseCtl(std::vector<std::string> args, CtlOptions& o,
               std::string& error) {
@@ -54,14 +57,14 @@ TEST(ControlJson, StringsAreValidWhateverTheirBytesValuesKeepTheirKinds) {
   };
   for (const auto& c : kCases) EXPECT_EQ(c.out, JsonString(c.in)) << c.in;
 
-  S2S::PObject v;
+  PObject v;
   v["result"] = 0u;
   v["task_result"] = -1;
   v["big"] = 18446744073709551615ULL - 1;  // -2 as the protocol carries it
   v["epoch"] = 1700000000ULL;
-  v["none"] = S2S::PObject();
-  v["list"].asArray().push_back(S2S::PObject("x"));
-  v["list"].asArray().push_back(S2S::PObject());
+  v["none"] = PObject();
+  v["list"].asArray().push_back(PObject("x"));
+  v["list"].asArray().push_back(PObject());
   v["empty"].asMap();
   v["k\"ey"] = "v";
   EXPECT_EQ(
@@ -139,7 +142,7 @@ TEST(CtlOptions, AddTakesTheTaskFileUnderTheOptionsAndAPrivatePassword) {
                         "--schedule", "weekly"},
                        o, error))
       << error;
-  S2S::PObject map;
+  PObject map;
   ASSERT_TRUE(BuildTaskMap(o, true, map, note, error)) << error;
   // The option wins over the file; no port (the daemon's own) and no id
   // (the daemon picks one).
@@ -171,6 +174,97 @@ TEST(CtlOptions, AddTakesTheTaskFileUnderTheOptionsAndAPrivatePassword) {
   EXPECT_EQ("{\"ssh_port\":22}", ToJson(map, false));
 }
 
+TEST(CtlPrint, SchedulesSettingsProgressAndWhyNotWatchingInWords) {
+  const struct {
+    int mode;
+    const char* week;
+    int repeat;
+    const char* text;
+  } cases[] = {
+      {0, "1111111", 0, "manual"},
+      {1, "1111111", 0, "realtime"},
+      {2, "1111111", 0, "daily at 02:05"},
+      {2, "0111110", 0, "weekdays at 02:05"},
+      {2, "1000001", 0, "weekends at 02:05"},
+      {2, "0100100", 0, "mon,thu at 02:05"},
+      {2, "0000000", 0, "never at 02:05"},
+      {2, "1111111", 3, "daily at 02:05, 3 more every 01:30"},
+      {3, "", 0, "monthly on day 9 at 02:05"},
+      {4, "", 0, "yearly on 12-09 at 02:05"},
+      {5, "", 0, "once on 2027-12-09 at 02:05"},
+      {9, "", 0, "mode 9"},
+  };
+  for (const auto& c : cases) {
+    PObject task;
+    task["schedule_mode"] = c.mode;
+    task["week_schd"] = c.week;
+    task["schedule_begin_hour"] = 2;
+    task["schedule_begin_min"] = 5;
+    task["schedule_begin_day"] = 9;
+    task["schedule_begin_month"] = 12;
+    task["schedule_begin_year"] = 2027;
+    task["repeat_times_in_day"] = c.repeat;
+    task["period_hour"] = 1;
+    task["period_minute"] = 30;
+    EXPECT_EQ(c.text, ScheduleText(task)) << c.mode << " " << c.week;
+  }
+
+  PObject task;
+  PObject& t = task["task"];
+  t["schedule_mode"] = 1;
+  t["realtime_source"] = "inotify";
+  t["realtime_settle_ms"] = 1500;
+  t["realtime_max_delay"] = 30;
+  t["realtime_full_sync"] = 90061;
+  t["ssh"] = true;
+  t["ssh_port"] = 2222;
+  t["server_ip"] = "10.0.0.2";
+  t["server_name"] = "backup1";
+  t["schedule_error"] = "no such day";
+  PObject status;
+  PObject& run = status["running"].asArray().emplace_back();
+  run["id"] = 4;
+  run["bytes_total"] = 2u << 20;
+  run["bytes_done"] = 1u << 20;
+  run["rate"] = 512u << 10;
+  run["seconds_left"] = 2;
+  PObject& both = status["running"].asArray().emplace_back();
+  both["id"] = 5;
+  for (const char* name : {"alpha", "beta"}) {
+    PObject& share = both["shares"].asArray().emplace_back();
+    share["name"] = name;
+    share["step"] = "transfer";
+  }
+  PObject& alpha = both["shares"].asArray()[0];
+  alpha["bytes_total"] = 4u << 20;
+  alpha["bytes_done"] = 3u << 20;
+  PObject& watch = status["realtime"].asArray().emplace_back();
+  watch["id"] = 7;
+  watch["source_note"] = "not root";
+  watch["problem"] = "the server is unreachable";
+  watch["last_error"] = "rsync\x1b[31m failed";
+  PObject& share = watch["shares"].asArray().emplace_back();
+  share["name"] = "docs";
+  share["watching"] = false;
+  share["message"] = "no such directory";
+  const std::string text = FormatTask(task) + FormatStatus(status);
+  for (const char* line :
+       {"settle           1.5 s\n", "max delay        30 s\n",
+        "full sync every  1d 01:01:01\n", "change source    inotify\n",
+        "ssh              yes, port 2222\n",
+        "server           10.0.0.2 (backup1)\n",
+        "schedule error   no such day\n", "delete guard     off\n",
+        "1.0 MiB of 2.0 MiB, 512.0 KiB/s, 00:00:02 left\n",
+        "  task 7: not fanotify: not root\n",
+        "  task 7: the server is unreachable\n",
+        "  task 7: last batch failed: rsync?[31m failed\n",
+        "  task 7: share docs not watched: no such directory\n",
+        "alpha  transfer  3.0 MiB of 4.0 MiB",
+        "\n                              beta   transfer  -\n"}) {
+    EXPECT_TRUE(s2s_test::Has(text, line)) << line << "\n" << text;
+  }
+}
+
 // ---------------------------------------------------------------------------
 // Against a real s2sd whose server runs a real rsync daemon.
 
@@ -191,9 +285,8 @@ class ServiceControlTest : public s2s_test::S2sdTest {
 
   // One request; the reply's result, or 100 when no reply came. Every
   // reply is kept for the password check.
-  unsigned long long Ask(const S2S::PObject& request,
-                         S2S::PObject* out = nullptr) {
-    S2S::PObject reply;
+  unsigned long long Ask(const PObject& request, PObject* out = nullptr) {
+    PObject reply;
     std::string error;
     if (client_.Call(request, reply, error) != ControlClient::kReplied)
       return 100;
@@ -219,7 +312,7 @@ class ServiceControlTest : public s2s_test::S2sdTest {
     shutdown(fd, SHUT_WR);
     S2S::IPCSender sender;
     if (sender.assign(fd) != 0 || !up) return 200;
-    S2S::PObject reply;
+    PObject reply;
     if (sender.recv(reply) != 0) return 100;
     replies_ += ToJson(reply, false);
     *message = reply["message"].asString();
@@ -228,16 +321,16 @@ class ServiceControlTest : public s2s_test::S2sdTest {
 
   // The stored tasks as the daemon lists them.
   std::string Tasks() {
-    S2S::PObject reply;
+    PObject reply;
     EXPECT_EQ(0u, Ask(Action("list"), &reply));
     return ToJson(reply["tasks"], false);
   }
 
   // A complete manual task over "docs".
-  S2S::PObject ValidTask(const std::string& name) {
-    S2S::PObject task;
+  PObject ValidTask(const std::string& name) {
+    PObject task;
     task["name"] = name;
-    task["share_list"].asArray().push_back(S2S::PObject("docs"));
+    task["share_list"].asArray().push_back(PObject("docs"));
     task["user"] = app_.user();
     task["pswd"] = kPassword;
     task["server_ip"] = "127.0.0.1";
@@ -256,7 +349,7 @@ class ServiceControlTest : public s2s_test::S2sdTest {
           setresuid(nobody->pw_uid, nobody->pw_uid, nobody->pw_uid) != 0) {
         _exit(10);
       }
-      S2S::PObject request = Action("add"), reply;
+      PObject request = Action("add"), reply;
       request["task"] = ValidTask("intruder");
       std::string error;
       auto st = ControlClient(client_.path()).Call(request, reply, error);
@@ -273,29 +366,29 @@ class ServiceControlTest : public s2s_test::S2sdTest {
 };
 
 TEST_F(ServiceControlTest, BadRequestsChangeNothingAndCtlRunsATaskEndToEnd) {
-  S2S::PObject add = Action("add");
+  PObject add = Action("add");
   add["task"] = ValidTask("kept");
   ASSERT_EQ(0u, Ask(add));
   const std::string before = Tasks();
   ASSERT_TRUE(s2s_test::Has(before, "\"kept\"")) << before;
 
   // Maps that decode but ask for something wrong, each with its result.
-  auto with = [&](const std::string& key, const S2S::PObject& value) {
-    S2S::PObject r = add;
+  auto with = [&](const std::string& key, const PObject& value) {
+    PObject r = add;
     r["task"][key] = value;
     return r;
   };
-  S2S::PObject deep("docs");
-  for (int i = 0; i < 6; ++i) deep = S2S::PObject::Array{deep};
-  S2S::PObject no_action;
+  PObject deep("docs");
+  for (int i = 0; i < 6; ++i) deep = PObject::Array{deep};
+  PObject no_action;
   no_action["id"] = 1ULL;
-  S2S::PObject action_number;
+  PObject action_number;
   action_number["action"] = 7ULL;
-  S2S::PObject update_bad = Action("update", 1ULL);
-  update_bad["task"]["share_list"].asArray().push_back(S2S::PObject("nope"));
+  PObject update_bad = Action("update", 1ULL);
+  update_bad["task"]["share_list"].asArray().push_back(PObject("nope"));
   const struct {
     const char* what;
-    S2S::PObject request;
+    PObject request;
     unsigned long long result;
   } kCases[] = {
       {"unknown action", Action("frobnicate"), 2},
@@ -306,16 +399,15 @@ TEST_F(ServiceControlTest, BadRequestsChangeNothingAndCtlRunsATaskEndToEnd) {
       {"add without task", Action("add"), 1},
       {"unknown share", with("share_list", update_bad["task"]["share_list"]),
        4},
-      {"no server", with("server_ip", S2S::PObject("")), 4},
-      {"name taken", with("name", S2S::PObject("kept")), 4},
-      {"name the server refuses", with("name", S2S::PObject("..")), 4},
-      {"address with a blank", with("server_ip", S2S::PObject("10.0.0.1 x")),
-       4},
-      {"hour 24", with("schedule_begin_hour", S2S::PObject(24ULL)), 4},
-      {"name mistyped", with("name", S2S::PObject(5ULL)), 1},
-      {"unknown key", with("colour", S2S::PObject("red")), 1},
-      {"name of 65535 bytes",
-       with("name", S2S::PObject(std::string(65535, 'n'))), 1},
+      {"no server", with("server_ip", PObject("")), 4},
+      {"name taken", with("name", PObject("kept")), 4},
+      {"name the server refuses", with("name", PObject("..")), 4},
+      {"address with a blank", with("server_ip", PObject("10.0.0.1 x")), 4},
+      {"hour 24", with("schedule_begin_hour", PObject(24ULL)), 4},
+      {"name mistyped", with("name", PObject(5ULL)), 1},
+      {"unknown key", with("colour", PObject("red")), 1},
+      {"name of 65535 bytes", with("name", PObject(std::string(65535, 'n'))),
+       1},
       {"nested too deep", with("share_list", deep), 1},
       {"update to unknown share", update_bad, 4},
   };
@@ -381,7 +473,7 @@ TEST_F(ServiceControlTest, BadRequestsChangeNothingAndCtlRunsATaskEndToEnd) {
   EXPECT_EQ(0u, Ask(Action("status"))) << "the daemon stopped serving";
 
   // The password went in and never came back; that one is stored is said.
-  S2S::PObject got;
+  PObject got;
   ASSERT_EQ(0u, Ask(Action("get", 1ULL), &got));
   EXPECT_TRUE(got["task"]["has_password"].asBool());
   EXPECT_FALSE(s2s_test::Has(replies_, kPassword));
