@@ -1,8 +1,7 @@
-// Two appliances on one machine: a client root and a server root in one
-// temporary directory, the server's rsync daemon configured by the server's
-// own generator and running on a free loopback port, and the environment
-// pointed at the client (S2S_ROOT, S2S_RSYNC_PORT) so that the library under
-// test talks to that daemon as a client would.
+// Two appliances on one machine: a client root and a server root, the
+// server's rsync daemon (configured by the server's own generator) on a free
+// loopback port, and S2S_ROOT and S2S_RSYNC_PORT pointed at the client, so
+// that the library under test talks to that daemon as a client would.
 #ifndef S2S_TESTS_APPLIANCES_H_
 #define S2S_TESTS_APPLIANCES_H_
 
@@ -22,10 +21,9 @@ class Appliances : NoCopy {
   explicit Appliances(const std::string& handler);
   ~Appliances();
 
-  // Declares share `name` on both appliances (and on every client added
-  // later), with an empty directory on each side. An encrypted share has its
-  // data in its lower directory "@name@" and a key file of its own on the
-  // client. Call before StartServer.
+  // Declares share `name`, empty, on both appliances and every client added
+  // later; an encrypted one keeps its data in "@name@" and has a key file on
+  // the client. Call before StartServer.
   bool AddShare(const std::string& name, bool encrypted = false);
   // Generates the server's daemon configuration under the server root and
   // starts the daemon; S2S_RSYNC_PORT then names its port. `old_server`
@@ -42,16 +40,14 @@ class Appliances : NoCopy {
 
   const std::string& client_root() const { return client_root_; }
   const std::string& server_root() const { return server_root_; }
-  // A share's directory on the client / the server (the lower directory
-  // for an encrypted share).
+  // A share's directory (an encrypted one's lower) on the client / server.
   std::string ClientShare(const std::string& name) const {
     return ShareDir(client_root_, name);
   }
   std::string ServerShare(const std::string& name) const {
     return ShareDir(server_root_, name);
   }
-  // A value of the server's registry: `key` of section `section`, read with
-  // S2S_ROOT at the server root; "" when absent.
+  // `key` of `section` of the server's registry; "" when absent.
   std::string ServerRegistry(const std::string& section,
                              const std::string& key);
 
@@ -82,10 +78,8 @@ class Appliances : NoCopy {
 };
 
 // A stand-in for the server's command handler: a real rsync daemon whose
-// command module answers each command with the status and answer the test
-// chose, and keeps the last request of each command as it arrived. For
-// answers the real handler never gives (a version of 3, garbage, a status
-// of 51) and for checking the lines that crossed the wire.
+// command module answers each command as the test chose (answers the real
+// handler never gives included) and keeps the last request of each.
 class ScriptedServer : NoCopy {
  public:
   explicit ScriptedServer(const std::string& dir);
@@ -93,15 +87,13 @@ class ScriptedServer : NoCopy {
   // Starts the daemon for `user` with `password`; S2S_RSYNC_PORT names its
   // port while the object lives.
   bool Start(const std::string& user, const std::string& password);
-  // From now on `command` is answered with `status` and `answer` (the
-  // default is status 0 and an empty answer).
+  // From now on `command` is answered with `status` and `answer` (else 0).
   void Answer(const std::string& command, int status,
               const std::string& answer = "");
   // From now on the reply to `command` is grown to `size` bytes (a sparse
   // hole after the answer), as a hostile server would flood a client.
   void PadReply(const std::string& command, unsigned long long size);
-  // The lines of the last `command` received, requestID line included; ""
-  // when none came.
+  // The last `command` received, requestID line included; "" if none came.
   std::string LastRequest(const std::string& command) const;
   // How many commands were received.
   int Count() const;

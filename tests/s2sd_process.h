@@ -25,7 +25,6 @@ namespace s2s_test {
 // <ns> <pid>") and reaches no server while the file unreachable_ exists.
 class S2sdTest : public ::testing::Test {
  protected:
-  S2sdTest() : app_(S2S_CMD_HANDLER) {}
   ~S2sdTest() override { StopDaemon(); }
 
   void SetUpServer(const std::vector<std::string>& shares,
@@ -112,9 +111,8 @@ class S2sdTest : public ::testing::Test {
   static size_t Count(const std::string& text, const std::string& what) {
     size_t n = 0;
     for (size_t at = text.find(what); at != std::string::npos;
-         at = text.find(what, at + 1)) {
+         at = text.find(what, at + 1))
       ++n;
-    }
     return n;
   }
 
@@ -123,7 +121,7 @@ class S2sdTest : public ::testing::Test {
     return Count(ReadFile(rsync_log_), what);
   }
 
-  Appliances app_;
+  Appliances app_{S2S_CMD_HANDLER};
   TempDir tmp_;
   Child daemon_;
   std::string bin_, rsync_log_, unreachable_;

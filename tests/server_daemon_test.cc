@@ -1,6 +1,5 @@
 // The server end to end: a generated daemon configuration, the real rsync
 // daemon on loopback running the real handler, and the client's wrapper.
-#include <netinet/in.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -103,26 +102,21 @@ class ServerDaemonTest : public ::testing::Test {
   // which point the daemon counts it against the module's limit; -1 when
   // it was refused.
   int Stalled(const std::string& module) {
-    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_in addr = {};
-    addr.sin_family = AF_INET;
-    addr.sin_port = htons(static_cast<uint16_t>(daemon_.port()));
-    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    int fd = s2s_test::ConnectLoopback(daemon_.port());
     std::string said, hello = "@RSYNCD: 31.0\n" + module + "\n";
     timeval bound = {10, 0};
     setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &bound, sizeof bound);
-    if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0 &&
-        write(fd, hello.data(), hello.size()) ==
-            static_cast<ssize_t>(hello.size())) {
+    if (write(fd, hello.data(), hello.size()) ==
+        static_cast<ssize_t>(hello.size())) {
       char buf[256];
       ssize_t n;
-      while (said.find("AUTHREQD") == std::string::npos &&
+      while (!s2s_test::Has(said, "AUTHREQD") &&
              (n = read(fd, buf, sizeof buf)) > 0) {
         said.append(buf, static_cast<size_t>(n));
       }
     }
-    if (said.find("AUTHREQD") != std::string::npos) return fd;
-    close(fd);
+    if (s2s_test::Has(said, "AUTHREQD")) return fd;
+    if (fd >= 0) close(fd);
     return -1;
   }
 

@@ -144,8 +144,7 @@ TEST(CtlOptions, AddTakesTheTaskFileUnderTheOptionsAndAPrivatePassword) {
       << error;
   PObject map;
   ASSERT_TRUE(BuildTaskMap(o, true, map, note, error)) << error;
-  // The option wins over the file; no port (the daemon's own) and no id
-  // (the daemon picks one).
+  // The option wins over the file; no port (the daemon's own) and no id.
   EXPECT_EQ(
       "{\"block\":0,\"compress\":1,\"delete_guard\":1,"
       "\"delete_guard_files\":10000,\"delete_guard_percent\":50,"
@@ -160,8 +159,7 @@ TEST(CtlOptions, AddTakesTheTaskFileUnderTheOptionsAndAPrivatePassword) {
       ToJson(map, false));
   EXPECT_TRUE(s2s_test::Has(note, "S2S_RSYNC_PORT"));
 
-  // An edit sends what the file describes, never the schedule it cannot
-  // hold, and a password only when one is named.
+  // An edit sends what the file holds, no schedule, a password only if named.
   CtlOptions e;
   ASSERT_TRUE(ParseCtl({"task", "edit", "1", "--task-file", task}, e, error));
   chmod(pass.c_str(), 0644);
@@ -265,7 +263,6 @@ TEST(CtlPrint, SchedulesSettingsProgressAndWhyNotWatchingInWords) {
   }
 }
 
-// ---------------------------------------------------------------------------
 // Against a real s2sd whose server runs a real rsync daemon.
 
 const char kPassword[] = "Pw-never-back-4711";
@@ -283,8 +280,7 @@ class ServiceControlTest : public s2s_test::S2sdTest {
     StartDaemon();
   }
 
-  // One request; the reply's result, or 100 when no reply came. Every
-  // reply is kept for the password check.
+  // One request; the reply's result (kept for the password check), or 100.
   unsigned long long Ask(const PObject& request, PObject* out = nullptr) {
     PObject reply;
     std::string error;
@@ -295,8 +291,7 @@ class ServiceControlTest : public s2s_test::S2sdTest {
     return reply["result"].asUInt64();
   }
 
-  // Sends raw bytes and closes the sending side; the reply's result, or 100
-  // when the daemon closed the connection without one.
+  // Raw bytes, the sending side then shut; the reply's result, or 100.
   unsigned long long AskRaw(const std::string& bytes, std::string* message) {
     int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     sockaddr_un addr = {};
@@ -411,15 +406,12 @@ TEST_F(ServiceControlTest, BadRequestsChangeNothingAndCtlRunsATaskEndToEnd) {
       {"nested too deep", with("share_list", deep), 1},
       {"update to unknown share", update_bad, 4},
   };
-  for (const auto& c : kCases) {
-    EXPECT_EQ(c.result, Ask(c.request)) << c.what;
-  }
+  for (const auto& c : kCases) EXPECT_EQ(c.result, Ask(c.request)) << c.what;
   for (const char* action : {"get", "delete", "run", "enable", "history"}) {
     EXPECT_EQ(3u, Ask(Action(action, 999ULL))) << action;
   }
 
-  // Bytes that are no request: no reply (the connection is dropped) or an
-  // error, never a change.
+  // Bytes that are no request: dropped, or an error, never a change.
   const std::string list_map = "\x42" + Str("action") + Str("list") + "\x40";
   std::string oversized = "\x42" + Str("action") + Str("add") + Str("task") +
                           "\x42" + Str("excludes") + "\x41";

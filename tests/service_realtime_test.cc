@@ -108,7 +108,6 @@ TEST(Batcher, SettlesAfterTheLastChangeButNeverPastTheMaximumDelay) {
   EXPECT_EQ("docs:/a docs:/b", Str(b.Take()));
 }
 
-// ---------------------------------------------------------------------------
 // s2sd watching a share, with each change source.
 
 using S2S::PObject;

@@ -1,6 +1,5 @@
 // The client service: its scheduler through the clock seam, its files, and
-// s2sd itself as a process against a real server appliance, driven through
-// its control socket.
+// s2sd itself against a real server appliance, through its control socket.
 #include <poll.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
@@ -36,8 +35,7 @@ using namespace s2s_service;
 using s2s_test::ReadFile;
 using s2s_test::WriteFile;
 
-// Every minute from 11:30 to 13:05 (96 runs, the most a day may have) of
-// every day, from 2020-01-01.
+// Every minute from 11:30 to 13:05 (96 runs, a day's most), from 2020-01-01.
 S2S::Schedule EveryMinute() {
   S2S::Schedule s;
   s.SetMode(S2S::SCHD_WEEKLY);
@@ -121,7 +119,6 @@ TEST(Scheduler, EarliestFirstOncePerDueFollowsClockJumpsRetriesBackOff) {
   EXPECT_EQ(At(2026, 3, 2, 0, 0), s.Earliest());
 }
 
-// The shares a status shows in progress, after each of a run's lines.
 TEST(ActiveRun, SharesInProgressFollowTheRunnersLines) {
   const std::pair<const char*, const char*> lines[] = {
       {"share a: started", "a:started"},
@@ -199,7 +196,6 @@ TEST(ServiceFiles, StoreRefusesBrokenFilesOneByOneAndHistoryIsBounded) {
   EXPECT_EQ(1234, again.LastDue(7));
 }
 
-// ---------------------------------------------------------------------------
 // s2sd as a process.
 
 class ServiceTest : public s2s_test::S2sdTest {
@@ -212,8 +208,7 @@ class ServiceTest : public s2s_test::S2sdTest {
     return Request(Action("history", id))["runs"].asArray();
   }
 
-  // Whether the task has `runs` runs or more, the newest ended with
-  // `outcome`.
+  // Whether the task has `runs` runs or more, the newest ended `outcome`.
   std::function<bool()> Ended(unsigned long long id, const std::string& outcome,
                               size_t runs = 1) {
     return [this, id, outcome, runs] {
@@ -273,17 +268,15 @@ class ServiceTest : public s2s_test::S2sdTest {
     return WaitFor(Ended(id, "ok", runs), 30);
   }
 
-  // What the server's daemon has served, from the connections it logs as
-  // let into a module: {commands (the command module, whose hooks run the
-  // handler), data transfers (any other module)}.
+  // What the server's daemon has served, from the connections it let into a
+  // module: {commands (module s2scmd), data transfers (any other)}.
   std::pair<size_t, size_t> Served() {
     const std::string log = app_.DaemonLog();
     size_t commands = Count(log, "access on module s2scmd ");
     return {commands, Count(log, "access on module ") - commands};
   }
 
-  // s2sd's options that set its schedules' clock to 12:00 and `second`
-  // seconds today, amid the runs of EveryMinute.
+  // s2sd's options that set its schedules' clock to today 12:00 + `second`.
   static std::vector<std::string> ClockAt(int second) {
     long now = static_cast<long>(time(nullptr));
     tm t;
@@ -298,9 +291,8 @@ void WriteBlob(const std::string& path, int mb) {
 }
 
 TEST_F(ServiceTest, ScheduledRunsByThemselvesApartAndCatchUpOnceManualWaits) {
-  for (const char* share : {"docs", "photos", "more"}) {
+  for (const char* share : {"docs", "photos", "more"})
     WriteBlob(app_.ClientShare(share) + "/blob", 1);
-  }
   WriteFile(app_.ClientShare("docs") + "/a.txt", "alpha\n");
   WriteBlob(app_.ClientShare("big") + "/blob", 4);
   // Four tasks due 3 s after the start, two of them over docs; at 1 MiB/s
@@ -308,15 +300,12 @@ TEST_F(ServiceTest, ScheduledRunsByThemselvesApartAndCatchUpOnceManualWaits) {
   StartDaemon(ClockAt(57));
   PObject slow;
   slow["max_bandwidth"] = 1024u;
-  for (const char* name : {"a", "b"}) {
-    AddTask(name, {"docs"}, EveryMinute(), slow);
-  }
-  AddTask("c", {"photos"}, EveryMinute(), slow);
-  AddTask("d", {"more"}, EveryMinute(), slow);
+  const char* const tasks[][2] = {
+      {"a", "docs"}, {"b", "docs"}, {"c", "photos"}, {"d", "more"}};
+  for (const auto& t : tasks) AddTask(t[0], {t[1]}, EveryMinute(), slow);
   unsigned long long manual = AddTask("manual", {"big"}, S2S::Schedule());
-  for (unsigned long long id = 1; id <= 4; ++id) {
+  for (unsigned long long id = 1; id <= 4; ++id)
     ASSERT_TRUE(WaitFor(Ended(id, "ok"), 60)) << Log();
-  }
   EXPECT_EQ(2u, MostAtOnce()) << ReadFile(rsync_log_);
   EXPECT_EQ("alpha\n", ReadFile(app_.ServerShare("docs") + "/a.txt"));
   EXPECT_EQ("schedule", Runs(1)[0]["trigger"].asString());
@@ -336,7 +325,7 @@ TEST_F(ServiceTest, ScheduledRunsByThemselvesApartAndCatchUpOnceManualWaits) {
   EXPECT_EQ(0, StopDaemon());
 
   // At 12:10:30: the missed slots give one catch-up run; tasks and history
-  // are still there.
+  // remain.
   StartDaemon(ClockAt(600 + 30));
   ASSERT_TRUE(WaitFor(Ended(1, "ok", 2), 30));
   PObject::Array runs = Runs(1);
@@ -402,8 +391,7 @@ TEST_F(ServiceTest, RunsSendOnlyNeededCommandsCancelCleanlyAndPairAgain) {
             Request(Action("get", id_long))["task"]["state"].asString());
 
   // SIGTERM during the next transfer: cancelled the same way, and s2sd ends.
-  // New data, so that the transfer outlasts the stop however much of the
-  // blob the cancelled run left to resume from.
+  // New data outlasts the stop, whatever the cancelled run left to resume.
   WriteBlob(app_.ClientShare("big") + "/blob2", 41);
   ASSERT_EQ(0u, Request(Action("run", id_long))["result"].asUInt64());
   ASSERT_TRUE(

@@ -70,20 +70,8 @@ sockaddr_in LoopbackAddr(int port) {
   return addr;
 }
 
-// A new socket connected to 127.0.0.1:`port`, or -1.
-int Connect(int port) {
-  int fd = socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in addr = LoopbackAddr(port);
-  if (fd >= 0 &&
-      connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
-    close(fd);
-    fd = -1;
-  }
-  return fd;
-}
-
 bool Accepts(int port) {
-  int fd = Connect(port);
+  int fd = ConnectLoopback(port);
   if (fd >= 0) close(fd);
   return fd >= 0;
 }
@@ -111,6 +99,17 @@ void RecordSyslog(int priority, const char* format, va_list ap) {
 }
 
 }  // namespace
+
+int ConnectLoopback(int port) {
+  int fd = socket(AF_INET, SOCK_STREAM, 0);
+  sockaddr_in addr = LoopbackAddr(port);
+  if (fd >= 0 &&
+      connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
+    close(fd);
+    fd = -1;
+  }
+  return fd;
+}
 
 void StopChild(pid_t* pid) {
   if (*pid <= 0) return;
@@ -268,7 +267,7 @@ bool TcpSocketPair(int fds[2]) {
   int port = 0;
   int lfd = LoopbackListener(&port);
   if (lfd < 0) return false;
-  fds[0] = Connect(port);
+  fds[0] = ConnectLoopback(port);
   fds[1] = fds[0] >= 0 ? accept(lfd, nullptr, nullptr) : -1;
   close(lfd);
   if (fds[1] < 0 && fds[0] >= 0) close(fds[0]);

@@ -31,7 +31,6 @@ class TempDir : NoCopy {
   ~TempDir();
 
   const std::string& path() const { return path_; }
-  // path() + "/" + name.
   std::string Sub(const std::string& name) const { return path_ + "/" + name; }
 
  private:
@@ -92,31 +91,29 @@ inline double SecondsSince(std::chrono::steady_clock::time_point start) {
 
 // Reads a whole file; "" when it cannot be read.
 std::string ReadFile(const std::string& path);
-// Writes a whole file, then gives it `mode` unless that is -1; true on
-// success.
+// Writes a whole file and gives it `mode` (unless -1); true on success.
 bool WriteFile(const std::string& path, const std::string& data, int mode = -1);
+// A new socket connected to 127.0.0.1:`port`, or -1.
+int ConnectLoopback(int port);
 // A TCP port on 127.0.0.1 that was free a moment ago.
 int FreeLoopbackPort();
-// A socket listening on 127.0.0.1 at *port (0: any free port, which is then
-// stored there); -1 on failure. The kernel completes connections to it
-// whether or not they are accepted.
+// A socket listening on 127.0.0.1 at *port (0: any free one, stored there),
+// or -1; the kernel completes connections whether or not they are accepted.
 int LoopbackListener(int* port);
 
 // SIGTERM to a child this process started (*pid, unless <= 0), then waits for
 // it; *pid becomes -1.
 void StopChild(pid_t* pid);
 
-// Starts the program that `argv_for` gives for a free loopback port (an empty
-// vector: give up), with its output appended to `log`, and waits until it
-// accepts there. Retries on other ports, since a port found free may be taken
-// before the program binds it. Its pid (and the port in *port), or -1.
+// Starts what `argv_for` gives for a free loopback port (nothing: give up),
+// output appended to `log`, until it accepts there, on other ports too (one
+// found free may be taken before it binds). Its pid (port in *port), or -1.
 pid_t SpawnListening(
     const std::function<std::vector<std::string>(int)>& argv_for,
     const std::string& log, int* port);
 
-// A real rsync daemon on 127.0.0.1 at a free port, in the foreground
-// (--no-detach), started by this object and stopped by its own pid. Its log
-// lives in `dir`.
+// A real rsync daemon on 127.0.0.1 at a free port, in the foreground and
+// stopped by its own pid; its log lives in `dir`.
 class RsyncDaemon : NoCopy {
  public:
   explicit RsyncDaemon(const std::string& dir) : dir_(dir) {}
@@ -150,14 +147,12 @@ class ScopedEnv : NoCopy {
   std::string old_;
 };
 
-// A temporary appliance root: a TempDir that S2S_ROOT points at while the
-// object lives, so that every fixed system path of the platform layer lands
-// inside it.
+// A TempDir that S2S_ROOT points at while it lives, so that every fixed
+// system path of the platform layer lands inside it.
 class TempRoot : public TempDir {
  public:
   TempRoot();
 
-  // path() + `abs` (an absolute path inside the root).
   std::string Path(const std::string& abs) const { return path() + abs; }
   // Writes Path(abs), making the directories above it; true on success.
   bool Write(const std::string& abs, const std::string& data) const;
@@ -180,8 +175,7 @@ struct Child {
   std::string out, err;
   int code = -1;
 
-  // Waits for the child, at most `seconds` (then it is killed); its exit
-  // code, or 128 + signal.
+  // Waits at most `seconds` (then kills it); its exit code, or 128 + signal.
   int Wait(int seconds = 60);
 };
 
@@ -198,8 +192,7 @@ Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
 bool WaitUntil(const std::function<bool()>& done, double seconds,
                double every = 0.005);
 
-// Writes an executable shell script `body` (without the "#!/bin/sh" line)
-// at `path`; true on success.
+// An executable "#!/bin/sh" script `body` at `path`; true on success.
 inline bool WriteScript(const std::string& path, const std::string& body) {
   return WriteFile(path, "#!/bin/sh\n" + body, 0755);
 }

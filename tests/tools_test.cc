@@ -1,7 +1,6 @@
-// The programs end to end: s2s-server sets up a server root and runs its
-// rsync daemon on loopback, s2s-client syncs client roots to it. What is
-// checked is what a person sees: exit codes, the copied files, the
-// registry, and that the password shows nowhere.
+// The programs end to end: s2s-server runs a server root's rsync daemon on
+// loopback, s2s-client syncs client roots to it. What is checked is what a
+// person sees: exit codes, files, the registry, the password nowhere.
 #include <dirent.h>
 #include <fcntl.h>
 #include <pwd.h>
@@ -72,8 +71,7 @@ std::vector<std::pair<pid_t, std::string>> AllProcs(const char* file) {
   return out;
 }
 
-// The rsync processes whose parent is `parent`, with the session each is
-// in.
+// The rsync processes whose parent is `parent`, with each one's session.
 std::vector<std::pair<pid_t, pid_t>> RsyncChildren(pid_t parent) {
   std::vector<std::pair<pid_t, pid_t>> out;
   for (const auto& p : AllProcs("stat")) {
@@ -101,8 +99,7 @@ void WriteBlob(const std::string& path, int mb) {
   }
 }
 
-// Bytes of file data a run's summary says were sent: "N files and 20.1 MiB
-// sent".
+// Bytes of data a run's summary says were sent ("N files and 2.1 MiB sent").
 double SentBytes(const std::string& out) {
   double v = -1;
   char unit = 0;
@@ -156,8 +153,7 @@ class ToolsTest : public ::testing::Test {
     }
   }
 
-  // A client root with serial `serial`, made by `s2s-client init` alone,
-  // and the share docs holding a tree.
+  // A client root made by `s2s-client init` alone, its docs holding a tree.
   std::string MakeClient(const std::string& name, const std::string& serial) {
     std::string root = tmp_.Sub(name);
     Child init = RunProgram(
@@ -240,9 +236,9 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   Child start = as_user({"start"});
   ASSERT_EQ(0, start.code) << start.out << start.err;
   // However the test ends, its daemon does not outlive it.
-  bool stopped = false;
-  std::shared_ptr<void> stop_anyway(nullptr, [&](void*) {
-    if (!stopped) as_user({"stop"});
+  std::shared_ptr<void> stop_at_end(nullptr, [&](void*) {
+    Child stop = as_user({"stop"});
+    EXPECT_EQ(0, stop.code) << stop.out << stop.err;
   });
 
   std::string client = MakeClient("client", "CLIENT-A");
@@ -250,13 +246,8 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
       0, symlink("sub/deeper/b.txt", (client + "/volume1/docs/link").c_str()));
   Child c = Sync(client, "docs", {"--port", PortOf(start)});
   EXPECT_EQ(kExitOk, c.code) << c.out << c.err;
-  struct stat st;
-  ASSERT_EQ(0, lstat((root + "/volume1/docs/link").c_str(), &st));
-  EXPECT_TRUE(S_ISLNK(st.st_mode));
+  EXPECT_TRUE(std::filesystem::is_symlink(root + "/volume1/docs/link"));
   EXPECT_EQ("bravo from CLIENT-A\n", ReadFile(root + "/volume1/docs/link"));
-  Child stop = as_user({"stop"});
-  stopped = true;
-  EXPECT_EQ(0, stop.code) << stop.out << stop.err;
 }
 
 // One client's round on a running server: a first sync whose password no
@@ -282,8 +273,7 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
       if (cmd.find("rsync") == 0 &&
           cmd.find(":" + port_) != std::string::npos) {
         ++rsync_seen;
-        // Past reading the password, the client's own environment block
-        // no longer holds it.
+        // Past reading it, the client's own environment no longer holds it.
         environ_clean =
             environ_clean && !Has(ReadFile(environ_path), kPassword);
       }
@@ -331,8 +321,7 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
             ReadFile(server_ + "/volume1/docs/sub/deeper/b.txt"));
   EXPECT_EQ("CLIENT-A", ShareKey("docs", "CompleteID"));
 
-  // A dry run of a changed share lists what a sync would send and delete,
-  // and the server's data and registry stay as they were.
+  // A dry run lists what a sync would send and delete, and changes nothing.
   WriteFile(client + "/volume1/docs/new.txt", "new\n");
   std::filesystem::remove(client + "/volume1/docs/a.txt");
   const std::string registry = server_ + "/usr/karo/etc/karoS2S.info";
@@ -360,8 +349,7 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
                                   "CLIENT-A", "--share", "extra=" + on_root})
              .code);
   WriteFile(on_root + "/new.txt", "new share\n");
-  // A disk image of 64 MiB holding 1 MiB of data takes about 1 MiB on the
-  // server too, not 64 MiB of zeros.
+  // A 64 MiB disk image holding 1 MiB of data takes about 1 MiB there too.
   WriteFile(on_root + "/disk.img", std::string(1 << 20, 'd'));
   std::filesystem::resize_file(on_root + "/disk.img", 64 << 20);
   Child sync = Sync(tmp_.Sub("extraclient"), "extra");
@@ -407,11 +395,10 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
   EXPECT_EQ("", ShareKey("docs", "RunningID"));
 }
 
-// A large file's transfer cut by SIGTERM past half way: the client says so,
-// records the task idle again and leaves the share's sync unfinished; the
-// next run sends only what had not arrived, from the part the server kept.
-// Then the delete guard, and the server's copy on a 2 MiB filesystem of its
-// own: the client says what rsync said on the far side.
+// A large file's transfer cut by SIGTERM past half way leaves the share's
+// sync unfinished, and the next run sends only what the server's kept part
+// lacks. Then the delete guard, and a full disk on the server, in rsync's
+// words.
 TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
   std::string client = MakeClient("client", "CLIENT-A");
   const double kSize = 24 << 20;
@@ -449,9 +436,9 @@ TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
   EXPECT_EQ(kSize, std::filesystem::file_size(share + "/blob"));
   EXPECT_FALSE(std::filesystem::exists(share + "/.s2s-partial"));
 
-  // The client's share emptied (its disk not mounted) but for one changed
-  // file: that file arrives, nothing is deleted, the refusal names the share
-  // and the counts; a confirmed run then deletes.
+  // The client's share emptied (a disk not mounted) but for a changed file:
+  // it arrives, nothing is deleted and the refusal says why, until a
+  // confirmed run.
   const std::string mine = client + "/volume1/big";
   for (const char* f : {"f1", "f2", "f3", "f4"}) WriteFile(mine + "/" + f, f);
   ASSERT_EQ(kExitOk, Sync(client, "big").code);
@@ -488,11 +475,10 @@ TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
              {"share big: transfer failed: ", "No space left on device"});
 }
 
-// kill -9 of the client while it transfers and a beacon's command is in
-// flight: a second run of the task is refused while the first holds the
-// task's lock; the killed client's rsync runs (they hold the lock too) end
-// with it and the server gets no file; the next run clears what the killed
-// one left behind.
+// kill -9 of a client in mid-transfer, a beacon in flight: a second run is
+// refused while it holds the task's lock; its rsync runs (holding the lock
+// too) end with it, the server gets no file, and the next run clears what
+// it left behind.
 TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
   std::string client = MakeClient("client", "CLIENT-A");
   WriteBlob(client + "/volume1/big/blob", 16);
@@ -527,9 +513,8 @@ TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
   std::string tmp = client + "/tmp/S2S";
   ASSERT_FALSE(std::filesystem::is_empty(tmp)) << "no command was running";
 
-  // The next run, from a task file with a beacon due at every poll: the
-  // beacons' own rsync runs nest inside the transfer's wait without
-  // disturbing it.
+  // The next run, from a task file, with a beacon at every poll: their rsync
+  // runs nest inside the transfer's wait without disturbing it.
   std::string task = tmp_.Sub("t.task");
   WriteFile(task,
             "[Task]\n\tname=\"filetask\"\n\tserver_ip=\"127.0.0.1\"\n"
