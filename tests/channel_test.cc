@@ -229,12 +229,10 @@ TEST(ResultMessage, EveryCodeHasItsTextAsWrittenAndOutsidersAreUnknown) {
   EXPECT_STREQ(S2S::ResultMessage(-5), "Protocal error");
   EXPECT_STREQ(S2S::ResultMessage(-19), "no permission ");
   EXPECT_STREQ(S2S::ResultMessage(-25), "permission is read-only");
-  for (int r = 0; r > -S2S::kResultCodeCount; --r) {
+  for (int r = 0; r > -S2S::kResultCodeCount; --r)
     EXPECT_STRNE(S2S::ResultMessage(r), "Unknown error") << r;
-  }
-  for (int r : {-S2S::kResultCodeCount, 1, INT_MIN, INT_MAX}) {
+  for (int r : {-S2S::kResultCodeCount, 1, INT_MIN, INT_MAX})
     EXPECT_STREQ(S2S::ResultMessage(r), "Unknown error") << r;
-  }
 }
 
 }  // namespace

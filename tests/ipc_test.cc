@@ -51,9 +51,8 @@ TEST(IPCTest, DomainListenerServesClientsOneAfterAnother) {
   for (unsigned long long c = 0; c < 3; ++c) {
     IPCSender client;
     ASSERT_EQ(client.connect(path), 0);
-    for (unsigned long long n = c * 10; n < c * 10 + 5; ++n) {
+    for (unsigned long long n = c * 10; n < c * 10 + 5; ++n)
       EXPECT_EQ(Echo(client, n), n + 1);
-    }
   }
   server.join();
   EXPECT_TRUE(Exists(path));

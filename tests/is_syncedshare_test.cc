@@ -21,9 +21,8 @@ const auto Value = s2s_test::RegistryValue;
 
 std::string Joined(const KSZLIST* l) {
   std::string out;
-  for (int i = 0; i < KLIBCSzListCount(l); ++i) {
+  for (int i = 0; i < KLIBCSzListCount(l); ++i)
     out += std::string(i ? ":" : "") + KLIBCSzListGet(l, i);
-  }
   return out;
 }
 
@@ -142,9 +141,8 @@ TEST_F(RegistryTest, CheckIfSharePairedSortsByFeeder) {
       "[SHARE_done]\n\tCompleteID=\"other\"\n"
       "[SHARE_back]\n\tCompleteID=\"other\"\n\tRunningID=\"me\"\n");
   KSZLIST* shares = KLIBCSzListAlloc();
-  for (const char* s : {"free", "mine", "running", "done", "back", "new"}) {
+  for (const char* s : {"free", "mine", "running", "done", "back", "new"})
     KLIBCSzListPush(shares, s);
-  }
   KSZLIST* l[3] = {KLIBCSzListAlloc(), KLIBCSzListAlloc(), KLIBCSzListAlloc()};
   ASSERT_EQ(S2SCheckIfSharePaired(shares, "me", l[0], l[1], l[2]), S2S_SVR_OK);
   EXPECT_EQ(Joined(l[0]), "free:new");

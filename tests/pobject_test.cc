@@ -141,9 +141,8 @@ TEST(PObject, HundredsOfThousandsOfLevelsBuildCopyAndDestroy) {
   PObject copy(root);
   const PObject* walk = &copy;
   int depth = 0;
-  for (; walk->isContainer(); ++depth) {
+  for (; walk->isContainer(); ++depth)
     walk = walk->isMap() ? &walk->asMap().begin()->second : &walk->asArray()[0];
-  }
   EXPECT_EQ(depth, kDepth);
   EXPECT_EQ(walk->asString(), "leaf");
   root.clear();

@@ -43,9 +43,8 @@ class RsyncerCmdTest : public ::testing::Test {
   std::string Joined(int r) {
     EXPECT_EQ(out_.front(), "kept");
     std::string joined = r == 0 ? "" : "refused";
-    for (auto it = std::next(out_.begin()); it != out_.end(); ++it) {
+    for (auto it = std::next(out_.begin()); it != out_.end(); ++it)
       joined += (it == std::next(out_.begin()) ? "" : "|") + *it;
-    }
     out_ = {"kept"};
     return joined;
   }

@@ -201,9 +201,8 @@ TEST_F(RsyncerSyncTest, CancelStopsALargeTransferPromptly) {
   // on, and nothing else.
   auto names = [this] {
     std::string all;
-    for (const auto& e : fs::directory_iterator(app_.ServerShare("docs"))) {
+    for (const auto& e : fs::directory_iterator(app_.ServerShare("docs")))
       all += e.path().filename().string() + " ";
-    }
     return all;
   };
   EXPECT_TRUE(s2s_test::WaitUntil(

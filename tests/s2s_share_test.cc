@@ -67,9 +67,8 @@ TEST_F(ShareTest, ShareInfoNamesTheModuleAndItsDirectory) {
   S2S::ShareInfo info;
   EXPECT_EQ(S2S::GetShareInfo("", info), -1);
   EXPECT_EQ(log.Text(), "");
-  for (const char* bad : {"missing", "nopath", "../etc"}) {
+  for (const char* bad : {"missing", "nopath", "../etc"})
     EXPECT_EQ(S2S::GetShareInfo(bad, info), -1) << bad;
-  }
   ASSERT_EQ(log.Messages().size(), 3u);
   EXPECT_TRUE(Has(log.Messages()[0], "S2S/s2s("));
   EXPECT_TRUE(Has(log.Messages()[0], "Fail to get share 'missing'\n"));
@@ -140,9 +139,8 @@ TEST_F(ShareTest, KeyFilesAndShareNames) {
   EXPECT_EQ(KAROShareEncKeyFileGet(share, buf, sizeof buf), -1);
   EXPECT_EQ(KLIBCErrGet(), KERR_NOT_FOUND);
   KAROShareFree(share);
-  for (const char* bad : {"", ".", "..", "a/b", "a]b", "@x@", " x", "a\nb"}) {
+  for (const char* bad : {"", ".", "..", "a/b", "a]b", "@x@", " x", "a\nb"})
     EXPECT_EQ(KaroShareNameValid(bad), 0) << bad;
-  }
   EXPECT_EQ(KaroShareNameValid("My Share.2"), 1);
   KSZLIST* names = KLIBCSzListAlloc();
   ASSERT_EQ(KAROShareEnum(names), 5);

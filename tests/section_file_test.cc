@@ -30,9 +30,8 @@ class SectionFileTest : public ::testing::Test {
  protected:
   std::string Value(const char* section, const char* key, size_t size = 256) {
     char buf[256];
-    if (KLIBCFileGetSectionValue(file_.c_str(), section, key, buf, size) < 0) {
+    if (KLIBCFileGetSectionValue(file_.c_str(), section, key, buf, size) < 0)
       return Error(KLIBCErrGet());
-    }
     return buf;
   }
   int Add(const char* section, const Hash& h, const char* format = nullptr) {
@@ -50,9 +49,8 @@ class SectionFileTest : public ::testing::Test {
     KSZLIST* names = KLIBCSzListAlloc();
     int n = KLIBCFileEnumSection(file_.c_str(), names);
     std::string out = n < 0 ? Error(KLIBCErrGet()) : "";
-    for (int i = 0; i < n; ++i) {
+    for (int i = 0; i < n; ++i)
       out += (i ? ":" : "") + std::string(KLIBCSzListGet(names, i));
-    }
     KLIBCSzListFree(names);
     return out;
   }
@@ -176,9 +174,8 @@ TEST_F(SectionFileTest, RefusesWhatTheFormatCannotHold) {
   auto good = MakeHash({{"k", "v"}});
   ASSERT_EQ(Add("A", good), 1);
   const std::string before = ReadFile(file_);
-  for (const char* section : {"", "a]b", "[x", "line\nbreak", " lead", "#c"}) {
+  for (const char* section : {"", "a]b", "[x", "line\nbreak", " lead", "#c"})
     EXPECT_EQ(ErrorOf(Add(section, good)), KERR_VALUE_UNHOLDABLE) << section;
-  }
   for (const char* key : {"a=b", "q\"", "[k", "trail ", "cr\r", ""}) {
     EXPECT_EQ(ErrorOf(Modify("A", MakeHash({{key, "v"}}))),
               KERR_VALUE_UNHOLDABLE)

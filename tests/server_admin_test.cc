@@ -45,9 +45,8 @@ void RunCases(const s2s_test::TempDir& tmp, const std::string& root,
 // started, as that user, serves the modules.
 TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
   const passwd* nobody = getpwnam("nobody");
-  if (geteuid() != 0 || nobody == nullptr) {
+  if (geteuid() != 0 || nobody == nullptr)
     GTEST_SKIP() << "needs root and the user nobody";
-  }
   s2s_test::TempDir tmp;
   ASSERT_EQ(0, chmod(tmp.path().c_str(), 0755));
   const std::string root = tmp.Sub("server"), pw = tmp.Sub("password");

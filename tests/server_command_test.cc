@@ -100,9 +100,8 @@ TEST(DataHook, OnlyArgumentsThatMakeTheDaemonRunDryCountAsADryRun) {
       {{"rsyncd", "-n", "--server", "-logDtpr", ".", "d/"}, false},
       {{"rsyncd", "--server"}, false},
   };
-  for (const auto& c : cases) {
+  for (const auto& c : cases)
     EXPECT_EQ(c.dry, IsDryRunReceiver(c.args)) << c.args[2 % c.args.size()];
-  }
 }
 
 // A command file: `command` from `client`, then the lines of `params`.
@@ -125,9 +124,8 @@ class HookTest : public ::testing::Test {
   }
   void DeclareShares(const std::vector<std::string>& names) {
     std::string conf;
-    for (const std::string& n : names) {
+    for (const std::string& n : names)
       conf += "[" + n + "]\n\tpath=\"" + tmp_.Sub(n) + "\"\n";
-    }
     tmp_.Write("/etc/s2s/shares.conf", conf);
   }
   // Runs `text` as request `id` through the early hook; the reply's status.
@@ -152,9 +150,8 @@ class HookTest : public ::testing::Test {
 TEST_F(HookTest, BadRequestsGetAClearStatusAndWriteNothing) {
   // An id or a daemon user that could leave the reply directory: no reply.
   std::string cmd = Cmd("S2S_GetProtocolVer");
-  for (const char* id : {"../x", "a/b", "", "a b"}) {
+  for (const char* id : {"../x", "a/b", "", "a b"})
     EXPECT_EQ(1, Early(cmd + "requestID=\"" + id + "\"\n")) << id;
-  }
   // The id on another line than the last, or missing.
   EXPECT_EQ(1, Early("requestID=\"r\"\n" + cmd));
   EXPECT_EQ(1, Early(cmd));
@@ -184,9 +181,8 @@ TEST_F(HookTest, BadRequestsGetAClearStatusAndWriteNothing) {
       {Cmd("S2S_UpdateTaskStatus", "taskName=\"t \"\n"), kBadId},
   };
   int n = 0;
-  for (const Case& c : cases) {
+  for (const Case& c : cases)
     EXPECT_EQ(c.status, Status(c.text, "req" + std::to_string(n++))) << c.text;
-  }
   EXPECT_EQ("", Registry());
 }
 

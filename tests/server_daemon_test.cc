@@ -181,9 +181,8 @@ TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
       {"push into the share", {"-r", "--delete", src, "share1/"}},
       {"dry run into the share", {"-n", "-r", "--delete", src, "share1/"}},
   };
-  for (const Row& row : rows) {
+  for (const Row& row : rows)
     EXPECT_NE(0, Rsync(row.args, kOtherUser, kOtherPassword)) << row.what;
-  }
   EXPECT_EQ("victim key", ReadFile(tmp_.Sub("usr/karo/etc/.encrypt/share1")));
   EXPECT_EQ("victim key", ReadFile(upload + "/pending"));
   EXPECT_FALSE(std::filesystem::exists(upload + "/t1"));

@@ -407,9 +407,8 @@ TEST_F(ServiceControlTest, BadRequestsChangeNothingAndCtlRunsATaskEndToEnd) {
       {"update to unknown share", update_bad, 4},
   };
   for (const auto& c : kCases) EXPECT_EQ(c.result, Ask(c.request)) << c.what;
-  for (const char* action : {"get", "delete", "run", "enable", "history"}) {
+  for (const char* action : {"get", "delete", "run", "enable", "history"})
     EXPECT_EQ(3u, Ask(Action(action, 999ULL))) << action;
-  }
 
   // Bytes that are no request: dropped, or an error, never a change.
   const std::string list_map = "\x42" + Str("action") + Str("list") + "\x40";
@@ -475,9 +474,8 @@ TEST_F(ServiceControlTest, BadRequestsChangeNothingAndCtlRunsATaskEndToEnd) {
   const std::string pass = tmp_.Sub("pass");
   ASSERT_TRUE(s2s_test::WriteFile(pass, password + "\n", 0600));
   const std::string docs = app_.ClientShare("docs");
-  for (const char* f : {"/a.txt", "/b.txt", "/c.txt"}) {
+  for (const char* f : {"/a.txt", "/b.txt", "/c.txt"})
     ASSERT_TRUE(s2s_test::WriteFile(docs + f, "a\n"));
-  }
   // s2sctl as a script uses it: its exit code, its output.
   s2s_test::Child last;
   auto ctl = [&](std::vector<std::string> args) {

@@ -82,9 +82,8 @@ TEST(Batcher, CoalescesIntoTheSmallestSetOfSubPaths) {
     BatcherSettings s;
     if (c.pending_limit != 0) s.pending_limit = c.pending_limit;
     Batcher b(s);
-    for (const Add& a : c.adds) {
+    for (const Add& a : c.adds)
       b.Add(MakeEvent(std::get<0>(a), std::get<1>(a), std::get<2>(a)), 100);
-    }
     EXPECT_EQ(c.want, Str(b.Take())) << c.what;
     EXPECT_TRUE(b.Empty()) << c.what;
   }
@@ -223,9 +222,8 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   unlink((client_ + "/a.txt").c_str());
   fs::rename(client_ + "/old", client_ + "/new");
   fs::create_directories(client_ + "/quick/deep/er");
-  for (int i = 0; i < 50; ++i) {
+  for (int i = 0; i < 50; ++i)
     WriteFile(client_ + "/quick/deep/er/f" + std::to_string(i), "q");
-  }
   const std::string odd[] = {"/line\nbreak", "/\xff\xfe.bin", "/caf\xe9"};
   fs::create_directories(client_ + odd[2]);
   WriteFile(client_ + odd[0], "newline\n");
@@ -304,9 +302,8 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
 }
 
 TEST_P(RealtimeTest, OverflowWatchLimitAndAnUnreachableServerEndEqual) {
-  for (int d = 0; d < 10; ++d) {
+  for (int d = 0; d < 10; ++d)
     fs::create_directories(client_ + "/tree/d" + std::to_string(d) + "/e");
-  }
   // At most 16 events per wake-up and 4 inotify watches; the full syncs
   // that cover what is not watched come every 2 s.
   StartDaemon({"--watch-queue-limit", "16", "--watch-limit", "4",

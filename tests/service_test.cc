@@ -137,9 +137,8 @@ TEST(ActiveRun, SharesInProgressFollowTheRunnersLines) {
   for (const auto& line : lines) {
     run.Note(line.first);
     std::string shown;
-    for (const ActiveRun::ShareProgress& s : run.Shares()) {
+    for (const ActiveRun::ShareProgress& s : run.Shares())
       shown += (shown.empty() ? "" : " ") + s.name + ":" + s.step;
-    }
     EXPECT_EQ(line.second, shown) << line.first;
   }
 }
@@ -250,9 +249,8 @@ class ServiceTest : public s2s_test::S2sdTest {
       if (what == "end") running.erase(pid);
       for (const char* share : {"docs", "photos", "more"}) {
         if (what == "start" && s2s_test::Has(line, app_.ClientShare(share))) {
-          for (const auto& r : running) {
+          for (const auto& r : running)
             EXPECT_NE(share, r.second) << "two syncs of " << share;
-          }
           running[pid] = share;
         }
       }

@@ -495,9 +495,8 @@ TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
       },
       20);
   ASSERT_EQ(2u, rsyncs.size()) << "no transfer with a beacon beside it";
-  for (const auto& r : rsyncs) {
+  for (const auto& r : rsyncs)
     EXPECT_EQ(r.first, r.second) << "rsync is not in a session of its own";
-  }
 
   Child again = Sync(client, "docs");
   EXPECT_EQ(kExitBusy, again.code) << again.out << again.err;
@@ -528,9 +527,8 @@ TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
   EXPECT_EQ(16u << 20,
             std::filesystem::file_size(server_ + "/volume1/big/blob"));
   EXPECT_TRUE(Has(Server({"status"}).out, "task  filetask         idle"));
-  for (const auto& e : std::filesystem::directory_iterator(tmp)) {
+  for (const auto& e : std::filesystem::directory_iterator(tmp))
     ADD_FAILURE() << "left behind: " << e.path();
-  }
 }
 
 }  // namespace
