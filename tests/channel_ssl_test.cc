@@ -24,44 +24,38 @@ std::vector<std::string> Shell(const std::string& command) {
   return {"sh", "-c", "exec " + command};
 }
 
-// A CA; leaves signed by it carrying the name in the subject only ("cn",
-// whose file holds the chain), in the alternative names only ("san", after
-// an address entry) and as a wildcard ("wild"); a self-signed leaf ("self").
+// A CA; leaves it signed with the name in the subject ("cn", its file holding
+// the chain), in the alternative names ("san") or as a wildcard ("wild"); a
+// self-signed leaf ("self").
 bool MakeCertificates(const s2s_test::TempDir& dir) {
-  const std::string conf = dir.Sub("x509.cnf");
-  if (!s2s_test::WriteFile(
-          conf,
-          "[req]\ndistinguished_name = dn\nprompt = no\n[dn]\n"
-          "[ca]\nbasicConstraints = critical,CA:true\n"
-          "keyUsage = critical,keyCertSign\n"
-          "[leaf]\nbasicConstraints = CA:false\n"
-          "[san]\nbasicConstraints = CA:false\nsubjectAltName = "
-          "IP:127.0.0.1,DNS:first.example.test,DNS:second.example.test\n")) {
-    return false;
-  }
-  const char* const certs[][3] = {{"ca", "/CN=S2S-Test-CA", "ca"},
-                                  {"cn", "/CN=server.example.test", "leaf"},
-                                  {"san", "/O=S2S/CN=Storage-Appliance", "san"},
-                                  {"wild", "/CN=*.example.test", "leaf"},
-                                  {"self", "/CN=server.example.test", "leaf"}};
+  const std::string by_ca = " -CA ca.pem -CAkey ca.key";
+  const std::string certs[][4] = {
+      {"ca", "/CN=S2S-Test-CA", "ca", ""},
+      {"cn", "/CN=server.example.test", "leaf", by_ca},
+      {"san", "/O=S2S/CN=Storage-Appliance", "san", by_ca},
+      {"wild", "/CN=*.example.test", "leaf", by_ca},
+      {"self", "/CN=server.example.test", "leaf", ""}};
+  bool ok = s2s_test::WriteFile(
+      dir.Sub("x509.cnf"),
+      "[req]\ndistinguished_name = dn\nprompt = no\n[dn]\n"
+      "[ca]\nbasicConstraints = critical,CA:true\n"
+      "keyUsage = critical,keyCertSign\n"
+      "[leaf]\nbasicConstraints = CA:false\n"
+      "[san]\nbasicConstraints = CA:false\nsubjectAltName = "
+      "IP:127.0.0.1,DNS:first.example.test,DNS:second.example.test\n");
   for (const auto& c : certs) {
-    std::string base = dir.Sub(c[0]);
-    std::string signer =
-        c[0] == std::string("ca") || c[0] == std::string("self")
-            ? ""
-            : " -CA " + dir.Sub("ca.pem") + " -CAkey " + dir.Sub("ca.key");
-    if (!s2s_test::RunQuiet(
-            Shell("openssl req -x509 -config " + conf +
-                  " -newkey ec -pkeyopt ec_paramgen_curve:P-256 -nodes -days 2"
-                  " -subj " +
-                  c[1] + " -keyout " + base + ".key -out " + base +
-                  ".pem -extensions " + c[2] + signer))) {
-      return false;
-    }
+    ok = ok && s2s_test::RunQuiet(
+                   {"sh", "-c",
+                    "cd " + dir.path() +
+                        " && openssl req -x509 -config x509.cnf -newkey ec"
+                        " -pkeyopt ec_paramgen_curve:P-256 -nodes -days 2"
+                        " -subj " +
+                        c[1] + " -keyout " + c[0] + ".key -out " + c[0] +
+                        ".pem -extensions " + c[2] + c[3]});
   }
-  return s2s_test::WriteFile(dir.Sub("cn.pem"),
-                             s2s_test::ReadFile(dir.Sub("cn.pem")) +
-                                 s2s_test::ReadFile(dir.Sub("ca.pem")));
+  return ok && s2s_test::RunQuiet(
+                   {"sh", "-c",
+                    "cat " + dir.Sub("ca.pem") + " >> " + dir.Sub("cn.pem")});
 }
 
 class ChannelSSLTest : public ::testing::Test {
@@ -89,8 +83,8 @@ class ChannelSSLTest : public ::testing::Test {
     client.SetSSLHostname(host);
   }
 
-  // Our client end and server end over a loopback TCP connection; with
-  // `raw`, only `client` is ours and the test has the other end, `peer`.
+  // Our client and server ends over loopback TCP; with `raw`, the test has
+  // the server's, `peer`.
   struct Pair : s2s_test::ChannelPair {
     explicit Pair(unsigned int capacity = 4096, int timeout = 5,
                   bool raw = false)
@@ -190,8 +184,8 @@ TEST_F(ChannelSSLTest, ConversionNeedsASocketAndTheServerItsCertAndKey) {
   EXPECT_FALSE(p.server.IsClosed());
 }
 
-// Random chunking and time-outs work unchanged over TLS, with a small ring so
-// that every run wraps; closed, the channel is plain again.
+// Random chunking (a small ring: every run wraps) and time-outs work over
+// TLS; closed, the channel is plain again.
 TEST_F(ChannelSSLTest, StreamsTravelUnchangedUntilClose) {
   Pair p(4093);
   ASSERT_TRUE(p.ok);
@@ -283,13 +277,12 @@ TEST_F(ChannelSSLTest, HandshakeGivesUpOnSilentOrFailingPeers) {
   }
 }
 
-// Our client end against a real TLS 1.2 server, whose suites the client's
-// failed request for its single old suite once removed; TLS 1.1 it refuses.
+// Our client against a real TLS 1.2 server (its failed request for an old
+// suite once removed every suite); TLS 1.1 it refuses.
 TEST_F(ChannelSSLTest, ClientTalksToOpenSSLServer) {
   for (const char* opts : {"-tls1_2", "-tls1_1 -cipher DEFAULT@SECLEVEL=0"}) {
     SCOPED_TRACE(opts);
-    // Port 0: the server takes a free one and names it, in one write; each
-    // line it reads it sends back reversed.
+    // Port 0: the server names the free one it took; it echoes lines reversed.
     s2s_test::Child server = s2s_test::Spawn(
         dir_->path(),
         Shell("openssl s_server -accept 127.0.0.1:0 -naccept 1 -rev -cert " +

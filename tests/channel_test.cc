@@ -46,8 +46,8 @@ using Pair = s2s_test::ChannelPair;
 
 class ChannelStreamTest : public ::testing::TestWithParam<bool> {};
 
-// Megabytes of random bytes in random write and read sizes (capacity-sized
-// and ring-wrapping ones included) arrive unchanged; neither end allocates.
+// Random bytes in random write and read sizes (capacity-sized and wrapping
+// ones included) arrive unchanged; neither end allocates.
 TEST_P(ChannelStreamTest, ArbitraryChunkingKeepsEveryByte) {
   const unsigned int cap = 4093;  // odd, so runs wrap at every position
   Pair pair(cap, GetParam());

@@ -18,8 +18,7 @@ using s2s_test::TempDir;
 
 bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
 
-// Serves `clients` connections one after another: each request map comes
-// back with "echo" set to its "n" plus one.
+// Serves `clients` connections in turn: each request comes back, "echo" n+1.
 void Serve(IPCListener& listener, int clients) {
   for (int i = 0; i < clients; ++i) {
     IPCSender end;

@@ -23,8 +23,7 @@ std::string Bytes(std::initializer_list<int> b) {
   return s;
 }
 
-// A channel, `a`, on one end of a socket pair; the test speaks raw bytes on
-// the other end, `peer`.
+// A channel, `a`, whose peer the test feeds raw bytes.
 struct Wire : s2s_test::ChannelPair {
   Wire() : ChannelPair(256) { a.SetTimeout(1); }
   // Feeds `bytes` and ends the stream, then decodes one message into `obj`.
@@ -40,7 +39,6 @@ struct Wire : s2s_test::ChannelPair {
   PStream stream;
 };
 
-// Each value encodes to exactly its bytes, and those bytes decode to it again.
 TEST(PStreamTest, ValuesTravelAsTheirExactBytes) {
   PObject empty_map, empty_array, array_of_null, map, underscored;
   empty_map.asMap();
@@ -157,8 +155,7 @@ TEST(PStreamTest, MalformedOrTooDeepInputIsAProtocolError) {
     EXPECT_EQ(r, c.logged.empty() ? 0 : S2S::kProtocolError) << c.logged;
     EXPECT_TRUE(Has(log.Text(), c.logged)) << log.Text();
   }
-  // Cut short inside a string: the end of the stream, not a hang, and not
-  // a shorter string.
+  // Cut short inside a string: the end of the stream, not a hang or less.
   PObject cut;
   EXPECT_EQ(Wire().Decode(Bytes({0x10, 0, 5, 'a', 'b'}), cut), S2S::kIOError);
 }
