@@ -18,13 +18,11 @@
 
 static int failures = 0;
 
-#define CHECK(cond)                                                     \
-  do {                                                                  \
-    if (!(cond)) {                                                      \
-      fprintf(stderr, "%s:%d: CHECK(%s)\n", __FILE__, __LINE__, #cond); \
-      ++failures;                                                       \
-    }                                                                   \
-  } while (0)
+#define CHECK(cond)                                                          \
+  ((cond) ? (void)0                                                          \
+          : (void)(fprintf(stderr, "%s:%d: CHECK(%s)\n", __FILE__, __LINE__, \
+                           #cond),                                           \
+                   ++failures))
 
 static char root[256];
 
@@ -67,7 +65,7 @@ int main(void) {
   FILE* p = KLIBCPopen("echo", "r", "hello", (const char*)NULL);
   CHECK(p != NULL && fgets(buf, sizeof buf, p) != NULL &&
         strcmp(buf, "hello\n") == 0);
-  if (p != NULL) CHECK(KLIBCPclose(p) == 0);
+  CHECK(p != NULL && KLIBCPclose(p) == 0);
 
   CHECK(KLIBServiceIsRunning("s2s_daemon") == 0);
 

@@ -204,7 +204,7 @@ TEST_F(RegistryTest, StatusIsBusyForTwoMinutesAndRunsWithSwitchAndDaemon) {
 }
 
 // Writers in several processes, released at once into an empty root, race to
-// create the lock and the file; each locks around its read and write.
+// create the lock and the file.
 TEST_F(RegistryTest, WritersInManyProcessesLoseNothing) {
   const int kWriters = 6, kRounds = 40;
   int go[2];

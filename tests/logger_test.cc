@@ -23,8 +23,7 @@ using s2s_test::ReadFile;
 using s2s_test::SyslogCapture;
 using s2s_test::TempDir;
 
-// Descriptor `fd` (1 or 2) redirected into an anonymous file while the object
-// lives.
+// Descriptor `fd` (1 or 2) redirected into an anonymous file while it lives.
 class CaptureFd {
  public:
   explicit CaptureFd(int fd) : fd_(fd) {
@@ -37,7 +36,6 @@ class CaptureFd {
     close(saved_);
     close(file_);
   }
-  // What was written so far.
   std::string Text() const {
     fflush(nullptr);
     return ReadFile("/proc/self/fd/" + std::to_string(file_));
@@ -134,8 +132,8 @@ TEST_F(LoggerTest, FailedInitializeKeepsTheStreamAndDestroyLeavesStdout) {
   EXPECT_TRUE(Has(ReadFile(path), "into the file"));
 }
 
-// Writes messages of `len` bytes of text (plus the 16-byte timestamp) until
-// `rotations` rotations happened; returns the number written.
+// Writes messages of `len` bytes (and a 16-byte timestamp) until `rotations`
+// rotations happened; how many it wrote.
 int WriteUntilRotated(int len, int rotations) {
   std::string text(len - 1, 'x');
   int written = 0;

@@ -1,7 +1,6 @@
 // The client's side of a server command without a server: the wrapper
-// settings of each kind of run, the exact lines of every request (the
-// pairing tests see the dry-run forms on the wire), the checks made before
-// anything is written, and the splitting of answers.
+// settings of each kind of run, the exact lines of every request, the checks
+// made before anything is written, and the splitting of answers.
 #include <list>
 #include <string>
 #include <vector>
@@ -37,9 +36,8 @@ class RsyncerCmdTest : public ::testing::Test {
     // A mount table that holds none of the shares without a volume key.
     ASSERT_TRUE(root_.Write("/etc/mtab", "/dev/sdz1 /elsewhere ext4 rw 0 0\n"));
   }
-  // What a generator appended to out_, joined by '|', or "refused" when it
-  // failed; out_ then holds its first line again. Lines are appended to what
-  // the list holds and a refusal writes nothing.
+  // What a generator appended to out_ (after its first line, which it keeps
+  // again), joined by '|'; "refused" when it failed and wrote nothing.
   std::string Joined(int r) {
     EXPECT_EQ(out_.front(), "kept");
     std::string joined = r == 0 ? "" : "refused";

@@ -121,8 +121,8 @@ TEST_F(SectionFileTest, ReadsWhatAPersonTypes) {
   EXPECT_EQ(Value("A", "k3"), "");
   EXPECT_EQ(Names(), "A:B");
 
-  // A section given again after another: a repeated key keeps its first
-  // place and takes the last value, below and above the indexing size.
+  // A section given again: a repeated key keeps its first place and takes the
+  // last value, below and above the indexing size.
   std::string many = "[M]\nk0=\"a\"\n";
   for (int i = 1; i < 30; ++i) many += "k" + std::to_string(i) + "=\"x\"\n";
   many += "[N]\nk0=\"n\"\n[M]\nk0=\"b\"\nk29=\"c\"\nk30=\"d\"\n";
@@ -143,8 +143,8 @@ TEST_F(SectionFileTest, ReadsWhatAPersonTypes) {
   }
 }
 
-// A file in the writers' own form keeps all but the changed section as it
-// was; one that reads otherwise than it looks is rewritten whole.
+// A file in the writers' own form keeps all but the changed section; one that
+// reads otherwise than it looks is rewritten whole.
 TEST_F(SectionFileTest, RewriteKeepsTheWritersFormAndNormalisesTheRest) {
   const struct {
     const char* in;

@@ -18,8 +18,7 @@ using s2s_test::Child;
 using s2s_test::Has;
 using s2s_test::ReadFile;
 
-// A row: the words after "s2s-server --root ROOT", the exit code, and what
-// its output says.
+// A row: the words after "s2s-server --root ROOT", its exit code and output.
 struct Case {
   std::vector<std::string> words;
   int code;
@@ -28,21 +27,18 @@ struct Case {
 
 void RunCases(const s2s_test::TempDir& tmp, const std::string& root,
               const std::vector<Case>& cases) {
-  for (const Case& c : cases) {
-    std::vector<std::string> argv = {S2S_SERVER_PROGRAM, "--root", root};
-    argv.insert(argv.end(), c.words.begin(), c.words.end());
-    Child r = s2s_test::RunProgram(tmp.path(), argv, {"S2S_ROOT"});
-    std::string words;
-    for (const std::string& w : c.words) words += w + " ";
-    EXPECT_EQ(c.code, r.code) << words << "\n" << r.out << r.err;
-    EXPECT_TRUE(Has(r.out + r.err, c.says)) << words << "\n" << r.out << r.err;
+  for (Case c : cases) {
+    c.words.insert(c.words.begin(), {S2S_SERVER_PROGRAM, "--root", root});
+    Child r = s2s_test::RunProgram(tmp.path(), c.words, {"S2S_ROOT"});
+    SCOPED_TRACE(testing::PrintToString(c.words) + "\n" + r.out + r.err);
+    EXPECT_EQ(c.code, r.code);
+    EXPECT_TRUE(Has(r.out + r.err, c.says));
   }
 }
 
-// SSH mode for the daemon user "nobody": the user's key may only start the
-// daemon on a configuration the user can run, whose secrets only the user
-// reads; a share added later is handed to the user too. The daemon so
-// started, as that user, serves the modules.
+// SSH mode for the daemon user "nobody": its key may only start the daemon
+// on a configuration it can run, whose secrets only it reads; a share added
+// later is handed to it too. So started, as that user, the daemon serves.
 TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
   const passwd* nobody = getpwnam("nobody");
   if (geteuid() != 0 || nobody == nullptr)

@@ -141,8 +141,7 @@ TEST(Schedule, GetDaysToNextSyncCountsFromToday) {
   EXPECT_EQ(S2S::GetDaysToNextSync(2, "0200000"), -1);
 }
 
-// Local "YYYY-MM-DD HH:MM" in the current zone, with " D" or " S" after it
-// to pick the daylight or standard reading of a doubled hour.
+// Local "YYYY-MM-DD HH:MM", " D" or " S" after it picking a doubled hour.
 long Local(const std::string& text) {
   struct tm t = {};
   EXPECT_NE(strptime(text.c_str(), "%Y-%m-%d %H:%M", &t), nullptr) << text;

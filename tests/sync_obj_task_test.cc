@@ -91,8 +91,8 @@ TEST(ShareAndEvent, RelativePathIsMadeAbsoluteAndBothDump) {
             "relative_path: . /a/b\nstatus: ........ -1\n");
 }
 
-// Server settings first, then the schedule, the name, the share list and
-// each share in turn; the first broken rule is the one logged.
+// Server settings, schedule, name, share list, each share: the first broken
+// rule is the one logged.
 TEST(TaskInfo, ValidateChecksInOrderAndEveryShareMustBeSyncable) {
   s2s_test::TempRoot root;
   ASSERT_TRUE(
@@ -156,8 +156,7 @@ TEST(SyncTaskDump, ScheduleWithItsLastRunAndTaskWithoutPassword) {
   EXPECT_FALSE(Has(dump, "s3cret"));
 }
 
-// The map is what crosses the IPC link (which keeps any value whole); the
-// task rebuilt from it equals the original but for the period's seconds.
+// The task rebuilt from its IPC map equals it but for the period's seconds.
 TEST(SyncTaskMapping, TaskBecomesAMapAndIsRebuiltEqual) {
   SyncTask task = FullTask();
   PObject map;
