@@ -53,10 +53,9 @@ TEST_F(RegistryTest, IsSyncedShareFollowsRunningIdAndTheSwitch) {
 
   Write("[SHARE_docs]\n\tRunningID=\"" + std::string(300, 'x') + "\"\n");
   EXPECT_EQ(KAROS2SIsSyncedShare("docs"), 0);
-  EXPECT_TRUE(Has(syslog_.Text(), "is_syncedshare:"));
-  EXPECT_TRUE(Has(syslog_.Text(),
-                  "KLIBCFileGetSectionValue error. key:[SHARE_docs] "
-                  "errno=[0x2400]"));
+  s2s_test::ExpectHas(syslog_.Text(), {"is_syncedshare:",
+                                       "KLIBCFileGetSectionValue error. "
+                                       "key:[SHARE_docs] errno=[0x2400]"});
 }
 
 TEST_F(RegistryTest, RecordsAreReplacedWholeAndNamesFromTheNetworkChecked) {

@@ -96,11 +96,10 @@ TEST_F(RsyncerCmdTest, EveryRequestsLinesAndTheRefusalsThatWriteNothing) {
   EXPECT_EQ(Joined(r_.GenStartSyncShareCmd("nomount", false, out_)), "refused");
   EXPECT_EQ(Joined(r_.GenPairMultiSrcCmd(true, false, {}, "/o", out_)),
             "refused");
-  for (const char* msg :
-       {"[ERROR] S2S/rsyncer(", "GenFinishSyncCmd: Empty parameter\n",
-        "Fail to get share info of 'nope'\n", "Fail to get volume info\n"}) {
-    EXPECT_TRUE(Has(log.Text(), msg)) << msg;
-  }
+  s2s_test::ExpectHas(
+      log.Text(),
+      {"[ERROR] S2S/rsyncer(", "GenFinishSyncCmd: Empty parameter\n",
+       "Fail to get share info of 'nope'\n", "Fail to get volume info\n"});
 }
 
 TEST(RsyncerSplitTest, SplitsAtEachSeparatorKeepingEmptyPieces) {

@@ -54,11 +54,10 @@ TEST_F(RsyncerProbeTest, FirstCandidateThatAnswersWinsAndFailuresSayWhy) {
   ASSERT_EQ(0, r.Initialize(info));
   EXPECT_EQ("127.0.0.1", r.GetSyncInfo().GetServerIP());
   EXPECT_EQ(1, r.GetServerVersionValue());
-  for (const char* line :
-       {"[INFO] S2S/rsyncer(", "Test 127.0.0.2 is reachable\n",
-        "Fail to test connection [10]\n", "Get server version [1]\n"}) {
-    EXPECT_TRUE(Has(log.Text(), line)) << line;
-  }
+  s2s_test::ExpectHas(
+      log.Text(),
+      {"[INFO] S2S/rsyncer(", "Test 127.0.0.2 is reachable\n",
+       "Fail to test connection [10]\n", "Get server version [1]\n"});
   EXPECT_FALSE(Has(log.Text(), "127.0.0.3"));
   // A dry-run pairing is only a question: nothing is recorded.
   EXPECT_FALSE(
@@ -309,12 +308,11 @@ TEST_F(RsyncerPairTest, ScriptedAnswersAndRefusalsBeforeAnyRun) {
   EXPECT_EQ(-1, r.TestProtocol(status));
   EXPECT_EQ(-7, status);
   EXPECT_EQ(before, server_.Count());
-  for (const char* line : {"): Fail to get client id\n",
-                           "MultiPairing: Fail to write command file\n",
-                           "SinglePairing: Fail to write command file\n",
-                           "Fail to test connection\n"}) {
-    EXPECT_TRUE(Has(log.Text(), line)) << line;
-  }
+  s2s_test::ExpectHas(log.Text(),
+                      {"): Fail to get client id\n",
+                       "MultiPairing: Fail to write command file\n",
+                       "SinglePairing: Fail to write command file\n",
+                       "Fail to test connection\n"});
   // No temporary directory: no place for the answer.
   std::filesystem::remove_all(app_.client_root() + "/tmp/S2S");
   EXPECT_EQ(-1, r.DoMultiPairing(true, false, {"docs"}, conflicts, status));

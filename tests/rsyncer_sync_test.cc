@@ -137,12 +137,11 @@ TEST_F(RsyncerSyncTest,
   EXPECT_EQ(-1, r_.FinishSync("share", "", status));
   EXPECT_EQ(-1, r_.StartSyncShare("nope", status));
   EXPECT_EQ(-5, status);
-  for (const char* line : {"SendBeacon: Fail to write command file\n",
-                           "FinishSync: Fail to write command file\n",
-                           "StartSyncShare: Fail to write command file\n",
-                           "Fail to start sync share 'nope' with ACL\n"}) {
-    EXPECT_TRUE(Has(log.Text(), line)) << line;
-  }
+  s2s_test::ExpectHas(log.Text(),
+                      {"SendBeacon: Fail to write command file\n",
+                       "FinishSync: Fail to write command file\n",
+                       "StartSyncShare: Fail to write command file\n",
+                       "Fail to start sync share 'nope' with ACL\n"});
 }
 
 TEST_F(RsyncerSyncTest, ShareDescriptionIsLookedUpOnce) {

@@ -2,7 +2,6 @@
 #include <signal.h>
 #include <sys/ipc.h>
 #include <sys/sem.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
@@ -69,9 +68,7 @@ TEST_F(SectionFileTest, WritesTheDocumentedFormatAndReadsItBack) {
   EXPECT_EQ(ReadFile(file_),
             "[SHARE_a]\n\tRunningID=\"c1\"\n\tquote=\"say \"hi\" \"\"\n"
             "[TASK_1]\n\tstatus=\"idle\"\n");
-  struct stat st;
-  ASSERT_EQ(stat(file_.c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0644u);
+  EXPECT_EQ(s2s_test::Mode(file_), 0644);
   EXPECT_EQ(Value("SHARE_a", "quote"), "say \"hi\" \"");
   Hash got = MakeHash();
   EXPECT_EQ(KLIBCFileGetSection(file_.c_str(), "SHARE_a", got.get()), 1);

@@ -1,7 +1,6 @@
 // The server's command handler on untrusted input: command files, ids and
 // hook requests refused before they touch a path or the registry.
 #include <sched.h>
-#include <sys/stat.h>
 #include <sys/time.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -119,9 +118,7 @@ class HookTest : public ::testing::Test {
     env_.host_addr = "127.0.0.1";
     env_.user = "u";
   }
-  std::string Registry() {
-    return ReadFile(tmp_.path() + "/usr/karo/etc/karoS2S.info");
-  }
+  std::string Registry() { return ReadFile(registry_); }
   void DeclareShares(const std::vector<std::string>& names) {
     std::string conf;
     for (const std::string& n : names)
@@ -144,6 +141,7 @@ class HookTest : public ::testing::Test {
   }
 
   s2s_test::TempRoot tmp_;
+  const std::string registry_ = tmp_.Path("/usr/karo/etc/karoS2S.info");
   HookEnv env_;
 };
 
@@ -191,9 +189,7 @@ TEST_F(HookTest, AnUploadedCommandRunsAndTheCleanupRemovesUploadAndReply) {
   WriteFile(UploadDir() + "/r1", cmd);
   ASSERT_EQ(0, Early("requestID=\"r1\"\n"));
   EXPECT_EQ("status=0\n1\n", ReadFile(ReplyPath("u", "r1")));
-  struct stat st;
-  ASSERT_EQ(0, stat(ReplyPath("u", "r1").c_str(), &st));
-  EXPECT_EQ(0600u, st.st_mode & 0777);
+  EXPECT_EQ(0600, s2s_test::Mode(ReplyPath("u", "r1")));
   // An upload whose own id is another request's is not answered as this one.
   WriteFile(UploadDir() + "/r2", cmd);
   ASSERT_EQ(0, Early("requestID=\"r2\"\n"));
@@ -219,11 +215,10 @@ TEST_F(HookTest, ClientIdStaysWithItsDaemonUserAndALostRegistryStaysLost) {
   env_.user = "u1";
   EXPECT_EQ(kOk, Status(start, "s2"));
   // The registry vanishes: refused, and not recreated open.
-  ASSERT_EQ(0, unlink((tmp_.path() + "/usr/karo/etc/karoS2S.info").c_str()));
+  ASSERT_EQ(0, unlink(registry_.c_str()));
   env_.user = "u2";
   EXPECT_EQ(kRegistryFailure, Status(pair, "p3"));
-  EXPECT_FALSE(
-      std::filesystem::exists(tmp_.path() + "/usr/karo/etc/karoS2S.info"));
+  EXPECT_FALSE(std::filesystem::exists(registry_));
 }
 
 TEST_F(HookTest, ParallelSyncStartsForAFreeShareHaveOneWinner) {

@@ -1,7 +1,6 @@
 // The server end to end: a generated daemon configuration, the real rsync
 // daemon on loopback running the real handler, and the client's wrapper.
 #include <sys/socket.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -42,9 +41,7 @@ class ServerDaemonTest : public ::testing::Test {
     config.user = kUser;
     config.password = kPassword;
     ASSERT_EQ(0, WriteDaemonConfig(config));
-    struct stat st;
-    ASSERT_EQ(0, stat(DaemonSecretsPath().c_str(), &st));
-    EXPECT_EQ(0600u, st.st_mode & 0777);
+    EXPECT_EQ(0600, s2s_test::Mode(DaemonSecretsPath()));
     ASSERT_TRUE(daemon_.StartWithConfig(DaemonConfigPath())) << daemon_.Log();
     port_.reset(new s2s_test::ScopedEnv("S2S_RSYNC_PORT",
                                         std::to_string(daemon_.port())));
@@ -164,9 +161,7 @@ TEST_F(ServerDaemonTest, SyncRunGuardedAgainstHostileClients) {
   // The client holding the sync pushes its key and a pending upload.
   ASSERT_EQ(0, Rsync({tmp_.Sub("key"), "s2skeys/share1"}));
   ASSERT_EQ(0, Rsync({tmp_.Sub("key"), "s2sspool/pending"}));
-  struct stat st;
-  ASSERT_EQ(0, stat((upload + "/pending").c_str(), &st));
-  EXPECT_EQ(0600u, st.st_mode & 0777);
+  EXPECT_EQ(0600, s2s_test::Mode(upload + "/pending"));
 
   std::string src = tmp_.Sub("empty") + "/";
   struct Row {

@@ -246,21 +246,19 @@ TEST(CtlPrint, SchedulesSettingsProgressAndWhyNotWatchingInWords) {
   share["watching"] = false;
   share["message"] = "no such directory";
   const std::string text = FormatTask(task) + FormatStatus(status);
-  for (const char* line :
-       {"settle           1.5 s\n", "max delay        30 s\n",
-        "full sync every  1d 01:01:01\n", "change source    inotify\n",
-        "ssh              yes, port 2222\n",
-        "server           10.0.0.2 (backup1)\n",
-        "schedule error   no such day\n", "delete guard     off\n",
-        "1.0 MiB of 2.0 MiB, 512.0 KiB/s, 00:00:02 left\n",
-        "  task 7: not fanotify: not root\n",
-        "  task 7: the server is unreachable\n",
-        "  task 7: last batch failed: rsync?[31m failed\n",
-        "  task 7: share docs not watched: no such directory\n",
-        "alpha  transfer  3.0 MiB of 4.0 MiB",
-        "\n                              beta   transfer  -\n"}) {
-    EXPECT_TRUE(s2s_test::Has(text, line)) << line << "\n" << text;
-  }
+  s2s_test::ExpectHas(
+      text, {"settle           1.5 s\n", "max delay        30 s\n",
+             "full sync every  1d 01:01:01\n", "change source    inotify\n",
+             "ssh              yes, port 2222\n",
+             "server           10.0.0.2 (backup1)\n",
+             "schedule error   no such day\n", "delete guard     off\n",
+             "1.0 MiB of 2.0 MiB, 512.0 KiB/s, 00:00:02 left\n",
+             "  task 7: not fanotify: not root\n",
+             "  task 7: the server is unreachable\n",
+             "  task 7: last batch failed: rsync?[31m failed\n",
+             "  task 7: share docs not watched: no such directory\n",
+             "alpha  transfer  3.0 MiB of 4.0 MiB",
+             "\n                              beta   transfer  -\n"});
 }
 
 // Against a real s2sd whose server runs a real rsync daemon.
@@ -514,8 +512,8 @@ TEST_F(ServiceControlTest, BadRequestsChangeNothingAndCtlRunsATaskEndToEnd) {
         << last.out;
   };
   ASSERT_NO_FATAL_FAILURE(run({}));
-  EXPECT_TRUE(s2s_test::Has(last.out, "\"outcome\": \"ok\"")) << last.out;
-  EXPECT_TRUE(s2s_test::Has(last.out, "\"trigger\": \"manual\""));
+  s2s_test::ExpectHas(last.out,
+                      {"\"outcome\": \"ok\"", "\"trigger\": \"manual\""});
   ASSERT_EQ(0, ctl({"status"}));
   EXPECT_FALSE(s2s_test::Has(last.out, password));
 
@@ -524,12 +522,10 @@ TEST_F(ServiceControlTest, BadRequestsChangeNothingAndCtlRunsATaskEndToEnd) {
   std::filesystem::remove_all(docs);
   std::filesystem::create_directories(docs);
   ASSERT_EQ(0, ctl({"run", "docs-copy", "--dry-run"})) << last.out;
-  EXPECT_TRUE(s2s_test::Has(last.out, "docs: would send 0, delete 3"))
-      << last.out;
-  EXPECT_TRUE(s2s_test::Has(last.out, "    - b.txt\n")) << last.out;
+  s2s_test::ExpectHas(last.out,
+                      {"docs: would send 0, delete 3", "    - b.txt\n"});
   ASSERT_NO_FATAL_FAILURE(run({}));
-  EXPECT_TRUE(s2s_test::Has(last.out, "\"outcome\": \"held\"")) << last.out;
-  EXPECT_TRUE(s2s_test::Has(last.out, "3 of 4 entries")) << last.out;
+  s2s_test::ExpectHas(last.out, {"\"outcome\": \"held\"", "3 of 4 entries"});
   EXPECT_EQ("a\n", s2s_test::ReadFile(app_.ServerShare("docs") + "/a.txt"));
   ASSERT_NO_FATAL_FAILURE(run({"--confirm-deletions"}));
   EXPECT_TRUE(s2s_test::Has(last.out, "\"outcome\": \"ok\"")) << last.out;

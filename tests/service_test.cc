@@ -2,7 +2,6 @@
 // s2sd itself against a real server appliance, through its control socket.
 #include <poll.h>
 #include <sys/inotify.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -156,9 +155,7 @@ TEST(ServiceFiles, StoreRefusesBrokenFilesOneByOneAndHistoryIsBounded) {
   t.enabled = false;
   std::string error;
   ASSERT_TRUE(store.Save(t, error)) << error;
-  struct stat st;
-  ASSERT_EQ(0, stat(store.PathOf(7).c_str(), &st));
-  EXPECT_EQ(0600u, st.st_mode & 0777);
+  EXPECT_EQ(0600, s2s_test::Mode(store.PathOf(7)));
 
   const std::pair<const char*, std::string> broken[] = {
       {"/9.task", "s name=x\ns share_list.5=docs\n"},  // a hole in a list

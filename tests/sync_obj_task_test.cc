@@ -144,9 +144,9 @@ TEST(TaskInfo, ValidateChecksInOrderAndEveryShareMustBeSyncable) {
 TEST(SyncTaskDump, ScheduleWithItsLastRunAndTaskWithoutPassword) {
   // What the dump works out rather than copies.
   std::string text = Dump(FullTask().GetInfo().GetSchedule());
-  EXPECT_TRUE(Has(text, "schedule_begin: ...... 2024-02-29 08:05:00\n"));
-  EXPECT_TRUE(Has(text, "period: .............. 01:30\n"));
-  EXPECT_TRUE(Has(text, "last sync in day: .... 12:36\n"));
+  s2s_test::ExpectHas(text, {"schedule_begin: ...... 2024-02-29 08:05:00\n",
+                             "period: .............. 01:30\n",
+                             "last sync in day: .... 12:36\n"});
 
   std::string dump = Dump(FullTask());
   EXPECT_TRUE(Has(dump,

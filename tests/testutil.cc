@@ -323,6 +323,17 @@ bool WriteFile(const std::string& path, const std::string& data, int mode) {
   return out && (mode == -1 || chmod(path.c_str(), mode) == 0);
 }
 
+void ExpectHas(const std::string& text,
+               std::initializer_list<std::string> parts) {
+  for (const std::string& p : parts)
+    EXPECT_TRUE(Has(text, p)) << p << "\n" << text;
+}
+
+int Mode(const std::string& path) {
+  struct stat st;
+  return stat(path.c_str(), &st) == 0 ? st.st_mode & 07777 : -1;
+}
+
 int FreeLoopbackPort() {
   int port = 0, fd = LoopbackListener(&port);
   if (fd >= 0) close(fd);

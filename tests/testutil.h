@@ -83,6 +83,9 @@ struct ChannelPair : NoCopy {
 inline bool Has(const std::string& text, const std::string& what) {
   return text.find(what) != std::string::npos;
 }
+// Checks that every one of `parts` is in `text`.
+void ExpectHas(const std::string& text,
+               std::initializer_list<std::string> parts);
 // Seconds of the steady clock since `start`.
 inline double SecondsSince(std::chrono::steady_clock::time_point start) {
   return std::chrono::duration<double>(std::chrono::steady_clock::now() - start)
@@ -95,6 +98,8 @@ std::string ReadFile(const std::string& path);
 bool WriteFile(const std::string& path, const std::string& data, int mode = -1);
 // A new socket connected to 127.0.0.1:`port`, or -1.
 int ConnectLoopback(int port);
+// The permission bits of `path`, or -1 when it has none.
+int Mode(const std::string& path);
 // A TCP port on 127.0.0.1 that was free a moment ago.
 int FreeLoopbackPort();
 // A socket listening on 127.0.0.1 at *port (0: any free one, stored there),

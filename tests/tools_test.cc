@@ -29,6 +29,7 @@
 namespace {
 
 using s2s_test::Child;
+using s2s_test::ExpectHas;
 using s2s_test::Has;
 using s2s_test::ReadFile;
 using s2s_test::WriteFile;
@@ -191,12 +192,6 @@ class ToolsTest : public ::testing::Test {
     return buf;
   }
 
-  // Every one of `says` is in `out`.
-  static void ExpectSays(const std::string& out,
-                         std::initializer_list<const char*> says) {
-    for (const char* s : says) EXPECT_TRUE(Has(out, s)) << s << "\n" << out;
-  }
-
   s2s_test::TempDir tmp_;
   std::string server_, pw_file_, port_;
 };
@@ -282,15 +277,15 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
   EXPECT_TRUE(environ_clean) << "the password stayed in " << environ_path;
   ASSERT_EQ(kExitOk, c.Wait()) << c.out << c.err;
   EXPECT_GT(rsync_seen, 0) << "the scan saw none of the client's rsync runs";
-  ExpectSays(c.err, {"[INFO]", "karorsync"});
+  ExpectHas(c.err, {"[INFO]", "karorsync"});
   for (const std::string& text :
        {c.out, c.err, ReadFile(server_ + "/var/log/s2s/rsyncd.log"),
         ReadFile(server_ + "/etc/s2s/rsyncd.conf")}) {
     EXPECT_FALSE(Has(text, kPassword)) << text;
   }
   // rsync's progress and its --stats: both files, 6 + 20 bytes of data.
-  ExpectSays(c.out, {"share docs: finished", "1/1 shares synced",
-                     "files checked", "2 files and 26 B sent, 0 deleted"});
+  ExpectHas(c.out, {"share docs: finished", "1/1 shares synced",
+                    "files checked", "2 files and 26 B sent, 0 deleted"});
   EXPECT_EQ("", ShareKey("docs", "RunningID"));
 
   std::string other = MakeClient("other", "CLIENT-B");
@@ -328,8 +323,8 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
   const std::string before = ReadFile(registry);
   Child dry = Sync(client, "docs", {"--dry-run"});
   ASSERT_EQ(kExitOk, dry.code) << dry.out << dry.err;
-  ExpectSays(dry.out, {"share docs: would send 1, delete 1", "    + new.txt\n",
-                       "    - a.txt\n", "1/1 shares checked (dry run)"});
+  ExpectHas(dry.out, {"share docs: would send 1, delete 1", "    + new.txt\n",
+                      "    - a.txt\n", "1/1 shares checked (dry run)"});
   EXPECT_EQ(before, ReadFile(registry));
   EXPECT_EQ("alpha\n", ReadFile(server_ + "/volume1/docs/a.txt"));
   EXPECT_FALSE(std::filesystem::exists(server_ + "/volume1/docs/new.txt"));
@@ -423,7 +418,7 @@ TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
   kill(c.pid, SIGTERM);
   ASSERT_TRUE(past_half) << "the transfer was never seen half done";
   ASSERT_EQ(kExitCancelled, c.Wait()) << c.out << c.err;
-  ExpectSays(c.out, {"cancelled", "task t1: finished"});
+  ExpectHas(c.out, {"cancelled", "task t1: finished"});
   EXPECT_EQ("CLIENT-A", ShareKey("big", "RunningID"));
   // The daemon's side keeps the part once its connection has ended.
   const std::string part = share + "/.s2s-partial/blob";
@@ -471,8 +466,8 @@ TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
   Child full = Sync(client, "big");
   umount2(share.c_str(), MNT_DETACH);
   EXPECT_EQ(kExitShare, full.code) << full.out << full.err;
-  ExpectSays(full.out,
-             {"share big: transfer failed: ", "No space left on device"});
+  ExpectHas(full.out,
+            {"share big: transfer failed: ", "No space left on device"});
 }
 
 // kill -9 of a client in mid-transfer, a beacon in flight: a second run is
@@ -523,7 +518,7 @@ TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
       tmp_.path(), {S2S_CLIENT_PROGRAM, "--root", client, "--task-file", task,
                     "--beacon-interval", "0", "--max-bandwidth", "8192"});
   ASSERT_EQ(kExitOk, next.code) << next.out << next.err;
-  ExpectSays(next.out, {"beacon: transfer running", "2/2 shares synced"});
+  ExpectHas(next.out, {"beacon: transfer running", "2/2 shares synced"});
   EXPECT_EQ(16u << 20,
             std::filesystem::file_size(server_ + "/volume1/big/blob"));
   EXPECT_TRUE(Has(Server({"status"}).out, "task  filetask         idle"));
