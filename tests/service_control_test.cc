@@ -15,17 +15,13 @@
 #include <string>
 #include <vector>
 
-#include "S2S/ipc.h"
 #include "S2S/pobject.h"
-#include "appliances.h"
 #include "control_client.h"
 #include "ctl_options.h"
 #include "ctl_print.h"
 #include "ctl_task.h"
-#include "gtest/gtest.h"
 #include "json_writer.h"
 #include "s2sd_process.h"
-#include "testutil.h"
 
 namespace {
 

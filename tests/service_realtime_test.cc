@@ -1,7 +1,6 @@
 // Realtime tasks: the batcher's coalescing through its clock seam, and s2sd
 // watching real shares with each change source and pushing to a real
 // server daemon.
-#include <gtest/gtest.h>
 #include <signal.h>
 #include <unistd.h>
 
@@ -11,12 +10,8 @@
 #include <tuple>
 #include <vector>
 
-#include "S2S/sync_obj_pobject.h"
-#include "appliances.h"
 #include "s2sd_process.h"
 #include "service/batcher.h"
-#include "service/config.h"
-#include "testutil.h"
 
 namespace {
 

@@ -15,17 +15,12 @@
 #include <vector>
 
 #include "S2S/is_syncedshare.h"
-#include "S2S/sync_obj_pobject.h"
-#include "appliances.h"
-#include "gtest/gtest.h"
 #include "s2sd_process.h"
-#include "service/config.h"
 #include "service/history.h"
 #include "service/record.h"
 #include "service/run_worker.h"
 #include "service/scheduler.h"
 #include "service/task_store.h"
-#include "testutil.h"
 
 namespace {
 
