@@ -2,7 +2,6 @@
 #include "S2S/is_syncedshare.h"
 
 #include <gtest/gtest.h>
-#include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -206,38 +205,21 @@ TEST_F(RegistryTest, StatusIsBusyForTwoMinutesAndRunsWithSwitchAndDaemon) {
 // create the lock and the file.
 TEST_F(RegistryTest, WritersInManyProcessesLoseNothing) {
   const int kWriters = 6, kRounds = 40;
-  int go[2];
-  ASSERT_EQ(pipe(go), 0);
-  std::vector<pid_t> pids;
-  for (int who = 0; who < kWriters; ++who) {
-    pid_t pid = fork();
-    ASSERT_GE(pid, 0);
-    if (pid == 0) {
-      close(go[1]);
-      char c;
-      if (read(go[0], &c, 1) != 0) _exit(1);
-      for (int i = 1; i <= kRounds; ++i) {
-        std::string n = std::to_string(i), name = std::to_string(who);
-        auto h = MakeHash({{"clientID", ("c" + n).c_str()},
-                           {"serverName", ("srv" + n).c_str()},
-                           {"round", n.c_str()}});
-        int r = who == 0   ? KAROUISetS2S(i % 2, nullptr, nullptr)
-                : who == 1 ? S2SServerSetPairValue(h.get())
-                : who % 2  ? S2SServerUpdateTask(name.c_str(), h.get())
-                           : S2SServerUpdateShare(name.c_str(), h.get());
-        if (r != 0) _exit(1);
-      }
-      _exit(0);
+  std::vector<int> codes = s2s_test::RaceChildren(kWriters, [](int who) {
+    for (int i = 1; i <= kRounds; ++i) {
+      std::string n = std::to_string(i), name = std::to_string(who);
+      auto h = MakeHash({{"clientID", ("c" + n).c_str()},
+                         {"serverName", ("srv" + n).c_str()},
+                         {"round", n.c_str()}});
+      int r = who == 0   ? KAROUISetS2S(i % 2, nullptr, nullptr)
+              : who == 1 ? S2SServerSetPairValue(h.get())
+              : who % 2  ? S2SServerUpdateTask(name.c_str(), h.get())
+                         : S2SServerUpdateShare(name.c_str(), h.get());
+      if (r != 0) return 1;
     }
-    pids.push_back(pid);
-  }
-  close(go[0]);
-  close(go[1]);
-  for (pid_t pid : pids) {
-    int status;
-    ASSERT_EQ(waitpid(pid, &status, 0), pid);
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-  }
+    return 0;
+  });
+  EXPECT_EQ(std::vector<int>(kWriters, 0), codes);
   const std::string last = std::to_string(kRounds);
   EXPECT_EQ(Value("PairedClientInfo", "s2sEnabled"),
             kRounds % 2 ? "yes" : "no");

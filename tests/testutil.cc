@@ -187,6 +187,27 @@ Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
   return c;
 }
 
+std::vector<int> RaceChildren(int n, const std::function<int(int)>& child) {
+  int go[2];
+  if (pipe(go) != 0) return {};
+  std::vector<pid_t> pids;
+  for (int i = 0; i < n; ++i) {
+    pids.push_back(fork());
+    char c;
+    if (pids.back() == 0)
+      _exit(close(go[1]) == 0 && read(go[0], &c, 1) == 0 ? child(i) : 126);
+  }
+  close(go[0]);
+  close(go[1]);  // all start at once
+  std::vector<int> codes;
+  for (pid_t pid : pids) {
+    int st = 0;
+    bool reaped = pid > 0 && waitpid(pid, &st, 0) == pid;
+    codes.push_back(reaped && WIFEXITED(st) ? WEXITSTATUS(st) : -1);
+  }
+  return codes;
+}
+
 bool WaitUntil(const std::function<bool()>& done, double seconds,
                double every) {
   auto start = std::chrono::steady_clock::now();
