@@ -17,8 +17,7 @@ bool MakeDirs(const std::string& path) {
   return !ec;
 }
 
-// The daemon's user is also the SSH login of the key-file transfer, so it is
-// whoever runs the tests.
+// The daemon's user, also the key transfer's SSH login: whoever runs tests.
 std::string LoginName() {
   const passwd* pw = getpwuid(geteuid());
   return pw != nullptr ? pw->pw_name : "root";
@@ -114,8 +113,7 @@ bool Appliances::StartServer(bool old_server) {
   config.gid = getegid();
   config.old_server = old_server;
   {
-    // The generator writes below the root it runs under; the daemon runs
-    // its hooks through the handler, as s2s-server starts it.
+    // The generator writes below its root; hooks run through the handler.
     ScopedEnv server("S2S_ROOT", server_root_);
     ScopedEnv shell("RSYNC_SHELL", handler_);
     if (S2S::server::WriteDaemonConfig(config) != 0 ||

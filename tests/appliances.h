@@ -1,7 +1,6 @@
-// Two appliances on one machine: a client root and a server root, the
-// server's rsync daemon (configured by the server's own generator) on a free
-// loopback port, and S2S_ROOT and S2S_RSYNC_PORT pointed at the client, so
-// that the library under test talks to that daemon as a client would.
+// A client root and a server root, the server's daemon (configured by its
+// own generator) on loopback, and S2S_ROOT and S2S_RSYNC_PORT set so that
+// the library under test talks to that daemon as a client would.
 #ifndef S2S_TESTS_APPLIANCES_H_
 #define S2S_TESTS_APPLIANCES_H_
 
@@ -16,26 +15,21 @@ namespace s2s_test {
 
 class Appliances : NoCopy {
  public:
-  // `handler`: the server's command handler program, which the daemon's
-  // hooks run. S2S_ROOT points at the client root while the object lives.
+  // `handler`: the program the daemon's hooks run. S2S_ROOT: the client's.
   explicit Appliances(const std::string& handler);
   ~Appliances();
 
-  // Declares share `name`, empty, on both appliances and every client added
-  // later; an encrypted one keeps its data in "@name@" and has a key file on
-  // the client. Call before StartServer.
+  // Declares share `name` on every appliance (encrypted: data in "@name@", a
+  // key file on the client). Call before StartServer.
   bool AddShare(const std::string& name, bool encrypted = false);
-  // Generates the server's daemon configuration under the server root and
-  // starts the daemon; S2S_RSYNC_PORT then names its port. `old_server`
-  // makes the handler answer as a protocol-0 server.
+  // Configures and starts the server's daemon, its port in S2S_RSYNC_PORT;
+  // `old_server`: the handler answers as a protocol-0 server.
   bool StartServer(bool old_server = false);
   void StopServer();
 
-  // Another client appliance with its own identity (serial) and the same
-  // shares; returns its root. Enter() it to act as that client.
+  // Another client (serial `serial`) with the same shares; Enter() its root.
   std::string AddClient(const std::string& serial);
-  // Points S2S_ROOT at `root` (client_root(), server_root() or an added
-  // client) until the next Enter or the end of the object.
+  // Points S2S_ROOT at `root` until the next Enter or the object's end.
   void Enter(const std::string& root);
 
   const std::string& client_root() const { return client_root_; }
@@ -51,8 +45,7 @@ class Appliances : NoCopy {
   std::string ServerRegistry(const std::string& section,
                              const std::string& key);
 
-  // What a client knows of the server: 127.0.0.1, the daemon's user and
-  // password, no SSH.
+  // What a client knows of the server: 127.0.0.1, user, password, no SSH.
   S2S::SyncInfo Info() const;
   const std::string& user() const { return user_; }
   std::string DaemonLog() const { return daemon_.Log(); }
@@ -84,8 +77,7 @@ class ScriptedServer : NoCopy {
  public:
   explicit ScriptedServer(const std::string& dir);
 
-  // Starts the daemon for `user` with `password`; S2S_RSYNC_PORT names its
-  // port while the object lives.
+  // Starts the daemon for `user`; S2S_RSYNC_PORT names its port from then.
   bool Start(const std::string& user, const std::string& password);
   // From now on `command` is answered with `status` and `answer` (else 0).
   void Answer(const std::string& command, int status,

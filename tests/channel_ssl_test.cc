@@ -24,9 +24,9 @@ std::vector<std::string> Shell(const std::string& command) {
   return {"sh", "-c", "exec " + command};
 }
 
-// A CA; leaves it signed with the name in the subject ("cn", its file holding
-// the chain), in the alternative names ("san") or as a wildcard ("wild"); a
-// self-signed leaf ("self").
+// A CA; leaves signed by it carrying the name in the subject only ("cn",
+// whose file holds the chain), in the alternative names only ("san") and as a
+// wildcard ("wild"); a self-signed leaf ("self").
 bool MakeCertificates(const s2s_test::TempDir& dir) {
   const std::string by_ca = " -CA ca.pem -CAkey ca.key";
   const std::string certs[][4] = {
@@ -83,8 +83,7 @@ class ChannelSSLTest : public ::testing::Test {
     client.SetSSLHostname(host);
   }
 
-  // Our client and server ends over loopback TCP; with `raw`, the test has
-  // the server's, `peer`.
+  // Our client and server over loopback TCP; `raw`: the test is the server.
   struct Pair : s2s_test::ChannelPair {
     explicit Pair(unsigned int capacity = 4096, int timeout = 5,
                   bool raw = false)

@@ -121,8 +121,7 @@ TEST(ChannelTest, WriteBuffersUpToCapacityAndFlushesOnlyForRoom) {
   EXPECT_GE(p.Pending().size(), 10u);
 }
 
-// A read may end exactly at the end of the ring while wrapped bytes remain;
-// the next read must continue from the start of the ring.
+// A read ending at the ring's end, wrapped bytes left: the next one wraps.
 TEST(ChannelTest, ReadsContinueAcrossTheEndOfAWrappedRing) {
   Pair p(8);
   ASSERT_EQ(write(p.peer, "0123456789abcdef", 16), 16);

@@ -201,8 +201,7 @@ TEST_F(RegistryTest, StatusIsBusyForTwoMinutesAndRunsWithSwitchAndDaemon) {
   EXPECT_EQ(s2s_svr_put_status(nullptr), 0);
 }
 
-// Writers in several processes, released at once into an empty root, race to
-// create the lock and the file.
+// Writers in several processes race to create the lock and the file.
 TEST_F(RegistryTest, WritersInManyProcessesLoseNothing) {
   const int kWriters = 6, kRounds = 40;
   std::vector<int> codes = s2s_test::RaceChildren(kWriters, [](int who) {

@@ -100,8 +100,7 @@ TEST_F(LoggerTest, StandardStreamsAreTimestampedFilteredAndPrefixed) {
   EXPECT_TRUE(Has(lines[0], "[WARNING] S2S/logtest(" + std::to_string(line) +
                                 "): value v"));
   // The message after one without a newline continues on its line.
-  EXPECT_TRUE(Has(lines[1], "): no newline")) << lines[1];
-  EXPECT_TRUE(Has(lines[1], "[DEBUG] S2S/logtest(")) << lines[1];
+  s2s_test::ExpectHas(lines[1], {"): no newline", "[DEBUG] S2S/logtest("});
 }
 
 TEST_F(LoggerTest, FailedInitializeKeepsTheStreamAndDestroyLeavesStdout) {
@@ -132,15 +131,14 @@ TEST_F(LoggerTest, FailedInitializeKeepsTheStreamAndDestroyLeavesStdout) {
   EXPECT_TRUE(Has(ReadFile(path), "into the file"));
 }
 
-// Writes messages of `len` bytes (and a 16-byte timestamp) until `rotations`
-// rotations happened; how many it wrote.
+// Writes `len`-byte messages (and a timestamp) until `rotations`: how many.
 int WriteUntilRotated(int len, int rotations) {
   std::string text(len - 1, 'x');
   int written = 0;
   for (int seen = 0, before = Logger::GetSize(); seen < rotations; ++written) {
     Logger::LogMsg(Logger::Error, "%s\n", text.c_str());
     int now = Logger::GetSize();
-    if (now < before) ++seen;
+    seen += now < before;
     before = now;
   }
   return written;

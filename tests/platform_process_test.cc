@@ -41,8 +41,7 @@ TEST(PopenTest, ArgumentsReachTheProgramUninterpretedBothWays) {
 
 void Interrupt(int) {}
 
-// A signal that interrupts the reader (handled without SA_RESTART, as the
-// client does) ends the program too, instead of waiting out its run.
+// An interrupted read (no SA_RESTART, as in the client) ends the program too.
 TEST(PopenTest, SignalDuringTheReadEndsTheProgram) {
   struct sigaction sa = {}, old_sa;
   sa.sa_handler = Interrupt;

@@ -55,8 +55,7 @@ TEST(PObject, IntegersAreSixtyFourBitsSeenThroughNarrowerViews) {
   EXPECT_EQ(PObject("42").asUInt64(), 0u);  // no string-to-number conversion
 }
 
-// Const views of another kind hand out the shared empties and leave the
-// value alone; non-const views replace it.
+// Const views of another kind give shared empties; non-const ones replace.
 TEST(PObject, ConstViewsReadAndNonConstViewsReplace) {
   PObject o(7ull);
   const PObject& c = o;

@@ -1,7 +1,5 @@
-// The rsync wrapper's command channel against a real rsync daemon on loopback
-// whose command module answers what the test chose, so these tests pin the
-// wrapper's side; data runs and the exit codes of failed connections are
-// tested through the Rsyncer.
+// The rsync wrapper's command channel against a real, scripted rsync daemon
+// on loopback; data runs and failed connections are tested through Rsyncer.
 #include "karo/rsync_wrapper.h"
 
 #include <sys/stat.h>
@@ -87,8 +85,7 @@ TEST_F(RsyncWrapperTest, IncompleteSettingsAreRefusedWithoutRunningRsync) {
             no_password.execute(boost::function<bool()>()));
 }
 
-// A hostile server answering the version query with 64 MiB: refused with
-// its own status, and nothing of it comes to the client's disk.
+// A hostile 64 MiB reply: refused with its own status, and none of it kept.
 TEST_F(RsyncWrapperTest, ReplyOverTheCapIsRefusedWithoutKeepingIt) {
   const std::list<std::string> version = {"command=\"S2S_GetProtocolVer\"",
                                           "outfile=\"" + out_ + "\""};

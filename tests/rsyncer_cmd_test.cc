@@ -1,6 +1,5 @@
-// The client's side of a server command without a server: the wrapper
-// settings of each kind of run, the exact lines of every request, the checks
-// made before anything is written, and the splitting of answers.
+// A server command's client side without a server: each run's wrapper
+// settings, each request's lines, the checks before it, answers split.
 #include <list>
 #include <string>
 #include <vector>

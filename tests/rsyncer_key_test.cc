@@ -1,6 +1,5 @@
-// An encrypted share's key file travels to the server's key directory, and
-// always over SSH, against a real sshd whose forced command serves the
-// server's daemon configuration.
+// An encrypted share's key file travels to the server's key directory, always
+// over SSH: a real sshd whose forced command serves the server's daemon.
 #include <sys/stat.h>
 
 #include <chrono>
@@ -49,21 +48,19 @@ class RsyncerKeyTest : public ::testing::Test {
   }
   void TearDown() override { s2s_test::StopChild(&sshd_); }
 
-  // A real sshd with a generated host key that lets the client's generated
-  // key in, for which it serves the server's daemon configuration.
+  // A real sshd that lets the client's generated key in to the daemon.
   bool StartSshd() {
     const std::string ssh = app_.client_root() + "/etc/s2s/ssh";
     const std::string host_key = ssh_dir_.Sub("host_key"),
-                      authorized = ssh_dir_.Sub("authorized_keys");
+                      authorized = ssh_dir_.Sub("authorized_keys"),
+                      conf = ssh_dir_.Sub("sshd_config");
     fs::create_directories(ssh);
-    for (const std::string& key : {host_key, ssh + "/id_ed25519"}) {
-      if (!s2s_test::RunQuiet(
-              {"ssh-keygen", "-q", "-t", "ed25519", "-N", "", "-f", key})) {
-        return false;
-      }
-    }
-    const std::string conf = ssh_dir_.Sub("sshd_config");
-    if (!WriteFile(authorized, "command=\"rsync --server --daemon --config=" +
+    auto keygen = [](const std::string& key) {
+      return s2s_test::RunQuiet(
+          {"ssh-keygen", "-q", "-t", "ed25519", "-N", "", "-f", key});
+    };
+    if (!keygen(host_key) || !keygen(ssh + "/id_ed25519") ||
+        !WriteFile(authorized, "command=\"rsync --server --daemon --config=" +
                                    app_.server_root() +
                                    "/etc/s2s/rsyncd.conf .\",no-pty " +
                                    ReadFile(ssh + "/id_ed25519.pub")) ||

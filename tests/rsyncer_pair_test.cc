@@ -1,8 +1,7 @@
-// Probing a server: which address answers, what version it speaks, and how
-// the probe ends when nothing answers in time. Pairing: one request per
-// client for an old server, the share list for a multi-source one, and the
-// conflicts a second client runs into; the attributes of a sync start, and
-// when it falls back to the plain form.
+// Probing a server: which address answers, its version, and a probe nothing
+// answers. Pairing: an old server's single request, the share list for a
+// multi-source one, a second client's conflicts; a sync start's attributes
+// and when it falls back to the plain form.
 #include <unistd.h>
 
 #include <atomic>
@@ -24,8 +23,7 @@ using Names = std::list<std::string>;
 
 class RsyncerPairTest : public ::testing::Test {
  protected:
-  // Starts the scripted server in place of the real one; what a client knows
-  // of it.
+  // Starts the scripted server instead of the real one; the client's view.
   S2S::SyncInfo StartScripted() {
     EXPECT_TRUE(server_.Start(app_.user(), "scripted-Pw-1"));
     S2S::SyncInfo info = app_.Info();
@@ -83,8 +81,7 @@ TEST_F(RsyncerProbeTest, FirstCandidateThatAnswersWinsAndFailuresSayWhy) {
   EXPECT_FALSE(Has(log.Text(), "not-the-password"));
   EXPECT_EQ(-1, other.GetServerVersionValue());
 
-  // Right password: found. Then the server goes away; the version learnt
-  // before still makes the next probe a success.
+  // Found. With the server gone, the version learnt still makes it succeed.
   ASSERT_EQ(0, other.Initialize(app_.Info()));
   app_.StopServer();
   s2s_test::ScopedEnv port("S2S_RSYNC_PORT",
@@ -283,8 +280,7 @@ TEST_F(RsyncerPairTest, ScriptedAnswersAndRefusalsBeforeAnyRun) {
   EXPECT_TRUE(Has(log.Text(), "Fail to check share pairing [5]\n"));
   EXPECT_TRUE(std::filesystem::is_empty(app_.client_root() + "/tmp/S2S"));
 
-  // A sync start falls back to the plain form after 202 only (see the old
-  // server above), not after any other refusal.
+  // A sync start falls back to the plain form after 202 only.
   server_.Answer("S2S_SyncStart", 5);
   int before = server_.Count();
   ASSERT_EQ(0, r.StartSyncShare("docs", status));

@@ -1,7 +1,6 @@
-// A share's sync run end to end: the client driver against the server's
-// real daemon and handler on loopback, and what the share's tree looks like
-// on the server afterwards: awkward names, links, modes, owners, times, ACLs
-// and extended attributes.
+// A share's sync run against the server's real daemon and handler, and the
+// tree it leaves there: awkward names, links, modes, owners, times, ACLs and
+// extended attributes.
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/inotify.h>
@@ -70,8 +69,7 @@ TEST_F(RsyncerSyncTest, PushBeaconAndFinish) {
   EXPECT_EQ(0, status);
   EXPECT_EQ("idle", app_.ServerRegistry("TASK_nightly", "status"));
 
-  // The sync is over: the share's module refuses further pushes, which only
-  // shows in the status.
+  // The sync over, the share's module refuses pushes: seen in the status.
   ASSERT_EQ(0, r_.RunSync(1, "docs", "/", {}, status));
   EXPECT_NE(0, status);
   // The server's own refusal of a finish it does not know.
@@ -195,9 +193,8 @@ TEST_F(RsyncerSyncTest, CancelStopsALargeTransferPromptly) {
   ASSERT_TRUE(stop_run.load()) << "no data reached the server";
   EXPECT_EQ(Rsyncer::RsyncTask::kCancelled, status);
   EXPECT_LT(ended - stopped, std::chrono::milliseconds(1200));
-  // Once the link is gone the daemon's receiver keeps what arrived (if any
-  // data did) in its hidden partial directory, for the next run to build
-  // on, and nothing else.
+  // The daemon's receiver keeps what arrived, if anything, in its hidden
+  // partial directory for the next run, and nothing else.
   auto names = [this] {
     std::string all;
     for (const auto& e : fs::directory_iterator(app_.ServerShare("docs")))
@@ -209,9 +206,8 @@ TEST_F(RsyncerSyncTest, CancelStopsALargeTransferPromptly) {
       << names();
 }
 
-// A tree as rsync should carry it, one line per entry: name, type and mode,
-// owner, modification time (not for directories) and the content or the
-// link's target.
+// A tree, a line per entry: name, mode, owner, time (but for directories) and
+// the content or the link's target.
 std::string Snapshot(const std::string& top) {
   std::string out;
   std::map<std::string, std::string> lines;

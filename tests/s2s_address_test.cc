@@ -14,8 +14,8 @@ using s2s_test::Has;
 using s2s_test::ScopedEnv;
 using Addrs = std::vector<std::string>;
 
-// A root whose hosts file names the servers, with the system resolver shut
-// off, and an nmblookup on PATH that answers only for 127.0.0.5.
+// A root whose hosts file (no system resolver) names the servers; nmblookup
+// on PATH answers only for 127.0.0.5.
 class UsableIpTest : public ::testing::Test {
  protected:
   void SetUp() override {

@@ -43,8 +43,7 @@ std::string Flags(const S2S::ShareInfo& i) {
   return f + std::to_string(i.GetEncryptKeyLen());
 }
 
-// An encrypted share is served from its lower path, configured or beside
-// the share; a Windows share always carries ACLs.
+// An encrypted share is served from its lower path; a Windows one has ACLs.
 TEST_F(ShareTest, ShareInfoNamesTheModuleAndItsDirectory) {
   const struct {
     const char *name, *path, *module_path, *module, *flags;

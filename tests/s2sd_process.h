@@ -19,9 +19,8 @@
 
 namespace s2s_test {
 
-// s2sd as a process on the client root beside a running server appliance
-// with `shares`, stopped by its own pid: it finds an rsync first in PATH
-// that notes each run in rsync_log_ ("start <ns> <pid> <arguments>", "end
+// s2sd on the client root beside a running server, stopped by its own pid;
+// its PATH's rsync notes runs in rsync_log_ ("start <ns> <pid> <args>", "end
 // <ns> <pid>") and reaches no server while the file unreachable_ exists.
 class S2sdTest : public ::testing::Test {
  protected:
@@ -45,8 +44,7 @@ class S2sdTest : public ::testing::Test {
                           "[Service]\n\tbeacon_interval=\"3600\"\n" + config));
   }
 
-  // Starts s2sd in the foreground, verbose, logging to a file, with `args`
-  // added; fails the test unless it answers on its socket.
+  // Starts s2sd, verbose, logging to a file, with `args`; awaits its answer.
   void StartDaemon(const std::vector<std::string>& args = {}) {
     unlink(s2s_service::SocketPath().c_str());
     std::vector<std::string> argv = {S2SD_PROGRAM, "--foreground", "--log",
@@ -87,8 +85,7 @@ class S2sdTest : public ::testing::Test {
 
   std::string Log() { return ReadFile(tmp_.Sub("s2sd.log")); }
 
-  // Adds a task over `shares` of the test's server, with the task keys in
-  // `settings` beside; its id.
+  // Adds a task over `shares` with the keys of `settings` beside; its id.
   unsigned long long AddTask(const std::string& name,
                              const std::list<std::string>& shares,
                              const S2S::Schedule& schedule,

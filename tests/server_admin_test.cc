@@ -1,5 +1,4 @@
-// s2s-server's administration without a running daemon: the shares of a
-// root, SSH mode's files, and the words of a refused command line.
+// s2s-server's administration: shares, SSH mode, refused command lines.
 #include <pwd.h>
 #include <signal.h>
 #include <sys/stat.h>
@@ -151,8 +150,7 @@ TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
   EXPECT_EQ("nobody:pw-ssh-admin\n",
             ReadFile(root + "/etc/s2s/rsyncd-ssh.secrets"));
 
-  // What the key's forced command runs, as the user, with rsync's remote
-  // shell standing in for the SSH login: a command and its reply.
+  // The key's forced command as the user, rsync's shell standing in for SSH.
   const std::string shell = tmp.Sub("login"), command = tmp.Sub("command");
   ASSERT_TRUE(s2s_test::WriteScript(
       shell, "exec setpriv --reuid=" + std::to_string(nobody->pw_uid) +
@@ -169,8 +167,7 @@ TEST(ServerAdmin, SharesAndSshModeForAnOrdinaryDaemonUser) {
   EXPECT_EQ(0, pull.code) << pull.out << pull.err;
   EXPECT_EQ("status=0\n1", ReadFile(tmp.Sub("r1")).substr(0, 10));
 
-  // A live process that is not this root's daemon, behind its pid file:
-  // stop refuses to signal it and forgets nothing.
+  // Another live process behind the pid file: stop neither signals nor forgets.
   Child sleeper = s2s_test::Spawn(tmp.path(), {"/bin/sleep", "30"});
   const std::string pid = root + "/var/run/s2s-rsyncd.pid",
                     port = root + "/var/run/s2s-rsyncd.port";

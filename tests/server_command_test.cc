@@ -1,5 +1,4 @@
-// The server's command handler on untrusted input: command files, ids and
-// hook requests refused before they touch a path or the registry.
+// The server's command handler refuses untrusted input before it acts.
 #include <sched.h>
 #include <sys/time.h>
 #include <sys/wait.h>

@@ -95,9 +95,8 @@ class ServerDaemonTest : public ::testing::Test {
     return w.execute(boost::function<bool()>());
   }
 
-  // A connection to `module` that stops at the password challenge, by
-  // which point the daemon counts it against the module's limit; -1 when
-  // it was refused.
+  // A connection to `module` stopped at the password challenge, counted
+  // against the module's limit; -1 when refused.
   int Stalled(const std::string& module) {
     int fd = s2s_test::ConnectLoopback(daemon_.port());
     std::string said, hello = "@RSYNCD: 31.0\n" + module + "\n";

@@ -1,7 +1,6 @@
-// The client service's control socket from the front end's side: what
-// s2sctl makes of its command line, the JSON it prints for scripts, what it
-// shows a person (schedules in words, a transfer's progress, why a realtime
-// task is not watching), and requests against a real s2sd.
+// The client service's control socket from the front end's side: s2sctl's
+// command line, its JSON and its words for a person (schedules, progress,
+// why a realtime task is not watching), and requests to a real s2sd.
 #include <pwd.h>
 #include <signal.h>
 #include <stdlib.h>

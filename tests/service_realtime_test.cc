@@ -1,6 +1,5 @@
-// Realtime tasks: the batcher's coalescing through its clock seam, and s2sd
-// watching real shares with each change source and pushing to a real
-// server daemon.
+// Realtime tasks: the batcher through its clock seam, and s2sd watching real
+// shares with each change source, pushing to a real server daemon.
 #include <signal.h>
 #include <unistd.h>
 
@@ -119,9 +118,8 @@ class RealtimeTest : public s2s_test::S2sdTest,
     server_ = app_.ServerShare("docs");
   }
 
-  // Adds the realtime task over docs with the test's change source, a
-  // settle delay of 0.2 s and `settings` beside; its status map once it
-  // watches, or a null object.
+  // Adds the realtime task over docs (the test's source, 0.2 s settle, and
+  // `settings`); its status once it watches, or a null object.
   PObject AddLive(PObject settings = PObject()) {
     settings["realtime_source"] = GetParam();
     settings["realtime_settle_ms"] = 200u;
@@ -144,8 +142,7 @@ class RealtimeTest : public s2s_test::S2sdTest,
     return reply["realtime"][0u];
   }
 
-  // Seconds until `path` on the server holds `content` (-1: not within
-  // `seconds`).
+  // Seconds until `path` on the server holds `content`, -1 after `seconds`.
   double Arrival(const std::string& path, const std::string& content,
                  double seconds = 10) {
     auto start = std::chrono::steady_clock::now();
@@ -161,8 +158,7 @@ class RealtimeTest : public s2s_test::S2sdTest,
 
   bool Same() { return s2s_test::RunQuiet({"diff", "-r", client_, server_}); }
 
-  // How often a wait compares or walks whole trees: seldom enough to leave
-  // the machine to the daemon under test.
+  // How often waits compare whole trees: seldom, for the daemon's sake.
   static constexpr double kSlowly = 0.05;
 
   size_t Files(const std::string& dir) {
@@ -231,8 +227,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   EXPECT_LE(0, Arrival(odd[2] + odd[0], "both\n"));
   EXPECT_TRUE(WaitUntil([&] { return Same(); }, 10, kSlowly));
 
-  // A burst: 200 files in 20 new directories, far more paths than one batch
-  // pushes one by one.
+  // A burst: 200 files in 20 new directories, more than a batch's paths.
   size_t runs_before = RsyncLogCount(client_);
   for (int d = 0; d < 20; ++d) {
     std::string dir = client_ + "/burst/d" + std::to_string(d);
@@ -245,8 +240,7 @@ TEST_P(RealtimeTest, ChangesArriveWithinTheSettleDelayWhateverTheirBytes) {
   EXPECT_TRUE(Same());
   EXPECT_LE(RsyncLogCount(client_) - runs_before, 10u);
 
-  // The share's directory goes: no longer watched, and watched again when
-  // it is back.
+  // The share's directory goes: not watched, and watched again once back.
   fs::rename(client_, client_ + ".away");
   EXPECT_TRUE(WaitUntil(
       [&] {

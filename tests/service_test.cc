@@ -208,8 +208,7 @@ class ServiceTest : public s2s_test::S2sdTest {
     };
   }
 
-  // Waits up to `seconds` for `done`, woken by every change of the
-  // history directory (each run's start and end rewrites a file there).
+  // Waits up to `seconds` for `done`, woken by each history file's rewrite.
   bool WaitFor(const std::function<bool()>& done, double seconds) {
     int fd = inotify_init1(IN_CLOEXEC | IN_NONBLOCK);
     inotify_add_watch(fd, HistoryDir().c_str(), IN_MOVED_TO | IN_CREATE);
@@ -228,8 +227,7 @@ class ServiceTest : public s2s_test::S2sdTest {
     return ok;
   }
 
-  // The most data transfers (not command exchanges) the rsync log shows
-  // at once; two of one share at once fail the test.
+  // The most data transfers at once in the rsync log; two of a share fail.
   size_t MostAtOnce() {
     std::map<std::string, std::string> running;  // pid -> share
     size_t most = 0;
@@ -314,8 +312,7 @@ TEST_F(ServiceTest, ScheduledRunsByThemselvesApartAndCatchUpOnceManualWaits) {
   EXPECT_LT(0u, big["speed"].asUInt64());
   EXPECT_EQ(0, StopDaemon());
 
-  // At 12:10:30: the missed slots give one catch-up run; tasks and history
-  // remain.
+  // At 12:10:30: one catch-up run for the missed slots; all else remains.
   StartDaemon(ClockAt(600 + 30));
   ASSERT_TRUE(WaitFor(Ended(1, "ok", 2), 30));
   PObject::Array runs = Runs(1);
@@ -325,10 +322,9 @@ TEST_F(ServiceTest, ScheduledRunsByThemselvesApartAndCatchUpOnceManualWaits) {
   EXPECT_EQ(5u, Request(Action("list"))["tasks"].asArray().size());
 }
 
-// The second run reuses the first one's probe and pairing: per share its
-// start, transfer and end, then the task's end; no beacon before its time.
-// A server of the single-client protocol that forgot its client between
-// runs refuses the reused session's sync start; the run pairs again.
+// A second run reuses the first's probe and pairing: per share a start,
+// transfer and end, then the task's end. A single-client server that forgot
+// its client refuses the reused session's start; the run pairs again.
 TEST_F(ServiceTest, RunsSendOnlyNeededCommandsCancelCleanlyAndPairAgain) {
   StartDaemon();
   unsigned long long id =

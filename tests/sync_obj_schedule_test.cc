@@ -15,8 +15,7 @@ using S2S::Schedule;
 using s2s_test::Has;
 using s2s_test::ScopedEnv;
 
-// A schedule written "<mode> <what> <HH:MM> [<period>x<repeat>]": mode W, M,
-// Y or O; <what> is the week string for W, the begin date YYYY-MM-DD else.
+// "<W|M|Y|O> <week string, or begin YYYY-MM-DD> <HH:MM> [<period>x<repeat>]".
 Schedule Make(const std::string& spec) {
   char mode = 0, what[16] = "";
   int hour = 0, minute = 0;

@@ -91,8 +91,7 @@ TEST(ShareAndEvent, RelativePathIsMadeAbsoluteAndBothDump) {
             "relative_path: . /a/b\nstatus: ........ -1\n");
 }
 
-// Server settings, schedule, name, share list, each share: the first broken
-// rule is the one logged.
+// The first broken rule is logged: server, schedule, name, share list, shares.
 TEST(TaskInfo, ValidateChecksInOrderAndEveryShareMustBeSyncable) {
   s2s_test::TempRoot root;
   ASSERT_TRUE(

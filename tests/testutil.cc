@@ -37,8 +37,8 @@ std::string TempBase() {
   return (t != nullptr && *t != '\0') ? t : "/tmp";
 }
 
-// In a forked child: applies `env` (as Spawn takes it), puts `in`, `out` and
-// `err` (-1: inherited) on descriptors 0, 1 and 2 and runs `args`.
+// In a forked child: applies `env` (as Spawn), puts `in`, `out` and `err`
+// (-1: inherited) on 0, 1 and 2 and runs `args`.
 [[noreturn]] void ExecChild(std::vector<std::string> args, int in, int out,
                             int err, const std::vector<std::string>& env) {
   for (const std::string& e : env) {

@@ -23,8 +23,7 @@ struct NoCopy {
   NoCopy& operator=(const NoCopy&) = delete;
 };
 
-// A fresh directory under $TMPDIR (or /tmp), removed with everything in it
-// when the object goes away.
+// A fresh directory under $TMPDIR (or /tmp), removed whole with the object.
 class TempDir : NoCopy {
  public:
   TempDir();
@@ -106,8 +105,7 @@ int FreeLoopbackPort();
 // or -1; the kernel completes connections whether or not they are accepted.
 int LoopbackListener(int* port);
 
-// SIGTERM to a child this process started (*pid, unless <= 0), then waits for
-// it; *pid becomes -1.
+// SIGTERM to this process's child *pid (if > 0), reaped; *pid becomes -1.
 void StopChild(pid_t* pid);
 
 // Starts what `argv_for` gives for a free loopback port (nothing: give up),
@@ -168,12 +166,10 @@ class TempRoot : public TempDir {
   ScopedEnv env_;
 };
 
-// Runs a program (an argument vector, looked up in PATH, no shell) to
-// completion with its input and output on /dev/null; true on exit 0.
+// Runs `args` (in PATH, no shell), in and out on /dev/null; true on exit 0.
 bool RunQuiet(const std::vector<std::string>& args);
 
-// A program started by Spawn: its exit code and what it wrote to standard
-// output and standard error, once Wait has returned.
+// A program started by Spawn: its exit code and output, once Wait returned.
 struct Child {
   pid_t pid = -1;
   std::string out_path, err_path;
@@ -196,8 +192,7 @@ Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
 // index); their exit codes (-1: killed by a signal).
 std::vector<int> RaceChildren(int n, const std::function<int(int)>& child);
 
-// Polls `done` every `every` seconds until it holds (true) or `seconds`
-// have passed (false).
+// Polls `done` every `every` s until it holds (true) or `seconds` passed.
 bool WaitUntil(const std::function<bool()>& done, double seconds,
                double every = 0.005);
 

@@ -118,8 +118,7 @@ TEST(Secret, FirstLineOfTheFileWinsAndTheEnvironmentIsConsumed) {
   ASSERT_TRUE(WriteFile(tmp.Sub("empty"), "\n", 0600));
   EXPECT_FALSE(ReadPassword(tmp.Sub("empty"), pw, error));
 
-  // A file given wins over the variable, which is removed all the same so
-  // that rsync and every other child does not inherit it.
+  // A file wins over the variable, removed all the same: no child inherits it.
   setenv(kPasswordEnv, "from-env", 1);
   ASSERT_TRUE(ReadPassword(path, pw, error));
   EXPECT_EQ("s3cret-line", pw);

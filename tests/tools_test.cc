@@ -88,8 +88,7 @@ std::vector<std::pair<pid_t, pid_t>> RsyncChildren(pid_t parent) {
   return out;
 }
 
-// A file of `mb` megabytes that neither compresses nor repeats itself, so
-// that a delta transfer finds no block of it anywhere but in its own copy.
+// A file of `mb` MiB that neither compresses nor repeats itself.
 void WriteBlob(const std::string& path, int mb) {
   std::ofstream blob(path, std::ios::binary);
   std::mt19937_64 random(static_cast<unsigned>(mb));
@@ -196,14 +195,12 @@ class ToolsTest : public ::testing::Test {
   std::string server_, pw_file_, port_;
 };
 
-// A server that an ordinary user sets up and runs: its daemon cannot change
-// users (no setgroups) and must not store links as plain files (fake
-// super), yet syncs work and symbolic links arrive as links.
+// A server an ordinary user runs: its daemon cannot change users and must not
+// store links as plain files (fake super), yet syncs keep links.
 TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   const passwd* nobody = getpwnam("nobody");
   ASSERT_NE(nullptr, nobody);
-  // The programs and libraries go where that user may run them: the build
-  // tree may lie under a directory only root can enter.
+  // The programs go where that user may run them, outside the build tree.
   std::string built = std::filesystem::path(S2S_SERVER_PROGRAM).parent_path();
   std::string bin = tmp_.Sub("bin"), root = tmp_.Sub("userserver");
   std::filesystem::create_directories(bin);
@@ -245,10 +242,9 @@ TEST_F(ToolsTest, AServerRunByAnOrdinaryUserWorksAndKeepsLinks) {
   EXPECT_EQ("bravo from CLIENT-A\n", ReadFile(root + "/volume1/docs/link"));
 }
 
-// One client's round on a running server: a first sync whose password no
-// command line, output or log shows; the failures' exit codes; a dry run
-// that changes nothing; and an operator's commands: a share added (a sparse
-// image stays sparse), a stuck sync and a one-client pairing cleared.
+// One client's round: a sync whose password no command line, output or log
+// shows; failures' exit codes; a dry run; an operator's commands: a share
+// added (sparse images stay sparse), a stuck sync and a pairing cleared.
 TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
   std::string client = MakeClient("client", "CLIENT-A");
   std::vector<std::string> argv = Client(client, "docs", {"-v", "-v"});
@@ -390,10 +386,9 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
   EXPECT_EQ("", ShareKey("docs", "RunningID"));
 }
 
-// A large file's transfer cut by SIGTERM past half way leaves the share's
-// sync unfinished, and the next run sends only what the server's kept part
-// lacks. Then the delete guard, and a full disk on the server, in rsync's
-// words.
+// A transfer cut by SIGTERM past half way leaves the sync unfinished; the
+// next run sends only what the server's kept part lacks. Then the delete
+// guard, and a full disk on the server, in rsync's words.
 TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
   std::string client = MakeClient("client", "CLIENT-A");
   const double kSize = 24 << 20;
@@ -432,8 +427,7 @@ TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
   EXPECT_FALSE(std::filesystem::exists(share + "/.s2s-partial"));
 
   // The client's share emptied (a disk not mounted) but for a changed file:
-  // it arrives, nothing is deleted and the refusal says why, until a
-  // confirmed run.
+  // it arrives, nothing is deleted and the refusal says why, until confirmed.
   const std::string mine = client + "/volume1/big";
   for (const char* f : {"f1", "f2", "f3", "f4"}) WriteFile(mine + "/" + f, f);
   ASSERT_EQ(kExitOk, Sync(client, "big").code);
@@ -471,9 +465,8 @@ TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
 }
 
 // kill -9 of a client in mid-transfer, a beacon in flight: a second run is
-// refused while it holds the task's lock; its rsync runs (holding the lock
-// too) end with it, the server gets no file, and the next run clears what
-// it left behind.
+// refused while it holds the task's lock; its rsync runs end with it, the
+// server gets no file, and the next run clears what it left.
 TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
   std::string client = MakeClient("client", "CLIENT-A");
   WriteBlob(client + "/volume1/big/blob", 16);
