@@ -204,7 +204,7 @@ TEST_F(RegistryTest, StatusIsBusyForTwoMinutesAndRunsWithSwitchAndDaemon) {
 // Writers in several processes race to create the lock and the file.
 TEST_F(RegistryTest, WritersInManyProcessesLoseNothing) {
   const int kWriters = 6, kRounds = 40;
-  std::vector<int> codes = s2s_test::RaceChildren(kWriters, [](int who) {
+  std::vector<int> codes = s2s_test::RunInChildren(kWriters, [](int who) {
     for (int i = 1; i <= kRounds; ++i) {
       std::string n = std::to_string(i), name = std::to_string(who);
       auto h = MakeHash({{"clientID", ("c" + n).c_str()},

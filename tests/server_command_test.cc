@@ -1,7 +1,6 @@
 // The server's command handler refuses untrusted input before it acts.
 #include <sched.h>
 #include <sys/time.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -227,7 +226,7 @@ TEST_F(HookTest, ParallelSyncStartsForAFreeShareHaveOneWinner) {
   for (int r = 0; r < kRounds; ++r) shares.push_back("r" + std::to_string(r));
   DeclareShares(shares);
   for (const std::string& share : shares) {
-    std::vector<int> codes = s2s_test::RaceChildren(kRacers, [&](int i) {
+    std::vector<int> codes = s2s_test::RunInChildren(kRacers, [&](int i) {
       CommandFile cmd;
       cmd.command = "S2S_SyncStart";
       cmd.client_id = "racer" + std::to_string(i);
@@ -247,9 +246,7 @@ TEST_F(HookTest, ParallelSyncStartsForAFreeShareHaveOneWinner) {
 // Runs in a private IPC namespace, so that the held lock blocks no other
 // root's test. The child's exit code names the first failed step.
 TEST_F(HookTest, HeldLockTimesOutAndLateCommandsAreNotApplied) {
-  pid_t pid = fork();
-  ASSERT_GE(pid, 0);
-  if (pid == 0) {
+  int code = s2s_test::RunInChildren(1, [&](int) {
     if (unshare(CLONE_NEWIPC) != 0 &&
         unshare(CLONE_NEWUSER | CLONE_NEWIPC) != 0) {
       _exit(77);
@@ -294,16 +291,12 @@ TEST_F(HookTest, HeldLockTimesOutAndLateCommandsAreNotApplied) {
         Has(Registry(), "TASK_t1")) {
       _exit(15);
     }
-    _exit(run(30) == kOk && Has(Registry(), "TASK_t1") ? 0 : 16);
-  }
-  int st = 0;
-  ASSERT_EQ(pid, waitpid(pid, &st, 0));
-  ASSERT_TRUE(WIFEXITED(st));
-  if (WEXITSTATUS(st) == 77) {
+    return run(30) == kOk && Has(Registry(), "TASK_t1") ? 0 : 16;
+  })[0];
+  if (code == 77)
     GTEST_SKIP() << "no private IPC namespace (unshare needs CAP_SYS_ADMIN or "
                     "user namespaces)";
-  }
-  EXPECT_EQ(0, WEXITSTATUS(st)) << "failed step (see the child's codes)";
+  EXPECT_EQ(0, code) << "failed step (see the child's codes)";
 }
 
 }  // namespace

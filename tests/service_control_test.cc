@@ -7,7 +7,6 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -330,23 +329,19 @@ class ServiceControlTest : public s2s_test::S2sdTest {
   // result, or 100 + the client's status when no reply came.
   int AddAsNobody() {
     const passwd* nobody = getpwnam("nobody");
-    pid_t child = fork();
-    if (child == 0) {
+    return s2s_test::RunInChildren(1, [&](int) -> int {
       if (nobody == nullptr ||
           setresgid(nobody->pw_gid, nobody->pw_gid, nobody->pw_gid) != 0 ||
           setresuid(nobody->pw_uid, nobody->pw_uid, nobody->pw_uid) != 0) {
-        _exit(10);
+        return 10;
       }
       PObject request = Action("add"), reply;
       request["task"] = ValidTask("intruder");
       std::string error;
       auto st = ControlClient(client_.path()).Call(request, reply, error);
-      _exit(st == ControlClient::kReplied ? reply["result"].asUInt64()
-                                          : 100 + st);
-    }
-    int status = 0;
-    waitpid(child, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+      return st == ControlClient::kReplied ? reply["result"].asUInt64()
+                                           : 100 + st;
+    })[0];
   }
 
   ControlClient client_;

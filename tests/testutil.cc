@@ -187,7 +187,7 @@ Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
   return c;
 }
 
-std::vector<int> RaceChildren(int n, const std::function<int(int)>& child) {
+std::vector<int> RunInChildren(int n, const std::function<int(int)>& child) {
   int go[2];
   if (pipe(go) != 0) return {};
   std::vector<pid_t> pids;

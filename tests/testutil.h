@@ -188,9 +188,9 @@ Child Spawn(const std::string& dir, const std::vector<std::string>& argv,
 Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
                  const std::vector<std::string>& env = {});
 
-// Forks `n` children, released at once, each exiting with `child`(its
-// index); their exit codes (-1: killed by a signal).
-std::vector<int> RaceChildren(int n, const std::function<int(int)>& child);
+// Runs `child`(i) in `n` forked processes released at once; their exit codes
+// (-1: killed by a signal).
+std::vector<int> RunInChildren(int n, const std::function<int(int)>& child);
 
 // Polls `done` every `every` s until it holds (true) or `seconds` passed.
 bool WaitUntil(const std::function<bool()>& done, double seconds,

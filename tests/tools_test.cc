@@ -1,12 +1,10 @@
 // The programs end to end: s2s-server runs a server root's rsync daemon on
 // loopback, s2s-client syncs client roots to it. What is checked is what a
 // person sees: exit codes, files, the registry, the password nowhere.
-#include <dirent.h>
 #include <fcntl.h>
 #include <pwd.h>
 #include <signal.h>
 #include <stdio.h>
-#include <stdlib.h>
 #include <sys/file.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
@@ -51,24 +49,19 @@ Child RunProgram(const std::string& dir, const std::vector<std::string>& argv,
   return c;
 }
 
-// The port a started server's last word names.
+// The port a started server's last word names, before its line break.
 std::string PortOf(const Child& start) {
-  std::string port = start.out.substr(start.out.rfind(' ') + 1);
-  port.pop_back();  // the line break
-  return port;
+  size_t at = start.out.rfind(' ') + 1;
+  return start.out.substr(at, start.out.size() - at - 1);
 }
 
 // The /proc/<pid>/`file` of every process now, by pid.
 std::vector<std::pair<pid_t, std::string>> AllProcs(const char* file) {
   std::vector<std::pair<pid_t, std::string>> out;
-  DIR* d = opendir("/proc");
-  while (dirent* e = d != nullptr ? readdir(d) : nullptr) {
-    if (e->d_name[0] >= '0' && e->d_name[0] <= '9') {
-      out.emplace_back(atoi(e->d_name), ReadFile(std::string("/proc/") +
-                                                 e->d_name + "/" + file));
-    }
+  for (const auto& e : std::filesystem::directory_iterator("/proc")) {
+    const std::string pid = e.path().filename();
+    if (isdigit(pid[0])) out.emplace_back(stoi(pid), ReadFile(e.path() / file));
   }
-  if (d != nullptr) closedir(d);
   return out;
 }
 
