@@ -94,8 +94,7 @@ TEST(Scheduler, EarliestFirstOncePerDueFollowsClockJumpsRetriesBackOff) {
 
   // A failed run's retries back off until they would pass the next run.
   now = At(2026, 3, 1, 23, 0);
-  const long expected[] = {60, 120, 240, 480, 960};
-  for (long delay : expected) {
+  for (long delay : {60, 120, 240, 480, 960}) {
     long at = s.ScheduleRetry(1, now);
     EXPECT_EQ(now + delay, at);
     EXPECT_EQ(at, s.Earliest());

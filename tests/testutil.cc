@@ -24,7 +24,6 @@
 #include <thread>
 
 #include "S2S/is_syncedshare_detail.h"
-#include "S2S/logger.h"
 #include "S2S/syslog_sink.h"
 #include "gtest/gtest.h"
 
@@ -270,14 +269,6 @@ void SyslogCapture::Clear() {
   std::lock_guard<std::mutex> lock(syslog_mutex);
   syslog_messages.clear();
   syslog_priorities.clear();
-}
-
-LogCapture::LogCapture(int level) {
-  S2S::Logger::Initialize(S2S::Logger::Syslog, level, "", 0);
-}
-
-LogCapture::~LogCapture() {
-  S2S::Logger::Initialize(S2S::Logger::Syslog, S2S::Logger::Error, "", 0);
 }
 
 bool UnixSocketPair(int fds[2]) {

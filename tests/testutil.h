@@ -13,6 +13,7 @@
 
 #include "S2S/channel.h"
 #include "S2S/is_syncedshare.h"
+#include "S2S/logger.h"
 
 namespace s2s_test {
 
@@ -54,8 +55,12 @@ class SyslogCapture : NoCopy {
 // its lifetime; afterwards the logger is back on the system log, errors only.
 class LogCapture : public SyslogCapture {
  public:
-  explicit LogCapture(int level = 7);
-  ~LogCapture();
+  explicit LogCapture(int level = 7) {
+    S2S::Logger::Initialize(S2S::Logger::Syslog, level, "", 0);
+  }
+  ~LogCapture() {
+    S2S::Logger::Initialize(S2S::Logger::Syslog, S2S::Logger::Error, "", 0);
+  }
 };
 
 // Two connected stream sockets: a Unix-domain socketpair, or a TCP
