@@ -49,6 +49,8 @@ class Appliances : NoCopy {
   S2S::SyncInfo Info() const;
   const std::string& user() const { return user_; }
   std::string DaemonLog() const { return daemon_.Log(); }
+  // The benchmarks' pulls and CPU counts go to it directly.
+  RsyncDaemon& daemon() { return daemon_; }
 
  private:
   struct Share {

@@ -99,6 +99,12 @@ void RecordSyslog(int priority, const char* format, va_list ap) {
 
 }  // namespace
 
+pid_t Exec(std::vector<std::string> args, int in, int out) {
+  pid_t pid = fork();
+  if (pid == 0) ExecChild(std::move(args), in, out, out, {});
+  return pid;
+}
+
 int ConnectLoopback(int port) {
   int fd = socket(AF_INET, SOCK_STREAM, 0);
   sockaddr_in addr = LoopbackAddr(port);

@@ -133,6 +133,7 @@ class RsyncDaemon : NoCopy {
   void Stop();
 
   int port() const { return port_; }
+  pid_t pid() const { return pid_; }
   // The daemon's log file so far.
   std::string Log() const;
 
@@ -171,6 +172,9 @@ class TempRoot : public TempDir {
   ScopedEnv env_;
 };
 
+// Starts `args` (looked up in PATH, no shell) with standard input `in` and
+// output and error `out` (-1: inherited); its pid, or -1.
+pid_t Exec(std::vector<std::string> args, int in, int out);
 // Runs `args` (in PATH, no shell), in and out on /dev/null; true on exit 0.
 bool RunQuiet(const std::vector<std::string>& args);
 
