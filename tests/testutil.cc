@@ -131,8 +131,7 @@ pid_t SpawnListening(
     std::vector<std::string> args = argv_for(*port);
     if (args.empty()) return -1;
     int fd = open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
-    pid_t pid = fork();
-    if (pid == 0) ExecChild(args, -1, fd, fd, {});
+    pid_t pid = Exec(args, -1, fd);
     if (fd >= 0) close(fd);
     if (pid < 0) return -1;
     bool exited = false;
@@ -413,8 +412,7 @@ std::string RegistryValue(const std::string& section, const std::string& key) {
 
 bool RunQuiet(const std::vector<std::string>& args) {
   int fd = open("/dev/null", O_RDWR | O_CLOEXEC);
-  pid_t pid = fork();
-  if (pid == 0) ExecChild(args, fd, fd, fd, {});
+  pid_t pid = Exec(args, fd, fd);
   close(fd);
   int status = 0;
   return pid > 0 && waitpid(pid, &status, 0) == pid && WIFEXITED(status) &&
