@@ -24,9 +24,8 @@ std::vector<std::string> Shell(const std::string& command) {
   return {"sh", "-c", "exec " + command};
 }
 
-// A CA; leaves signed by it carrying the name in the subject only ("cn",
-// whose file holds the chain), in the alternative names only ("san") and as a
-// wildcard ("wild"); a self-signed leaf ("self").
+// A CA signing leaves named in the subject ("cn", its file holding the chain),
+// the alternative names ("san") or by wildcard ("wild"); "self" signs itself.
 bool MakeCertificates(const s2s_test::TempDir& dir) {
   const std::string by_ca = " -CA ca.pem -CAkey ca.key";
   const std::string certs[][4] = {

@@ -1,7 +1,6 @@
-// Probing a server: which address answers, its version, and a probe nothing
-// answers. Pairing: an old server's single request, the share list for a
-// multi-source one, a second client's conflicts; a sync start's attributes
-// and when it falls back to the plain form.
+// Probing a server: the address that answers, its version, silence. Pairing
+// with old and multi-source servers, a second client's conflicts, and a sync
+// start's attributes with their plain fallback.
 #include <unistd.h>
 
 #include <atomic>

@@ -78,9 +78,8 @@ class ServerDaemonTest : public ::testing::Test {
                             "@127.0.0.1:" + std::to_string(daemon_.port()) +
                             "/";
     std::vector<std::string> argv = {"rsync"};
-    for (const std::string& a : args) {
-      argv.push_back(a[0] == '/' || a[0] == '-' ? a : url + a);  // module path
-    }
+    for (const std::string& a : args)  // all but files and options: modules
+      argv.push_back(a[0] == '/' || a[0] == '-' ? a : url + a);
     return s2s_test::RunProgram(tmp_.path(), argv,
                                 {"RSYNC_PASSWORD=" + std::string(password)})
         .code;

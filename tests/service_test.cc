@@ -321,9 +321,8 @@ TEST_F(ServiceTest, ScheduledRunsByThemselvesApartAndCatchUpOnceManualWaits) {
   EXPECT_EQ(5u, Request(Action("list"))["tasks"].asArray().size());
 }
 
-// A second run reuses the first's probe and pairing: per share a start,
-// transfer and end, then the task's end. A single-client server that forgot
-// its client refuses the reused session's start; the run pairs again.
+// A second run reuses the first's probe and pairing; a single-client server
+// that forgot its client refuses the reused session, and the run pairs again.
 TEST_F(ServiceTest, RunsSendOnlyNeededCommandsCancelCleanlyAndPairAgain) {
   StartDaemon();
   unsigned long long id =

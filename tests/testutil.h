@@ -68,9 +68,8 @@ class LogCapture : public SyslogCapture {
 bool UnixSocketPair(int fds[2]);
 bool TcpSocketPair(int fds[2]);
 
-// A channel of `capacity` bytes, `a`, on one end of a socket pair (Unix, or
-// TCP over loopback); the other end, `peer`, is the test's until Both()
-// opens channel `b` on it.
+// Channel `a` on one end of a socket pair (Unix, or TCP over loopback); the
+// other, `peer`, is the test's until Both() opens channel `b` on it.
 struct ChannelPair : NoCopy {
   explicit ChannelPair(unsigned int capacity, bool tcp = false);
   ~ChannelPair();

@@ -1,6 +1,5 @@
-// The programs end to end: s2s-server runs a server root's rsync daemon on
-// loopback, s2s-client syncs client roots to it. What is checked is what a
-// person sees: exit codes, files, the registry, the password nowhere.
+// s2s-server and s2s-client end to end, as a person sees them: exit codes,
+// files, the registry, and the password nowhere.
 #include <fcntl.h>
 #include <pwd.h>
 #include <signal.h>
@@ -379,9 +378,8 @@ TEST_F(ToolsTest, SyncsFailuresDryRunAndOperatorCommandsOnOneServer) {
   EXPECT_EQ("", ShareKey("docs", "RunningID"));
 }
 
-// A transfer cut by SIGTERM past half way leaves the sync unfinished; the
-// next run sends only what the server's kept part lacks. Then the delete
-// guard, and a full disk on the server, in rsync's words.
+// A transfer cut by SIGTERM past half way resumes from the part the server
+// kept; then the delete guard, and a full server disk in rsync's words.
 TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
   std::string client = MakeClient("client", "CLIENT-A");
   const double kSize = 24 << 20;
@@ -457,9 +455,8 @@ TEST_F(ToolsTest, CancelledTransferResumesDeletionsAreGuardedAFullDiskIsNamed) {
             {"share big: transfer failed: ", "No space left on device"});
 }
 
-// kill -9 of a client in mid-transfer, a beacon in flight: a second run is
-// refused while it holds the task's lock; its rsync runs end with it, the
-// server gets no file, and the next run clears what it left.
+// kill -9 of a client mid-transfer: while it lives a second run is refused;
+// its rsync runs end with it, and the next run clears what it left.
 TEST_F(ToolsTest, KilledClientLeavesNoRsyncRunningAndNoCommandFiles) {
   std::string client = MakeClient("client", "CLIENT-A");
   WriteBlob(client + "/volume1/big/blob", 16);
