@@ -243,6 +243,7 @@ void RealtimeSession::PushShare(const std::string& name,
       share.failed_step = "key";
       share.status = rc;
       share.cause = FailureText(rc);
+      held = false;
     }
   }
   // The share's end is reported even after a failure, so that the server
