@@ -187,6 +187,9 @@ bool IsDryRunReceiver(const std::vector<std::string>& args) {
 std::string UploadDir() { return KaroRootPath("/var/spool/s2s/upload"); }
 std::string ReplyDir() { return KaroRootPath("/var/spool/s2s/reply"); }
 
+const char kDaemonUserRule[] =
+    "1-64 of letters, digits and . _ - +, not . or ..";
+
 bool IsValidDaemonUser(const std::string& user) {
   return !user.empty() && user.size() <= 64 && user != "." && user != ".." &&
          user.find_first_not_of(

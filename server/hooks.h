@@ -65,6 +65,8 @@ std::string ReplyDir();
 // Whether `user` (RSYNC_USER_NAME) can name a reply directory: 1-64 of
 // letters, digits and "._-+", not "." or "..".
 bool IsValidDaemonUser(const std::string& user);
+// That rule in words, for messages to people.
+extern const char kDaemonUserRule[];
 // Where the reply to request `id` of daemon user `user` is written.
 std::string ReplyPath(const std::string& user, const std::string& id);
 // The request id of a command file's last line, requestID="<id>", or ""

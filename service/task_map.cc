@@ -179,9 +179,8 @@ std::string ServerSideProblem(const std::string& task_name,
     return "server name \"" + server_name + "\" is not a host name";
   }
   if (!user.empty() && !IsValidDaemonUser(user)) {
-    return "user \"" + user +
-           "\" would be refused by the server (1-64 of letters, digits and "
-           ". _ - +, not . or ..)";
+    return "user \"" + user + "\" would be refused by the server (" +
+           kDaemonUserRule + ")";
   }
   std::set<std::string> seen;
   for (const std::string& share : shares) {

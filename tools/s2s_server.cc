@@ -154,18 +154,21 @@ int ConfigInputs(const Args& a, std::string& handler, std::string& password) {
   return 0;
 }
 
-int Config(const Args& a, std::string handler = "", std::string password = "") {
+int WriteConfig(const Args& a, const std::string& handler,
+                const std::string& password) {
   std::string error;
-  if (password.empty()) {
-    int rc = ConfigInputs(a, handler, password);
-    if (rc != 0) return rc;
-  }
   if (!WriteServerConfig(handler, a.user, password, a.old_server, error)) {
     return Fail(error);
   }
   printf("config: daemon user %s, hooks run %s\n", a.user.c_str(),
          handler.c_str());
   return 0;
+}
+
+int Config(const Args& a) {
+  std::string handler, password;
+  int rc = ConfigInputs(a, handler, password);
+  return rc != 0 ? rc : WriteConfig(a, handler, password);
 }
 
 // After a change of the shares: the daemon configuration follows.
@@ -235,7 +238,7 @@ int Run(const Args& a) {
       printf("init: share %s\n", s.name.c_str());
     }
     printf("init: root %s ready\n", KaroRootPrefix());
-    return a.user.empty() ? Regenerate() : Config(a, handler, password);
+    return a.user.empty() ? Regenerate() : WriteConfig(a, handler, password);
   }
   if (a.command == "config" && !has_words) return Config(a);
   if (a.command == "start" && !has_words) {
@@ -398,6 +401,13 @@ int main(int argc, char** argv) {
         "no root: give --root DIR or set S2S_ROOT (--root / for "
         "the real one)");
   }
+  if (a.command == "config" && a.user.empty()) {
+    return Usage("config needs --user USER");
+  }
+  if (!a.user.empty() && !S2S::server::IsValidDaemonUser(a.user)) {
+    return Usage("bad daemon user " + a.user + " (" +
+                 S2S::server::kDaemonUserRule + ")");
+  }
   // The daemon's configuration names paths under the root, and the daemon
   // runs elsewhere: a relative root is made absolute here.
   std::error_code ec;
@@ -416,13 +426,6 @@ int main(int argc, char** argv) {
     if (a.command == "init" && !MakeDirs(absolute, error)) return Fail(error);
     int lock = open(absolute.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
     if (lock >= 0) flock(lock, LOCK_EX);
-  }
-  if (a.command == "config" && a.user.empty()) {
-    return Usage("config needs --user USER");
-  }
-  if (!a.user.empty() && !S2S::server::IsValidDaemonUser(a.user)) {
-    return Usage("bad daemon user " + a.user +
-                 " (1-64 of letters, digits and . _ - +, not . or ..)");
   }
   if (a.command == "ssh-setup" && (a.user.empty() || a.ssh.key_file.empty())) {
     return Usage("ssh-setup: --user USER --key-file FILE");
