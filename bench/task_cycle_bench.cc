@@ -8,6 +8,8 @@
 //     the version query, a probe and so without -v, against the same pull
 //     without -v; and against a tiny bare push to that module.
 //     BM_CommandVsFloor runs them in turn and reports the ratios;
+//     every bare rsync runs through the client's own runner, as a command's
+//     rsync does, and the pull once more as a plain fork and exec (below);
 //     BM_CommandCpuVsFloor compares the CPU time behind each, which the
 //     machine's load does not stretch;
 //   - a full task cycle (probe, pair, start, RunSync, finish share and task)
@@ -18,6 +20,15 @@
 //   - RunSync alone on the re-sync.
 // Every bare rsync's output goes through a pipe that is read to its end, as
 // the wrapper reads it.
+// At the end of a pull, rsync's client signals its receiver and polls for
+// its end in 20 ms sleeps; it pays no sleep only when the receiver was
+// asleep, is woken on the parent's CPU and runs first. That is decided by
+// where the two processes happen to run, which even how the caller starts
+// and waits for rsync tips: started as the client starts it (a session of
+// its own, waiting for the exec, polling), a bare pull pays the sleep as a
+// command does; started by a plain fork and exec and a blocking read, it
+// escapes it in most runs on a 2-core machine. "plain_floor_ms" shows that
+// second pull.
 // The bare pushes of the tree go to a second share whose sync the client
 // holds open, so that both pass the daemon's same guard hook.
 #include <benchmark/benchmark.h>
@@ -38,6 +49,7 @@
 #include "S2S/rsyncer.h"
 #include "appliances.h"
 #include "karo/rsync_wrapper.h"
+#include "rsync_child.h"
 
 extern char** environ;
 
@@ -147,8 +159,15 @@ struct Bench {
   }
 
   // Runs rsync with `args` and the password in its environment only, its
-  // output read to the end and dropped.
-  int Rsync(const std::vector<std::string>& args) {
+  // output read to the end and dropped: through the client's runner, or
+  // `plain`ly by a fork and exec and a blocking read.
+  int Rsync(const std::vector<std::string>& args, bool plain = false) {
+    if (!plain) {
+      std::vector<std::string> a = args;
+      a.insert(a.begin(), "rsync");
+      return KARO::Backup::detail::RunRsync(a, app.Info().GetPassword(), {})
+          .status;
+    }
     std::vector<std::string> env_store = {"RSYNC_PASSWORD=" +
                                           app.Info().GetPassword()};
     for (char** e = environ; *e != nullptr; ++e) env_store.push_back(*e);
@@ -207,7 +226,7 @@ struct Bench {
   // without hooks, with an early input, into a fresh place. A probe's
   // commands run without -v, which changes how often rsync's client waits
   // 20 ms for its receiver at the end.
-  bool FloorPull(bool verbose = true) {
+  bool FloorPull(bool verbose = true, bool plain = false) {
     std::string dest = app.client_root() + "/pulled";
     std::filesystem::remove_all(dest);
     std::vector<std::string> args = Transport(60);
@@ -215,7 +234,7 @@ struct Bench {
     args.insert(args.end(),
                 {"--early-input=" + early, "--max-size=1048576", "--info=skip1",
                  "--", base + "floor/tiny", dest + "/"});
-    return Rsync(args) == 0;
+    return Rsync(args, plain) == 0;
   }
 
   // The push floor: one tiny file into the module without hooks.
@@ -281,11 +300,14 @@ void BM_VersionRoundTrip(benchmark::State& state) {
   }
 }
 
+// state.range(0): 1 for the plain pull.
 void BM_BarePullFloor(benchmark::State& state) {
   Bench& b = TheBench();
   if (!b.ok) return state.SkipWithError("no server");
   for (auto _ : state) {
-    if (!b.FloorPull()) return state.SkipWithError("pull failed");
+    if (!b.FloorPull(true, state.range(0) == 1)) {
+      return state.SkipWithError("pull failed");
+    }
   }
 }
 
@@ -297,20 +319,21 @@ void BM_BareTinyPush(benchmark::State& state) {
   }
 }
 
-// A floor pull, a beacon, a floor pull without -v, a version query and a
-// tiny push in turn, so that all see the same load: the time is the
-// beacon's, "floor_ms" the pull's, "push_ms" the push's, "ratio" and
-// "push_ratio" the beacon's over each, "version_ratio" the query's (a
-// command that writes no registry, so no fsync) over the pull without -v,
-// "quiet_floor_ms". With one iteration per repetition, the median of a
-// ratio is the median pair's.
+// A floor pull, a beacon, a floor pull without -v, a version query, a tiny
+// push and a plain floor pull in turn, so that all see the same load: the
+// time is the beacon's, "floor_ms" the pull's, "push_ms" the push's,
+// "ratio" and "push_ratio" the beacon's over each, "version_ratio" the
+// query's (a command that writes no registry, so no fsync) over the pull
+// without -v, "quiet_floor_ms"; "plain_ratio" the beacon's over the plain
+// pull. With one iteration per repetition, the median of a ratio is the
+// median pair's.
 void BM_CommandVsFloor(benchmark::State& state) {
   using Clock = std::chrono::steady_clock;
   Bench& b = TheBench();
   if (!b.ok) return state.SkipWithError("no server");
   S2S::Rsyncer r;
   if (r.Initialize(b.app.Info()) != 0) return state.SkipWithError("probe");
-  double command = 0, floor = 0, push = 0, version = 0, quiet = 0;
+  double command = 0, floor = 0, push = 0, version = 0, quiet = 0, plain = 0;
   auto seconds = [](Clock::time_point from, Clock::time_point to) {
     return std::chrono::duration<double>(to - from).count();
   };
@@ -331,11 +354,14 @@ void BM_CommandVsFloor(benchmark::State& state) {
     auto t4 = Clock::now();
     if (!b.TinyPush()) return state.SkipWithError("push failed");
     auto t5 = Clock::now();
+    if (!b.FloorPull(true, true)) return state.SkipWithError("pull failed");
+    auto t6 = Clock::now();
     floor += seconds(t0, t1);
     command += seconds(t1, t2);
     quiet += seconds(t2, t3);
     version += seconds(t3, t4);
     push += seconds(t4, t5);
+    plain += seconds(t5, t6);
     state.SetIterationTime(seconds(t1, t2));
   }
   state.counters["floor_ms"] = floor * 1e3 / state.iterations();
@@ -345,6 +371,8 @@ void BM_CommandVsFloor(benchmark::State& state) {
   state.counters["ratio"] = command / floor;
   state.counters["push_ratio"] = command / push;
   state.counters["version_ratio"] = version / quiet;
+  state.counters["plain_floor_ms"] = plain * 1e3 / state.iterations();
+  state.counters["plain_ratio"] = command / plain;
 }
 
 // The CPU time behind a floor pull and behind a beacon, 20 of each per
@@ -448,6 +476,8 @@ BENCHMARK(BM_VersionRoundTrip)
     ->Repetitions(30)
     ->ReportAggregatesOnly(true);
 BENCHMARK(BM_BarePullFloor)
+    ->Arg(0)
+    ->Arg(1)
     ->UseRealTime()
     ->Unit(benchmark::kMillisecond)
     ->Iterations(1)
