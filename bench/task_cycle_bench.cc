@@ -26,9 +26,9 @@
 // where the two processes happen to run, which even how the caller starts
 // and waits for rsync tips: started as the client starts it (a session of
 // its own, waiting for the exec, polling), a bare pull pays the sleep as a
-// command does; started by a plain fork and exec and a blocking read, it
-// escapes it in most runs on a 2-core machine. "plain_floor_ms" shows that
-// second pull.
+// command does; started by a plain fork and exec and a blocking read, back
+// to back, it escaped it in most runs on a 2-core machine
+// (BM_BarePullFloor/1). "plain_floor_ms" is that pull between the others.
 // The bare pushes of the tree go to a second share whose sync the client
 // holds open, so that both pass the daemon's same guard hook.
 #include <benchmark/benchmark.h>
