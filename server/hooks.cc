@@ -187,6 +187,28 @@ bool IsDryRunReceiver(const std::vector<std::string>& args) {
 std::string UploadDir() { return KaroRootPath("/var/spool/s2s/upload"); }
 std::string ReplyDir() { return KaroRootPath("/var/spool/s2s/reply"); }
 
+namespace {
+
+// `path` and its missing parents, 0755 whatever the daemon's umask.
+void MakeDirs(const std::string& path) {
+  for (size_t slash = path.find('/', 1);; slash = path.find('/', slash + 1)) {
+    std::string dir = path.substr(0, slash);
+    if (mkdir(dir.c_str(), 0755) == 0) chmod(dir.c_str(), 0755);
+    if (slash == std::string::npos) return;
+  }
+}
+
+// The spool as the server's configuration made it. Someone may have
+// removed it since (a clean-up by hand, a restored volume); without it no
+// command would be answered, and no large one uploaded, until the server's
+// configuration was written again.
+void MakeSpoolDirs() {
+  MakeDirs(UploadDir());
+  MakeDirs(ReplyDir());
+}
+
+}  // namespace
+
 const char kDaemonUserRule[] =
     "1-64 of letters, digits and . _ - +, not . or ..";
 
@@ -253,7 +275,12 @@ int CommandHook(const HookEnv& env, bool old_server, FILE* in,
   // One reply directory per daemon user, which is all that user's pulls
   // can reach: the command module's path names it.
   std::string dir = ReplyDir() + "/" + env.user;
-  if (mkdir(dir.c_str(), 0700) != 0 && errno != EEXIST) {
+  int made = mkdir(dir.c_str(), 0700);
+  if (made != 0 && errno == ENOENT) {
+    MakeSpoolDirs();
+    made = mkdir(dir.c_str(), 0700);
+  }
+  if (made != 0 && errno != EEXIST) {
     LOG_ERROR("cannot create %s: %s", dir.c_str(), strerror(errno));
     return 1;
   }
@@ -298,6 +325,7 @@ int CleanUpAfterConnection(const HookEnv& env, const std::string& id) {
     if ((p.revents & POLLIN) == 0) _exit(0);
   }
   RemoveCommandFiles(env.user, id);
+  MakeSpoolDirs();
   PruneStale(UploadDir());
   // The users' directories stay: a reply may be on its way into one.
   ForEachEntry(ReplyDir(), [](const std::string& path, const struct stat& st) {

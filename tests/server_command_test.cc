@@ -199,6 +199,13 @@ TEST_F(HookTest, AnUploadedCommandRunsAndTheCleanupRemovesUploadAndReply) {
   EXPECT_TRUE(std::filesystem::is_empty(UploadDir()));
 }
 
+TEST_F(HookTest, ARemovedSpoolIsMadeAgainByTheNextCommand) {
+  std::filesystem::remove_all(tmp_.Path("/var/spool/s2s"));
+  EXPECT_EQ(0, Status(Cmd("S2S_GetProtocolVer"), "r"));
+  for (const std::string& dir : {UploadDir(), ReplyDir()})
+    EXPECT_EQ(0755, s2s_test::Mode(dir)) << dir;
+}
+
 TEST_F(HookTest, ClientIdStaysWithItsDaemonUserAndALostRegistryStaysLost) {
   DeclareShares({"s"});
   const std::string pair =
