@@ -200,8 +200,8 @@ void MakeDirs(const std::string& path) {
 
 // The spool as the server's configuration made it. Someone may have
 // removed it since (a clean-up by hand, a restored volume); without it no
-// command would be answered, and no large one uploaded, until the server's
-// configuration was written again.
+// command would be answered until the server's configuration was written
+// again.
 void MakeSpoolDirs() {
   MakeDirs(UploadDir());
   MakeDirs(ReplyDir());
@@ -325,7 +325,9 @@ int CleanUpAfterConnection(const HookEnv& env, const std::string& id) {
     if ((p.revents & POLLIN) == 0) _exit(0);
   }
   RemoveCommandFiles(env.user, id);
-  MakeSpoolDirs();
+  // An upload directory removed on its own is made again; a spool removed
+  // as a whole (a purge while this waited) stays removed.
+  if (access(ReplyDir().c_str(), F_OK) == 0) MakeDirs(UploadDir());
   PruneStale(UploadDir());
   // The users' directories stay: a reply may be on its way into one.
   ForEachEntry(ReplyDir(), [](const std::string& path, const struct stat& st) {
