@@ -147,6 +147,15 @@ int RunCommand(const std::string& text, const std::string& id,
   return HandleCommand(cmd, ctx, answer);
 }
 
+// `path` and its missing parents, 0755 whatever the daemon's umask.
+void MakeDirs(const std::string& path) {
+  for (size_t slash = path.find('/', 1);; slash = path.find('/', slash + 1)) {
+    std::string dir = path.substr(0, slash);
+    if (mkdir(dir.c_str(), 0755) == 0) chmod(dir.c_str(), 0755);
+    if (slash == std::string::npos) return;
+  }
+}
+
 }  // namespace
 
 HookEnv HookEnv::FromEnvironment() {
@@ -186,28 +195,6 @@ bool IsDryRunReceiver(const std::vector<std::string>& args) {
 
 std::string UploadDir() { return KaroRootPath("/var/spool/s2s/upload"); }
 std::string ReplyDir() { return KaroRootPath("/var/spool/s2s/reply"); }
-
-namespace {
-
-// `path` and its missing parents, 0755 whatever the daemon's umask.
-void MakeDirs(const std::string& path) {
-  for (size_t slash = path.find('/', 1);; slash = path.find('/', slash + 1)) {
-    std::string dir = path.substr(0, slash);
-    if (mkdir(dir.c_str(), 0755) == 0) chmod(dir.c_str(), 0755);
-    if (slash == std::string::npos) return;
-  }
-}
-
-// The spool as the server's configuration made it. Someone may have
-// removed it since (a clean-up by hand, a restored volume); without it no
-// command would be answered until the server's configuration was written
-// again.
-void MakeSpoolDirs() {
-  MakeDirs(UploadDir());
-  MakeDirs(ReplyDir());
-}
-
-}  // namespace
 
 const char kDaemonUserRule[] =
     "1-64 of letters, digits and . _ - +, not . or ..";
@@ -277,7 +264,11 @@ int CommandHook(const HookEnv& env, bool old_server, FILE* in,
   std::string dir = ReplyDir() + "/" + env.user;
   int made = mkdir(dir.c_str(), 0700);
   if (made != 0 && errno == ENOENT) {
-    MakeSpoolDirs();
+    // Someone removed the spool since the configuration made it (by hand,
+    // a restored volume): made again, or no command would be answered
+    // until the configuration was written again.
+    MakeDirs(UploadDir());
+    MakeDirs(ReplyDir());
     made = mkdir(dir.c_str(), 0700);
   }
   if (made != 0 && errno != EEXIST) {
